@@ -1,0 +1,13 @@
+# Everything that is linked from outside, found once. scripts/setup installs the packages.
+find_package(Threads REQUIRED)
+find_package(PkgConfig REQUIRED)
+find_package(ZLIB REQUIRED)
+find_package(OpenSSL 3 REQUIRED)
+pkg_check_modules(SYSTEMD REQUIRED IMPORTED_TARGET libsystemd)
+pkg_check_modules(CURL REQUIRED IMPORTED_TARGET libcurl)
+pkg_check_modules(SECCOMP REQUIRED IMPORTED_TARGET libseccomp)
+pkg_check_modules(CBOR REQUIRED IMPORTED_TARGET libcbor)
+if(TARNEL_BUILD_TESTS)
+  enable_testing()
+  find_package(GTest REQUIRED)
+endif()

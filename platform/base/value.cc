@@ -1,0 +1,382 @@
+#include "platform/base/value.h"
+
+#include <array>
+#include <charconv>
+#include <chrono>
+#include <cmath>
+#include <ctime>
+#include <limits>
+
+namespace tarnel {
+namespace {
+
+const std::vector<Value>& noValues() {
+  static const std::vector<Value> none;
+  return none;
+}
+
+bool isBlank(char c) {
+  return c == ' ' || (c >= '\t' && c <= '\r');
+}
+
+std::string_view skipBlanks(std::string_view text) {
+  while (!text.empty() && isBlank(text.front())) text.remove_prefix(1);
+  return text;
+}
+
+int64_t leadingInteger(std::string_view text) {
+  text = skipBlanks(text);
+  if (text.starts_with('+')) text.remove_prefix(1);
+  int64_t result = 0;
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), result);
+  if (error == std::errc::result_out_of_range) {
+    return text.starts_with('-') ? std::numeric_limits<int64_t>::min() : std::numeric_limits<int64_t>::max();
+  }
+  return error == std::errc{} ? result : 0;
+}
+
+double leadingReal(std::string_view text) {
+  text = skipBlanks(text);
+  if (text.starts_with('+')) text.remove_prefix(1);
+  double result = 0;
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), result);
+  return error == std::errc{} ? result : 0;
+}
+
+int64_t saturated(double value) {
+  constexpr double kLimit = 9223372036854775808.0;  // 2^63
+  if (std::isnan(value)) return 0;
+  if (value >= kLimit) return std::numeric_limits<int64_t>::max();
+  if (value < -kLimit) return std::numeric_limits<int64_t>::min();
+  return static_cast<int64_t>(value);
+}
+
+void appendQuoted(std::string& out, std::string_view text) {
+  out += '"';
+  for (const char c : text) {
+    if (c == '"' || c == '\\') {
+      out += '\\';
+      out += c;
+    } else if (c == '\n') {
+      out += "\\n";
+    } else {
+      out += c;
+    }
+  }
+  out += '"';
+}
+
+template <class Number>
+std::string decimal(Number number) {
+  std::array<char, 40> buffer{};
+  const auto [end, error] = std::to_chars(buffer.data(), buffer.data() + buffer.size(), number);
+  return error == std::errc{} ? std::string(buffer.data(), end) : std::string();
+}
+
+void appendInside(std::string& out, const Value& value) {
+  if (const auto* text = value.string()) {
+    appendQuoted(out, *text);
+  } else {
+    out += value.description();
+  }
+}
+
+std::string hexText(const Data& data) {
+  static constexpr std::string_view kDigits = "0123456789abcdef";
+  std::string out = "<";
+  for (const uint8_t byte : data) {
+    out += kDigits[byte >> 4U];
+    out += kDigits[byte & 15U];
+  }
+  return out + '>';
+}
+
+}  // namespace
+
+Array::Array(std::initializer_list<Value> values) {
+  values_.write().assign(values.begin(), values.end());
+}
+
+size_t Array::size() const noexcept {
+  return values_.get() == nullptr ? 0 : values_.get()->size();
+}
+
+const Value& Array::operator[](size_t index) const {
+  return (*values_.get())[index];
+}
+
+const Value* Array::begin() const noexcept {
+  return values_.get() == nullptr ? noValues().data() : values_.get()->data();
+}
+
+const Value* Array::end() const noexcept {
+  return begin() + size();
+}
+
+void Array::append(Value value) {
+  values_.write().push_back(std::move(value));
+}
+
+void Array::reserve(size_t count) {
+  values_.write().reserve(count);
+}
+
+std::span<Value> Array::mutableValues() {
+  return values_.write();
+}
+
+bool operator==(const Array& a, const Array& b) {
+  return a.values_.sharesValueWith(b.values_) || std::equal(a.begin(), a.end(), b.begin(), b.end());
+}
+
+Dictionary::Dictionary(std::initializer_list<Entry> entries) {
+  reserve(entries.size());
+  for (const auto& [key, value] : entries) set(key, value);
+}
+
+size_t Dictionary::size() const noexcept {
+  return storage_.get() == nullptr ? 0 : storage_.get()->entries.size();
+}
+
+const Dictionary::Entry* Dictionary::begin() const noexcept {
+  return storage_.get() == nullptr ? nullptr : storage_.get()->entries.data();
+}
+
+const Dictionary::Entry* Dictionary::end() const noexcept {
+  return storage_.get() == nullptr ? nullptr : begin() + storage_.get()->entries.size();
+}
+
+const Dictionary::Entry* Dictionary::findIn(const Storage& storage, std::string_view key) {
+  if (!storage.index.empty()) {
+    const auto found = storage.index.find(std::string(key));
+    return found == storage.index.end() ? nullptr : &storage.entries[found->second];
+  }
+  for (const auto& entry : storage.entries) {
+    if (entry.first == key) return &entry;
+  }
+  return nullptr;
+}
+
+void Dictionary::rebuildIndex(Storage& storage) {
+  storage.index.clear();
+  if (storage.entries.size() <= kIndexThreshold) return;
+  storage.index.reserve(storage.entries.size() * 2);
+  for (size_t i = 0; i < storage.entries.size(); ++i) storage.index.emplace(storage.entries[i].first, i);
+}
+
+const Value* Dictionary::find(std::string_view key) const {
+  if (storage_.get() == nullptr) return nullptr;
+  const auto* entry = findIn(*storage_.get(), key);
+  return entry == nullptr ? nullptr : &entry->second;
+}
+
+void Dictionary::set(std::string_view key, Value value) {
+  auto& storage = storage_.write();
+  if (const auto* entry = findIn(storage, key)) {
+    storage.entries[static_cast<size_t>(entry - storage.entries.data())].second = std::move(value);
+    return;
+  }
+  storage.entries.emplace_back(key, std::move(value));
+  if (!storage.index.empty()) {
+    storage.index.emplace(key, storage.entries.size() - 1);
+  } else if (storage.entries.size() > kIndexThreshold) {
+    rebuildIndex(storage);
+  }
+}
+
+void Dictionary::merge(const Dictionary& other) {
+  if (other.empty()) return;
+  if (empty()) {
+    *this = other;
+    return;
+  }
+  const Dictionary source = other;  // stays whole when other is this very dictionary
+  reserve(size() + source.size());
+  for (const auto& [key, value] : source) set(key, value);
+}
+
+bool Dictionary::remove(std::string_view key) {
+  if (find(key) == nullptr) return false;
+  auto& storage = storage_.write();
+  const auto position = findIn(storage, key) - storage.entries.data();
+  storage.entries.erase(storage.entries.begin() + position);
+  rebuildIndex(storage);
+  return true;
+}
+
+void Dictionary::editEntries(const std::function<bool(const std::string& key, Value& value)>& visit) {
+  if (empty()) return;
+  auto& storage = storage_.write();
+  const auto gone =
+      std::erase_if(storage.entries, [&visit](Entry& entry) { return !visit(entry.first, entry.second); });
+  if (gone != 0) rebuildIndex(storage);
+}
+
+void Dictionary::reserve(size_t count) {
+  storage_.write().entries.reserve(count);
+}
+
+bool operator==(const Dictionary& a, const Dictionary& b) {
+  if (a.storage_.sharesValueWith(b.storage_)) return true;
+  if (a.size() != b.size()) return false;
+  for (const auto& [key, value] : a) {
+    const auto* other = b.find(key);
+    if (other == nullptr || !(*other == value)) return false;
+  }
+  return true;
+}
+
+int64_t Value::int64Value() const noexcept {
+  switch (type()) {
+    case Type::boolean:
+      return *boolean() ? 1 : 0;
+    case Type::integer:
+      return *integer();
+    case Type::unsignedInteger:
+      return static_cast<int64_t>(*unsignedInteger());
+    case Type::real:
+      return saturated(*real());
+    case Type::string:
+      return leadingInteger(*string());
+    default:
+      return 0;
+  }
+}
+
+uint64_t Value::uint64Value() const noexcept {
+  return static_cast<uint64_t>(int64Value());
+}
+
+double Value::doubleValue() const noexcept {
+  switch (type()) {
+    case Type::boolean:
+      return *boolean() ? 1 : 0;
+    case Type::integer:
+      return static_cast<double>(*integer());
+    case Type::unsignedInteger:
+      return static_cast<double>(*unsignedInteger());
+    case Type::real:
+      return *real();
+    case Type::string:
+      return leadingReal(*string());
+    default:
+      return 0;
+  }
+}
+
+bool Value::boolValue() const noexcept {
+  if (type() == Type::real) return *real() != 0;
+  const auto* held = string();
+  if (held == nullptr) return int64Value() != 0;
+  auto text = skipBlanks(*held);
+  if (text.starts_with('+') || text.starts_with('-')) text.remove_prefix(1);
+  while (text.starts_with('0')) text.remove_prefix(1);
+  return !text.empty() && std::string_view("YyTt123456789").find(text.front()) != std::string_view::npos;
+}
+
+std::string Value::description() const {
+  switch (type()) {
+    case Type::null:
+      return "(null)";
+    case Type::boolean:
+      return *boolean() ? "1" : "0";
+    case Type::integer:
+      return decimal(*integer());
+    case Type::unsignedInteger:
+      return decimal(*unsignedInteger());
+    case Type::real:
+      return decimal(*real());
+    case Type::date:
+      return tarnel::description(*date());
+    case Type::string:
+      return *string();
+    case Type::data:
+      return hexText(*data());
+    case Type::array:
+      return tarnel::description(*array());
+    case Type::dictionary:
+      return tarnel::description(*dictionary());
+  }
+  return {};
+}
+
+std::string description(const Dictionary& dictionary) {
+  std::string out = "{";
+  for (const auto& [key, value] : dictionary) {
+    if (out.size() > 1) out += ", ";
+    appendQuoted(out, key);
+    out += ": ";
+    appendInside(out, value);
+  }
+  return out + '}';
+}
+
+std::string description(const Array& array) {
+  std::string out = "[";
+  for (const auto& value : array) {
+    if (out.size() > 1) out += ", ";
+    appendInside(out, value);
+  }
+  return out + ']';
+}
+
+std::string description(Date date) {
+  constexpr double kLastSecondOfYear9999 = 253402300799.0;
+  constexpr double kFirstSecondOfYear0 = -62167219200.0;
+  if (!(date.seconds >= kFirstSecondOfYear0 && date.seconds <= kLastSecondOfYear9999))
+    return decimal(date.seconds);
+  const auto whole = static_cast<std::time_t>(std::floor(date.seconds));
+  std::tm parts{};
+  gmtime_r(&whole, &parts);
+  std::array<char, 40> buffer{};
+  const auto length = std::strftime(buffer.data(), buffer.size(), "%Y-%m-%d %H:%M:%S +0000", &parts);
+  return {buffer.data(), length};
+}
+
+bool isValidUtf8(std::string_view text) noexcept {
+  const auto byteAt = [&text](size_t i) { return static_cast<uint8_t>(text[i]); };
+  for (size_t i = 0; i < text.size();) {
+    const uint8_t lead = byteAt(i);
+    if (lead < 0x80) {
+      ++i;
+      continue;
+    }
+    const size_t length = lead >= 0xF0 ? 4 : lead >= 0xE0 ? 3 : 2;
+    if (lead < 0xC2 || lead > 0xF4 || text.size() - i < length) return false;
+    const uint8_t second = byteAt(i + 1);
+    const uint8_t low = lead == 0xE0 ? 0xA0 : lead == 0xF0 ? 0x90 : 0x80;
+    const uint8_t high = lead == 0xED ? 0x9F : lead == 0xF4 ? 0x8F : 0xBF;
+    if (second < low || second > high) return false;
+    for (size_t k = 2; k < length; ++k) {
+      if ((byteAt(i + k) & 0xC0U) != 0x80) return false;
+    }
+    i += length;
+  }
+  return true;
+}
+
+double finiteOrMinusOne(double value) noexcept {
+  return std::isfinite(value) ? value : -1.0;
+}
+
+const std::string* findString(const Dictionary& dictionary, std::string_view key) {
+  const auto* value = dictionary.find(key);
+  return value == nullptr ? nullptr : value->string();
+}
+
+const Dictionary* findDictionary(const Dictionary& dictionary, std::string_view key) {
+  const auto* value = dictionary.find(key);
+  return value == nullptr ? nullptr : value->dictionary();
+}
+
+const Array* findArray(const Dictionary& dictionary, std::string_view key) {
+  const auto* value = dictionary.find(key);
+  return value == nullptr ? nullptr : value->array();
+}
+
+const Value* findNumber(const Dictionary& dictionary, std::string_view key) {
+  const auto* value = dictionary.find(key);
+  return value != nullptr && value->isNumber() ? value : nullptr;
+}
+
+}  // namespace tarnel

@@ -1,0 +1,17 @@
+#pragma once
+
+#include "platform/base/types.h"
+
+namespace tarnel {
+
+// The wall clock. Threads: any.
+class Clock {
+ public:
+  Clock() = default;
+  Clock(const Clock&) = delete;
+  Clock& operator=(const Clock&) = delete;
+  virtual ~Clock() = default;
+  virtual TimeValue timeOfDay() = 0;
+};
+
+}  // namespace tarnel

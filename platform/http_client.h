@@ -1,0 +1,71 @@
+#pragma once
+
+#include <chrono>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "platform/base/error.h"
+#include "platform/base/one_shot.h"
+
+namespace tarnel {
+
+struct HttpHeader {
+  std::string name;
+  std::string value;
+};
+
+struct HttpRequest {
+  std::string method = "GET";
+  std::string url;                          // http or https; anything else fails
+  std::vector<HttpHeader> headers;          // sent in this order, each once
+  std::shared_ptr<const std::string> body;  // absent: no body
+  // From start to the last byte of the answer. Absent: the caller sets none, and the client's own limits
+  // on connecting and on lack of progress end it.
+  std::optional<std::chrono::milliseconds> timeout;
+};
+
+struct HttpResponse {
+  int statusCode = 0;
+  std::vector<HttpHeader> headers;  // of the final answer, in order of arrival
+
+  // Value of the first header of that name, compared ignoring case; null when there is none.
+  const std::string* header(std::string_view name) const;
+};
+
+// What a completion gets. A transport failure sets only `error`; otherwise `response` and `data` (empty
+// when the body was) are set. A status such as 404 or 500 is an answer, no error.
+struct HttpResult {
+  std::optional<std::string> data;
+  std::optional<HttpResponse> response;
+  MaybeError error;
+};
+
+// The shared HTTP session of the process: TLS verified, http and https only, redirects followed within
+// these two and never from https to http, no cache, no cookies, answers bounded in size.
+//
+// Threads: any thread may call. Completions run on the client's own thread, exactly once each, also when
+// the client goes away; they must not block.
+class HttpClient {
+ public:
+  using Completion = OneShot<void(HttpResult)>;
+
+  HttpClient() = default;
+  HttpClient(const HttpClient&) = delete;
+  HttpClient& operator=(const HttpClient&) = delete;
+  virtual ~HttpClient() = default;
+
+  // Starts the request at once and returns.
+  virtual void startDataTask(HttpRequest request, Completion completion) = 0;
+};
+
+// Starts the request and holds the calling thread until it has ended. Never call it on the client's thread.
+HttpResult performAndWait(HttpClient& client, HttpRequest request);
+
+// Domain of the errors that a client reports for transport failures; the code is the library's own.
+inline constexpr char kHttpErrorDomain[] = "TarnelHTTPErrorDomain";
+
+}  // namespace tarnel

@@ -1,0 +1,19 @@
+#pragma once
+
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/base/log.h"
+
+namespace tarnel {
+
+enum class CompressionFormat { zlib, gzip };  // RFC 1950, RFC 1952
+
+// Compresses the whole input at zlib's default level. Nothing on failure (also for empty input), logged.
+std::optional<std::string> compressDataWithZlibOrGzip(Log& log, CompressionFormat format,
+                                                      std::string_view input);
+
+std::optional<std::string> gzipDeflate(Log& log, std::string_view input);
+
+}  // namespace tarnel

@@ -1,0 +1,40 @@
+#pragma once
+
+#include <string>
+
+#include "client/shared/consent_identifiers.h"
+#include "platform/base/log.h"
+#include "platform/client_bundle.h"
+#include "platform/clock.h"
+#include "platform/consent.h"
+#include "platform/device_information.h"
+#include "platform/file_system.h"
+#include "platform/http_client.h"
+#include "platform/keep_alive.h"
+#include "platform/locale_information.h"
+#include "platform/random.h"
+#include "platform/settings_store.h"
+#include "util/process_values.h"
+
+namespace tarnel {
+
+// Everything through which the agent, its sessions and their backends reach the world. Built once, in main
+// or in a test fixture; outlives all of them.
+struct Dependencies {
+  Log& log;
+  Clock& clock;
+  Random& random;
+  HttpClient& http;
+  DeviceInformation& deviceInformation;
+  SettingsStore& settings;
+  Consent& consent;
+  LocaleInformation& locale;
+  FileSystem& files;
+  ClientBundle& clientBundle;
+  KeepAlive& keepAlive;
+  ConsentIdentifiers& consentIdentifiers;
+  ProcessValues& process;
+  std::string messageLogDirectory;
+};
+
+}  // namespace tarnel

@@ -1,0 +1,54 @@
+#pragma once
+
+#include <cstdint>
+#include <mutex>
+#include <string>
+
+#include "platform/base/log.h"
+#include "platform/base/value.h"
+#include "platform/device_information.h"
+#include "platform/settings_store.h"
+
+namespace tarnel {
+
+// The environment whose section of a storebag applies.
+enum class EnvironmentType : uint32_t {
+  none = 0,
+  development = 1,
+  orvaneInternal = 2,
+  seed = 3,
+  release = 4
+};
+
+// Values that are computed once, on first use, and hold for the life of the process: later changes of the
+// settings or the device are not seen. Threads: any.
+class ProcessValues {
+ public:
+  // Kept by reference; must outlive this object.
+  ProcessValues(Log& log, DeviceInformation& deviceInformation, SettingsStore& settings);
+
+  // True when the device's "ReleaseType" equals "Internal".
+  bool isInternalBuild();
+  // Setting "environmentType", else 2 on an internal build and 3 elsewhere.
+  EnvironmentType currentEnvironmentType();
+  // Setting "tarnel_storebag_url"; nothing when it is not set.
+  const MaybeString& storebagURLOverride();
+
+ private:
+  EnvironmentType userDefaultsEnvironment();
+
+  Log& log_;
+  DeviceInformation& deviceInformation_;
+  SettingsStore& settings_;
+  std::once_flag internalBuildOnce_;
+  std::once_flag environmentOnce_;
+  std::once_flag storebagURLOnce_;
+  bool internalBuild_ = false;
+  EnvironmentType environment_ = EnvironmentType::none;
+  MaybeString storebagURL_;
+};
+
+// Domain of the daemon's own settings.
+inline constexpr char kTarnelSettingsDomain[] = "com.orvane.tarnel";
+
+}  // namespace tarnel
