@@ -31,14 +31,17 @@ class Browser {
     this.process = spawn(program, browserArguments(this.profileFolder),
                          {stdio: ['ignore', 'ignore', 'pipe', 'pipe', 'pipe'], detached: true});
     this.exited = new Promise((resolve) => {
-      this.process.once('error', (error) => resolve(`${program} cannot be started: ${error.message}`));
+      this.process.once('error', (error) => resolve(`${program} cannot be started (${error.message}): name an installed Chromium`));
       this.process.once('exit', (code, signal) => resolve(`the browser ended (${signal ?? code})`));
     });
-    this.exited.then((reason) => this.failAll(reason));
+    this.exited.then((reason) => {
+      this.gone = true;
+      this.fail(`${reason}\n${this.errorText}`.trimEnd());
+    });
     const [, , errors, input, output] = this.process.stdio;
     this.input = input;
     input.on('error', () => {});  // the exit handler tells why
-    errors.setEncoding('utf8').on('data', (text) => { this.errorText = (this.errorText + text).slice(-4000); });
+    errors.setEncoding('utf8').on('data', (text) => { this.errorText = (this.errorText + text).slice(-2000); });
     this.readMessages(output);
   }
 
@@ -60,17 +63,18 @@ class Browser {
     else waiting.resolve(message.result);
   }
 
-  failAll(reason) {
+  // Whatever waits for the browser, now or later, fails with the first reason given.
+  fail(reason) {
+    this.failure ??= reason;
     for (const {reject, timer} of this.pending.values()) {
       clearTimeout(timer);
-      reject(new Error(`${reason}\n${this.errorText}`.trimEnd()));
+      reject(new Error(this.failure));
     }
     this.pending.clear();
-    this.endReason = reason;
   }
 
   send(method, params = {}) {
-    if (this.endReason) return Promise.reject(new Error(`${this.endReason}\n${this.errorText}`.trimEnd()));
+    if (this.failure) return Promise.reject(new Error(this.failure));
     const id = ++this.lastID;
     return new Promise((resolve, reject) => {
       const timer = setTimeout(() => {
@@ -107,9 +111,8 @@ class Browser {
   }
 
   async close() {
-    if (!this.endReason) {
-      this.sessionId = undefined;
-      this.send('Browser.close').catch(() => {});
+    if (!this.gone) {
+      this.input.write(`${JSON.stringify({id: ++this.lastID, method: 'Browser.close'})}\0`);
       let timer;
       const limit = new Promise((resolve) => { timer = setTimeout(resolve, EXIT_LIMIT_MS); });
       await Promise.race([this.exited, limit]);

@@ -2,14 +2,13 @@
 
 // The figures that are taken over from the browser's statistics as they are, by the names they have there.
 
-const sentCommon = ['active', 'packetsSent', 'bytesSent', 'headerBytesSent', 'retransmittedPacketsSent', 'nackCount',
-                    'targetBitrate'];
+const sentCommon = ['packetsSent', 'bytesSent', 'retransmittedPacketsSent', 'nackCount', 'targetBitrate'];
 const receivedCommon = ['packetsReceived', 'bytesReceived', 'packetsLost', 'jitter', 'jitterBufferDelay',
                         'jitterBufferEmittedCount'];
 
 module.exports = {
   sent: {
-    audio: sentCommon,
+    audio: [...sentCommon, 'active', 'headerBytesSent'],
     video: [...sentCommon, 'framesEncoded', 'framesPerSecond', 'frameWidth', 'frameHeight', 'keyFramesEncoded', 'qpSum',
             'totalEncodeTime', 'pliCount', 'qualityLimitationReason'],
   },
@@ -21,7 +20,9 @@ module.exports = {
             'frameHeight', 'qpSum', 'freezeCount', 'totalFreezesDuration', 'nackCount', 'pliCount',
             'retransmittedPacketsReceived'],
   },
-  pair: ['currentRoundTripTime', 'availableOutgoingBitrate', 'packetsSent', 'packetsReceived', 'bytesSent',
-         'bytesReceived', 'packetsDiscardedOnSend', 'requestsSent', 'responsesReceived', 'writable'],
-  transport: ['dtlsState', 'iceRole', 'selectedCandidatePairChanges'],
+  pair: ['currentRoundTripTime', 'availableOutgoingBitrate', 'packetsDiscardedOnSend', 'requestsSent',
+         'responsesReceived', 'writable'],
+  // The two sides may send by different pairs; only the transport counts both directions.
+  transport: ['packetsSent', 'packetsReceived', 'bytesSent', 'bytesReceived', 'dtlsState', 'iceRole',
+              'selectedCandidatePairChanges'],
 };

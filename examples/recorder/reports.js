@@ -128,11 +128,14 @@ class Reports {
     }, Flag.realtime);
   }
 
-  muteChanged(time, muted) {
+  muteChanged(time, muted, {near, labels}) {
+    const stats = find(near, 'outbound-rtp', 'audio');
+    this.message('media', time, Category.audioSent, Type.muteChanged, {
+      userName: USER, muted, previouslyMuted: this.muted, byUser: true, changedAt: date(time),
+      callDuration: (time - this.connectedTime) / 1000, deviceLabel: labels.audio, sampleIndex: this.sampleIndex,
+      codec: byID(near, stats?.codecId)?.mimeType, packetsSent: stats?.packetsSent,
+    }, Flag.realtime);
     this.muted = muted;
-    this.message('media', time, Category.audioSent, Type.muteChanged,
-                 {userName: USER, muted, changedAt: date(time), byUser: true, sampleIndex: this.sampleIndex},
-                 Flag.realtime);
   }
 
   sent(sample, kind) {
@@ -140,7 +143,8 @@ class Reports {
     const stats = find(near, 'outbound-rtp', kind);
     const farStats = find(far, 'inbound-rtp', kind);
     return {
-      userName: USER, sampleIndex: this.sampleIndex, codec: byID(near, stats?.codecId)?.mimeType, muted: this.muted,
+      userName: USER, sampleIndex: this.sampleIndex, codec: byID(near, stats?.codecId)?.mimeType,
+      muted: kind === 'audio' ? this.muted : undefined,
       ...pick(stats, FIELDS.sent[kind]), ...pick(find(near, 'remote-inbound-rtp', kind), FIELDS.sentRemote),
       bitrateKbps: this.rates.growth(`${kind} bytes sent`, stats?.bytesSent) * 8 / 1000,
       farPacketsReceived: farStats?.packetsReceived, farPacketsLost: farStats?.packetsLost, farJitter: farStats?.jitter,
