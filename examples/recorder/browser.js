@@ -31,7 +31,8 @@ class Browser {
     this.process = spawn(program, browserArguments(this.profileFolder),
                          {stdio: ['ignore', 'ignore', 'pipe', 'pipe', 'pipe'], detached: true});
     this.exited = new Promise((resolve) => {
-      this.process.once('error', (error) => resolve(`${program} cannot be started (${error.message}): name an installed Chromium`));
+      this.process.once('error', (error) =>
+        resolve(`${program} cannot be started (${error.message}): name an installed Chromium`));
       this.process.once('exit', (code, signal) => resolve(`the browser ended (${signal ?? code})`));
     });
     this.exited.then((reason) => {
