@@ -1,0 +1,44 @@
+#pragma once
+
+#include <atomic>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+
+#include "platform/settings_store.h"
+
+namespace tarnel::fake {
+
+// In memory, one layer. Threads: any.
+class FakeSettingsStore final : public SettingsStore {
+ public:
+  // While true nothing can be read and nothing is kept.
+  std::atomic<bool> broken{false};
+
+  std::optional<Value> objectForKey(std::string_view domain, std::string_view key) override {
+    const std::lock_guard guard(mutex_);
+    const auto found = values_.find({std::string(domain), std::string(key)});
+    return broken || found == values_.end() ? std::nullopt : std::optional(found->second);
+  }
+  MaybeError setObject(std::string_view domain, std::string_view key, const Value& value) override {
+    if (broken) return Error("TarnelSettingsErrorDomain", 5, "the settings store is broken");
+    const std::lock_guard guard(mutex_);
+    values_[{std::string(domain), std::string(key)}] = value;
+    return std::nullopt;
+  }
+  MaybeError removeObject(std::string_view domain, std::string_view key) override {
+    if (broken) return Error("TarnelSettingsErrorDomain", 5, "the settings store is broken");
+    const std::lock_guard guard(mutex_);
+    values_.erase({std::string(domain), std::string(key)});
+    return std::nullopt;
+  }
+
+ private:
+  std::mutex mutex_;
+  std::map<std::pair<std::string, std::string>, Value> values_;
+};
+
+}  // namespace tarnel::fake

@@ -1,0 +1,47 @@
+#pragma once
+
+#include "client/shared/consent_identifiers.h"
+#include "platform/fake/fake_clock.h"
+#include "platform/fake/fake_device.h"
+#include "platform/fake/fake_file_system.h"
+#include "platform/fake/fake_http_client.h"
+#include "platform/fake/fake_log.h"
+#include "platform/fake/fake_random.h"
+#include "platform/fake/fake_settings_store.h"
+#include "util/dependencies.h"
+
+namespace tarnel::fake {
+
+// A whole world of fakes and the Dependencies made of them. A test changes the fakes and hands out
+// `dependencies`.
+struct FakeWorld {
+  FakeLog log;
+  FakeClock clock;
+  FakeRandom random;
+  FakeHttpClient http;
+  FakeDeviceInformation deviceInformation;
+  FakeSettingsStore settings;
+  FakeConsent consent;
+  FakeLocaleInformation locale;
+  FakeFileSystem files{clock};
+  FakeClientBundle clientBundle;
+  FakeKeepAlive keepAlive;
+  ConsentIdentifiers consentIdentifiers{settings, consent, random};
+  ProcessValues process{log, deviceInformation, settings};
+  Dependencies dependencies{.log = log,
+                            .clock = clock,
+                            .random = random,
+                            .http = http,
+                            .deviceInformation = deviceInformation,
+                            .settings = settings,
+                            .consent = consent,
+                            .locale = locale,
+                            .files = files,
+                            .clientBundle = clientBundle,
+                            .keepAlive = keepAlive,
+                            .consentIdentifiers = consentIdentifiers,
+                            .process = process,
+                            .messageLogDirectory = "/log/Retired"};
+};
+
+}  // namespace tarnel::fake
