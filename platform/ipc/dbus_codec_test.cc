@@ -235,25 +235,82 @@ TEST_F(DbusCodecTest, VariantsInsideVariantsCountAsDepth) {
   EXPECT_EQ(read.error().domain(), kErrorTooDeep);
 }
 
+// Bytes in the place of a text; the library checks only what is appended in one go.
+void appendBytes(sd_bus_message* m, std::string_view bytes) {
+  char* room = nullptr;
+  ASSERT_GE(sd_bus_message_append_string_space(m, bytes.size(), &room), 0);
+  bytes.copy(room, bytes.size());
+}
+
+void openEntry(sd_bus_message* m, std::string_view key, const char* variant) {
+  ASSERT_GE(sd_bus_message_open_container(m, 'a', "{sv}"), 0);
+  ASSERT_GE(sd_bus_message_open_container(m, 'e', "sv"), 0);
+  appendBytes(m, key);
+  ASSERT_GE(sd_bus_message_open_container(m, 'v', variant), 0);
+}
+
+void closeContainers(sd_bus_message* m, int count) {
+  for (int i = 0; i < count; ++i) ASSERT_GE(sd_bus_message_close_container(m), 0);
+}
+
 TEST_F(DbusCodecTest, TextThatIsNotUtf8IsRefusedWithItsPlace) {
-  const auto inValue = refusalOf("a{sv}", 1, "outer", "a{sv}", 1, "inner", "s", "\xFF\xFE");
-  EXPECT_EQ(inValue.domain(), kErrorInvalidArguments);
-  EXPECT_THAT(inValue.localizedDescription(), HasSubstr("not UTF-8"));
-  EXPECT_THAT(inValue.localizedDescription(), HasSubstr("key \"outer\", key \"inner\""));
-  const auto inKey = refusalOf("a{sv}", 1, "\xC0\xAF", "i", 1);
-  EXPECT_EQ(inKey.domain(), kErrorInvalidArguments);
-  EXPECT_THAT(inKey.localizedDescription(), HasSubstr("a key: the text is not UTF-8"));
-  EXPECT_THAT(refusalOf("a{sv}", 1, "l", "as", 2, "ok", "\xED\xA0\x80").localizedDescription(),
-              HasSubstr("key \"l\", element 1: the text is not UTF-8"));
-  EXPECT_THAT(refusalOf("a{sv}", 1, "l", "a{ss}", 1, "k", "\x80").localizedDescription(),
-              HasSubstr("key \"l\", key \"k\": the text is not UTF-8"));
+  const auto inValue = readDictionary(sendRaw([](sd_bus_message* m) {
+                                        openEntry(m, "outer", "a{sv}");
+                                        openEntry(m, "inner", "s");
+                                        appendBytes(m, "\xFF\xFE");
+                                        closeContainers(m, 6);
+                                      }).get());
+  ASSERT_FALSE(inValue);
+  EXPECT_EQ(inValue.error().domain(), kErrorInvalidArguments);
+  EXPECT_THAT(inValue.error().localizedDescription(),
+              HasSubstr("at key \"outer\", key \"inner\": the text is not UTF-8"));
+}
+
+TEST_F(DbusCodecTest, AKeyThatIsNotUtf8IsRefused) {
+  for (const std::string_view key : {"\xC0\xAF", "\xED\xA0\x80", "\x80", "\xF4\x90\x80\x80"}) {
+    const auto read = readDictionary(sendRaw([key](sd_bus_message* m) {
+                                       openEntry(m, key, "i");
+                                       sd_bus_message_append(m, "i", 1);
+                                       closeContainers(m, 3);
+                                     }).get());
+    ASSERT_FALSE(read);
+    EXPECT_EQ(read.error().domain(), kErrorInvalidArguments);
+    EXPECT_THAT(read.error().localizedDescription(), HasSubstr("a key: the text is not UTF-8"));
+  }
+}
+
+TEST_F(DbusCodecTest, TextsInTypedContainersAreCheckedToo) {
+  const auto inArray = readDictionary(sendRaw([](sd_bus_message* m) {
+                                        openEntry(m, "l", "as");
+                                        sd_bus_message_open_container(m, 'a', "s");
+                                        appendBytes(m, "fine");
+                                        appendBytes(m, std::string_view("a\0b", 3));
+                                        closeContainers(m, 4);
+                                      }).get());
+  ASSERT_FALSE(inArray);
+  EXPECT_THAT(inArray.error().localizedDescription(), HasSubstr("at key \"l\", element 1: the text is not"));
+  const auto inDictionary = readDictionary(sendRaw([](sd_bus_message* m) {
+                                             openEntry(m, "l", "a{ss}");
+                                             sd_bus_message_open_container(m, 'a', "{ss}");
+                                             sd_bus_message_open_container(m, 'e', "ss");
+                                             appendBytes(m, "k");
+                                             appendBytes(m, "\x80");
+                                             closeContainers(m, 5);
+                                           }).get());
+  ASSERT_FALSE(inDictionary);
+  EXPECT_THAT(inDictionary.error().localizedDescription(), HasSubstr("at key \"l\", key \"k\": the text"));
 }
 
 TEST_F(DbusCodecTest, ALongKeyIsShortenedInErrorsAtACharacter) {
   const std::string key = std::string(63, 'a') + "\xC3\xBC" + std::string(5000, 'b');
-  const auto error = refusalOf("a{sv}", 1, key.c_str(), "s", "\xFF");
-  EXPECT_LT(error.localizedDescription().size(), 200U);
-  EXPECT_TRUE(isValidUtf8(error.localizedDescription()));
+  const auto read = readDictionary(sendRaw([&key](sd_bus_message* m) {
+                                     openEntry(m, key, "s");
+                                     appendBytes(m, "\xFF");
+                                     closeContainers(m, 3);
+                                   }).get());
+  ASSERT_FALSE(read);
+  EXPECT_LT(read.error().localizedDescription().size(), 200U);
+  EXPECT_TRUE(isValidUtf8(read.error().localizedDescription()));
 }
 
 TEST_F(DbusCodecTest, TypesThatAreNoValuesAreRefused) {

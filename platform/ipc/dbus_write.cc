@@ -1,6 +1,7 @@
 #include <systemd/sd-bus.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <string_view>
 #include <variant>
 
@@ -10,28 +11,9 @@
 namespace tarnel::wire {
 namespace {
 
-// Code points that Unicode never assigns (U+FDD0 to U+FDEF and the last two of each plane). D-Bus
-// libraries refuse them, so that sending one would lose the whole message at the other end.
-bool holdsNoncharacter(std::string_view utf8) {
-  for (size_t i = 0; i + 2 < utf8.size(); ++i) {
-    const auto at = [&utf8, i](size_t k) { return static_cast<uint8_t>(utf8[i + k]); };
-    if (at(0) < 0xEF) continue;
-    if (at(0) == 0xEF) {
-      if (at(1) == 0xB7 && at(2) >= 0x90 && at(2) <= 0xAF) return true;
-      if (at(1) == 0xBF && at(2) >= 0xBE) return true;
-    } else if (i + 3 < utf8.size() && (at(1) & 0x0FU) == 0x0F && at(2) == 0xBF && at(3) >= 0xBE) {
-      return true;
-    }
-  }
-  return false;
-}
-
+// Why the library refused a text.
 const char* whyUnsendable(std::string_view text) {
-  if (text.find('\0') != std::string_view::npos) return "the text holds a NUL byte";
-  const auto isAscii = [](char c) { return static_cast<signed char>(c) >= 0; };
-  if (std::all_of(text.begin(), text.end(), isAscii)) return nullptr;
-  if (!isValidUtf8(text)) return "the text is not UTF-8";
-  return holdsNoncharacter(text) ? "the text holds a code point that is no character" : nullptr;
+  return isValidUtf8(text) ? "the text holds a code point that is no character" : "the text is not UTF-8";
 }
 
 // Appends one argument. Every function returns false when it failed; why is then in failure(), and the
@@ -65,8 +47,13 @@ class Writer {
   }
 
   bool string(const std::string& text) {
-    const char* why = whyUnsendable(text);
-    return why == nullptr ? basic('s', text.c_str()) : refuse(kErrorInvalidArguments, why);
+    if (text.find('\0') != std::string::npos) {
+      return refuse(kErrorInvalidArguments, "the text holds a NUL byte");
+    }
+    // The library checks what it appends: UTF-8, and no code point that Unicode never assigns.
+    const int appended = sd_bus_message_append_basic(message_, 's', text.c_str());
+    if (appended >= 0) return true;
+    return appended == -EINVAL ? refuse(kErrorInvalidArguments, whyUnsendable(text)) : outOfRoom();
   }
 
   bool error(const Error& held) {
