@@ -91,6 +91,14 @@ class TarnelBackend : public std::enable_shared_from_this<TarnelBackend> {
 
   ReportingState state() const noexcept { return _state.load(std::memory_order_relaxed); }
   void setState(ReportingState state) noexcept { _state.store(state, std::memory_order_relaxed); }
+  // Sets the state unless it is `kept`, in one step that nobody's change comes between. True when it was set.
+  bool setStateUnless(ReportingState kept, ReportingState state) noexcept {
+    ReportingState current = this->state();
+    while (current != kept) {
+      if (_state.compare_exchange_weak(current, state, std::memory_order_relaxed)) return true;
+    }
+    return false;
+  }
   uint32_t sessionID() const noexcept { return _sessionID; }
   void setSessionID(uint32_t sessionID) noexcept { _sessionID = sessionID; }
   const MaybeString& combinedSessionIDString() const noexcept { return _combinedSessionIDString; }
