@@ -1,9 +1,11 @@
 #include "platform/base/value.h"
 
 #include <array>
+#include <cctype>
 #include <charconv>
 #include <chrono>
 #include <cmath>
+#include <cstring>
 #include <ctime>
 #include <limits>
 
@@ -24,9 +26,16 @@ std::string_view skipBlanks(std::string_view text) {
   return text;
 }
 
-int64_t leadingInteger(std::string_view text) {
+// The text of a number: without blanks and without a plus sign, which std::from_chars does not know.
+std::string_view numberText(std::string_view text) {
   text = skipBlanks(text);
-  if (text.starts_with('+')) text.remove_prefix(1);
+  if (!text.starts_with('+')) return text;
+  text.remove_prefix(1);
+  return text.starts_with('-') ? std::string_view() : text;
+}
+
+int64_t leadingInteger(std::string_view text) {
+  text = numberText(text);
   int64_t result = 0;
   const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), result);
   if (error == std::errc::result_out_of_range) {
@@ -35,11 +44,27 @@ int64_t leadingInteger(std::string_view text) {
   return error == std::errc{} ? result : 0;
 }
 
+// A number that no double holds: infinite when it is too large, zero when it is too small.
+double outOfRangeReal(std::string_view number) {
+  const bool negative = number.starts_with('-');
+  if (negative) number.remove_prefix(1);
+  const size_t exponent = number.find_first_of("eE");
+  const bool small = exponent != std::string_view::npos ? number.substr(exponent + 1).starts_with('-')
+                                                        : number.find_first_not_of('0') == number.find('.');
+  const double magnitude = small ? 0.0 : std::numeric_limits<double>::infinity();
+  return negative ? -magnitude : magnitude;
+}
+
 double leadingReal(std::string_view text) {
-  text = skipBlanks(text);
-  if (text.starts_with('+')) text.remove_prefix(1);
+  text = numberText(text);
+  // Only digits begin a number: std::from_chars would take "nan" and "infinity" too.
+  const size_t first = text.starts_with('-') ? 1 : 0;
+  if (text.size() <= first || std::isalpha(static_cast<unsigned char>(text[first])) != 0) return 0;
   double result = 0;
   const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), result);
+  if (error == std::errc::result_out_of_range) {
+    return outOfRangeReal(text.substr(0, static_cast<size_t>(end - text.data())));
+  }
   return error == std::errc{} ? result : 0;
 }
 
@@ -66,11 +91,16 @@ void appendQuoted(std::string& out, std::string_view text) {
   out += '"';
 }
 
-template <class Number>
+template <std::integral Number>
 std::string decimal(Number number) {
-  std::array<char, 40> buffer{};
+  std::array<char, 24> buffer{};
   const auto [end, error] = std::to_chars(buffer.data(), buffer.data() + buffer.size(), number);
   return error == std::errc{} ? std::string(buffer.data(), end) : std::string();
+}
+
+std::string decimal(double number) {
+  std::array<char, kRealTextSize> buffer{};
+  return std::string(writeReal(number, buffer));
 }
 
 void appendInside(std::string& out, const Value& value) {
@@ -178,7 +208,7 @@ void Dictionary::set(std::string_view key, Value value) {
   }
   storage.entries.emplace_back(key, std::move(value));
   if (!storage.index.empty()) {
-    storage.index.emplace(key, storage.entries.size() - 1);
+    storage.index.emplace(storage.entries.back().first, storage.entries.size() - 1);
   } else if (storage.entries.size() > kIndexThreshold) {
     rebuildIndex(storage);
   }
@@ -336,6 +366,14 @@ std::string description(Date date) {
 bool isValidUtf8(std::string_view text) noexcept {
   const auto byteAt = [&text](size_t i) { return static_cast<uint8_t>(text[i]); };
   for (size_t i = 0; i < text.size();) {
+    // Nearly all text is ASCII: eight bytes at a time.
+    if (uint64_t eight = 0; text.size() - i >= sizeof eight) {
+      std::memcpy(&eight, text.data() + i, sizeof eight);
+      if ((eight & 0x8080808080808080U) == 0) {
+        i += sizeof eight;
+        continue;
+      }
+    }
     const uint8_t lead = byteAt(i);
     if (lead < 0x80) {
       ++i;
@@ -353,6 +391,17 @@ bool isValidUtf8(std::string_view text) noexcept {
     i += length;
   }
   return true;
+}
+
+std::string_view writeReal(double number, std::span<char, kRealTextSize> buffer) noexcept {
+  // Digits all the way where people would write them so; std::to_chars alone turns 100000 into 1e+05.
+  const double magnitude = std::fabs(number);
+  const bool plain = magnitude == 0 || (magnitude >= 1e-5 && magnitude < 1e17);
+  char* const first = buffer.data();
+  const auto [end, error] =
+      plain ? std::to_chars(first, first + buffer.size(), number, std::chars_format::fixed)
+            : std::to_chars(first, first + buffer.size(), number);
+  return {first, error == std::errc{} ? static_cast<size_t>(end - first) : 0};
 }
 
 double finiteOrMinusOne(double value) noexcept {

@@ -191,6 +191,11 @@ std::string description(Date date);
 // form).
 bool isValidUtf8(std::string_view text) noexcept;
 
+// The shortest decimal text that reads back as the same double, written into the buffer: plain digits from
+// 1e-5 up to 1e17, with an exponent outside, "inf" and "nan" when it is not finite.
+inline constexpr size_t kRealTextSize = 40;
+std::string_view writeReal(double number, std::span<char, kRealTextSize> buffer) noexcept;
+
 // A double as the system sends it: infinite and not-a-number become -1.0.
 double finiteOrMinusOne(double value) noexcept;
 
