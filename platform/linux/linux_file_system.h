@@ -1,0 +1,20 @@
+#pragma once
+
+#include "platform/file_system.h"
+
+namespace tarnel {
+
+// The file manager on the real file system.
+class LinuxFileSystem final : public FileSystem {
+ public:
+  Result<std::vector<std::string>> contentsOfDirectory(const std::string& path) override;
+  MaybeError createDirectory(const std::string& path) override;
+  // The time of birth where the file system keeps one, else of the last change.
+  std::optional<Date> creationDate(const std::string& path) override;
+  bool fileExists(const std::string& path) override;
+  MaybeError createFile(const std::string& path) override;
+  MaybeError appendToFile(const std::string& path, std::string_view text) override;
+  MaybeError removeFile(const std::string& path) override;
+};
+
+}  // namespace tarnel
