@@ -1,0 +1,101 @@
+#include <algorithm>
+
+#include "backends/https/https_post_backend.h"
+#include "platform/json_writer.h"
+
+// The JSON message that carries events.
+
+namespace tarnel {
+namespace {
+
+bool mayStandInEvent(const Value& value) {
+  return value.string() != nullptr || value.isNumber();
+}
+
+void logRemoval(Log& log, const std::string& key, const Value& value) {
+  TARNEL_LOG(
+      log, warning,
+      "HTTPSPostBackend(createMessageForPostAndLogging): JSONWriter unable to handle key: %s, value: %s",
+      key.c_str(), value.description().c_str());
+}
+
+// The tree shares the events; nothing of them is copied.
+Dictionary messageFrom(double postTime, const MaybeString& clientId, const Array& events) {
+  Dictionary message;
+  message.set("postTime", postTime);
+  // Without an identifier the message ends here, without its events.
+  if (!clientId) return message;
+  message.set("clientId", *clientId);
+  message.set("events", events);
+  return message;
+}
+
+// Text that is not UTF-8 and numbers that are not finite cannot be written. Such a value goes, like any other
+// that may not stand in an event, so that the rest of the batch arrives.
+void removeUnwritable(Log& log, Array& events) {
+  std::string scratch;
+  for (auto& event : events.mutableValues()) {
+    if (event.mutableDictionary() == nullptr) continue;
+    event.mutableDictionary()->editEntries([&log, &scratch](const std::string& key, Value& value) {
+      scratch.clear();
+      if (isValidUtf8(key) && writeJson(value, JsonStyle::compact, scratch)) return true;
+      logRemoval(log, key, value);
+      return false;
+    });
+  }
+}
+
+}  // namespace
+
+void HTTPSPostBackend::keepWritableValues(Dictionary& event) const {
+  const bool allMayStand = std::all_of(event.begin(), event.end(), [](const Dictionary::Entry& entry) {
+    return mayStandInEvent(entry.second);
+  });
+  if (allMayStand) return;
+  event.editEntries([this](const std::string& key, Value& value) {
+    if (const auto* date = value.date()) {
+      value = Value(finiteOrMinusOne(date->seconds));
+      return true;
+    }
+    if (mayStandInEvent(value)) return true;
+    logRemoval(dependencies().log, key, value);
+    return false;
+  });
+}
+
+MaybeString HTTPSPostBackend::clientIdentifier() const {
+  if (_extrasOnInternal != 0 && isInternal()) return udid();
+  if (_uuidCustom) return _uuidCustom;
+  return _dnuType != 0 ? _uuidOverrideDnu : _uuidRespectDnu;
+}
+
+bool HTTPSPostBackend::prettyCopyAllowed() const {
+  if (_dnuType == 0 && _dnuEnabled) return true;
+  if (!_forceEventLogging) return false;
+  const auto environment = dependencies().process.currentEnvironmentType();
+  return environment == EnvironmentType::development || environment == EnvironmentType::orvaneInternal;
+}
+
+std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Array& events,
+                                                                            MaybeString* prettyJsonString) {
+  const double postTime = finiteOrMinusOne(secondsFromTimeValue(dependencies().clock.timeOfDay()));
+  for (auto& event : events.mutableValues()) {
+    if (auto* fields = event.mutableDictionary()) keepWritableValues(*fields);
+  }
+  const auto clientId = clientIdentifier();
+  auto message = messageFrom(postTime, clientId, events);
+  std::string body;
+  if (!writeJson(message, JsonStyle::compact, body)) {
+    message = Dictionary();
+    removeUnwritable(dependencies().log, events);
+    message = messageFrom(postTime, clientId, events);
+    if (!writeJson(message, JsonStyle::compact, body)) return std::nullopt;
+  }
+  if (prettyJsonString != nullptr && prettyCopyAllowed()) {
+    std::string pretty;
+    if (writeJson(message, JsonStyle::pretty, pretty)) *prettyJsonString = std::move(pretty);
+  }
+  return body;
+}
+
+}  // namespace tarnel
