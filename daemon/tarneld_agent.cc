@@ -1,0 +1,86 @@
+#include "daemon/tarneld_agent.h"
+
+#include <algorithm>
+#include <utility>
+
+namespace tarnel {
+namespace {
+
+constexpr char kEntitlement[] = "com.orvane.private.tarneld";
+
+}  // namespace
+
+std::shared_ptr<TarneldAgent> TarneldAgent::init(const Dependencies& dependencies,
+                                                 BackendFactory backendFactory) {
+  return std::make_shared<TarneldAgent>(Key(), dependencies, std::move(backendFactory));
+}
+
+TarneldAgent::TarneldAgent(Key /*key*/, const Dependencies& dependencies, BackendFactory backendFactory)
+    : dependencies_(dependencies), backendFactory_(std::move(backendFactory)) {}
+
+bool TarneldAgent::shouldAcceptNewConnection(IpcListener& /*listener*/,
+                                             std::shared_ptr<IpcConnection> connection) {
+  Log& log = dependencies_.log;
+  if (!connection->valueForEntitlement(kEntitlement)) {
+    TARNEL_LOG(log, debug,
+               "listener: new LNK connection %s does not have required tarnel entitlement. "
+               "Closing connection...",
+               connection->description().c_str());
+    return false;
+  }
+  TARNEL_LOG(log, debug,
+             "listener: Accepting new LNK connection %s as it has proper entitlement, %d(%d) connections.",
+             connection->description().c_str(), static_cast<int>(sessionCount()),
+             static_cast<int>(correlationKeys_.load(std::memory_order_relaxed)));
+  auto session =
+      TarneldSession::initWithSessionDelegate(dependencies_, shared_from_this(), connection, backendFactory_);
+  connection->setExportedObject(session);
+  connection->setRemoteObjectInterface();
+  addSession(session);
+  connection->setInterruptionHandler([&log, weak = std::weak_ptr<TarneldSession>(session)] {
+    if (const auto interrupted = weak.lock()) {
+      TARNEL_LOG(log, debug, "listener: LNK connection to %s was interrupted",
+                 interrupted->description().c_str());
+    }
+  });
+  connection->setInvalidationHandler(
+      [agent = shared_from_this(), session] { agent->connectionInvalidated(session); });
+  connection->resume();
+  return true;
+}
+
+void TarneldAgent::connectionInvalidated(const std::shared_ptr<TarneldSession>& session) {
+  TARNEL_LOG(dependencies_.log, debug, "listener: LNK connection to %s was invalidated",
+             session->description().c_str());
+  removeSession(*session);
+  const LockGuard guard(_lock);
+  removeFromCorrelatedSessions(*session);
+}
+
+void TarneldAgent::addSession(const std::shared_ptr<TarneldSession>& session) {
+  const LockGuard guard(_sessionListLock);
+  if (_sessionList.empty()) dependencies_.keepAlive.beginTransaction();
+  _sessionList.push_back(session);
+}
+
+void TarneldAgent::removeSession(const TarneldSession& session) {
+  const LockGuard guard(_sessionListLock);
+  const auto found = std::find_if(
+      _sessionList.begin(), _sessionList.end(),
+      [&session](const std::shared_ptr<TarneldSession>& candidate) { return candidate.get() == &session; });
+  if (found == _sessionList.end()) return;
+  _sessionList.erase(found);
+  if (_sessionList.empty()) dependencies_.keepAlive.endTransaction();
+}
+
+size_t TarneldAgent::sessionCount() {
+  const LockGuard guard(_sessionListLock);
+  return _sessionList.size();
+}
+
+std::vector<std::shared_ptr<TarneldSession>> TarneldAgent::sessionList() {
+  const LockGuard guard(_sessionListLock);
+  return _sessionList;
+}
+
+}  // namespace tarnel

@@ -1,0 +1,58 @@
+#pragma once
+
+#include <cstddef>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "backends/tarnel_backend.h"
+#include "util/dependencies.h"
+
+namespace tarnel {
+
+// Makes one backend, or none. TarnelBackend::newBackendWithName everywhere but in tests.
+using BackendFactory = std::function<std::shared_ptr<TarnelBackend>(
+    const Dependencies& dependencies, const std::string& name, const Value& profile,
+    const MaybeString& productFamily, int32_t clientType)>;
+
+// Backends by name, enumerated in the order in which the storebag lists them.
+class BackendSet {
+ public:
+  using Entry = std::pair<std::string, std::shared_ptr<TarnelBackend>>;
+
+  bool empty() const noexcept { return entries_.empty(); }
+  size_t size() const noexcept { return entries_.size(); }
+  auto begin() const noexcept { return entries_.begin(); }
+  auto end() const noexcept { return entries_.end(); }
+
+  // Null when the set has no backend of that name.
+  TarnelBackend* find(std::string_view name) const noexcept {
+    for (const auto& [key, backend] : entries_) {
+      if (key == name) return backend.get();
+    }
+    return nullptr;
+  }
+  // Names are unique: a storebag's keys are.
+  void append(std::string name, std::shared_ptr<TarnelBackend> backend) {
+    entries_.emplace_back(std::move(name), std::move(backend));
+  }
+
+ private:
+  std::vector<Entry> entries_;
+};
+
+// createBackends
+// One backend per top-level key of the storebag that the factory makes one for, set up with what the session
+// info and the device say; their states are not decided yet. Keys that are no backend are passed over.
+//
+// deviceID: the device's unique identifier, at most 40 bytes.
+// Returns nothing, logged, without a storebag or without session info.
+std::optional<BackendSet> createBackends(const Dependencies& dependencies, const BackendFactory& factory,
+                                         const MaybeDictionary& storebag, const MaybeDictionary& sessionInfo,
+                                         const MaybeDictionary& userInfo, std::string_view deviceID);
+
+}  // namespace tarnel
