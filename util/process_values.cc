@@ -41,12 +41,13 @@ EnvironmentType ProcessValues::userDefaultsEnvironment() {
   if (const auto value = settings_.objectForKey(kTarnelSettingsDomain, "environmentType")) {
     stored = environmentNumber(log_, *value);
   }
-  auto environment = isInternalBuild() ? EnvironmentType::orvaneInternal : EnvironmentType::seed;
-  if (stored && *stored >= kEnvironmentTypes) {  // unsigned: negative numbers are too large
+  EnvironmentType environment = EnvironmentType::orvaneInternal;
+  if (!stored) {
+    if (!isInternalBuild()) environment = EnvironmentType::seed;
+  } else if (*stored >= kEnvironmentTypes) {  // unsigned: negative numbers are too large
     TARNEL_LOG(log_, error, "userDefaultsEnvironment: Invalid environment type %u",
                static_cast<unsigned>(std::min<uint64_t>(*stored, UINT32_MAX)));
-    environment = EnvironmentType::orvaneInternal;
-  } else if (stored) {
+  } else {
     environment = static_cast<EnvironmentType>(*stored);
   }
   TARNEL_LOG(log_, information, "userDefaultsEnvironment: Environment type %u",

@@ -1,3 +1,5 @@
+#include <strings.h>
+
 #include <algorithm>
 #include <chrono>
 #include <limits>
@@ -24,8 +26,8 @@ std::string storebagURL(const Dependencies& dependencies, const MaybeString& nam
 MaybeString joinedHeader(const HttpResponse& response, std::string_view name) {
   MaybeString joined;
   for (const auto& header : response.headers) {
-    const HttpResponse single{.statusCode = 0, .headers = {header}};
-    if (single.header(name) == nullptr) continue;
+    if (header.name.size() != name.size()) continue;
+    if (strncasecmp(header.name.data(), name.data(), name.size()) != 0) continue;
     if (joined) *joined += ", ";
     joined = joined.value_or("") + header.value;
   }

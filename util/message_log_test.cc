@@ -1,0 +1,250 @@
+#include "util/message_log.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <vector>
+
+#include "platform/fake/fake_world.h"
+
+namespace tarnel {
+namespace {
+
+constexpr double kNow = 1700000000;  // 2023-11-14 22:13:20 UTC
+const std::string kDirectory = "/log/Retired";
+const std::string kNewFile = kDirectory + "/tarneld_1700000000_messageLog.diag";
+const std::string kNowText = "2023-11-14 22:13:20 +0000";
+
+// Everything the inner file system does, except that files cannot be removed.
+class UndeletableFiles final : public FileSystem {
+ public:
+  explicit UndeletableFiles(FileSystem& inner) : inner_(inner) {}
+  Result<std::vector<std::string>> contentsOfDirectory(const std::string& path) override {
+    return inner_.contentsOfDirectory(path);
+  }
+  MaybeError createDirectory(const std::string& path) override { return inner_.createDirectory(path); }
+  std::optional<Date> creationDate(const std::string& path) override { return inner_.creationDate(path); }
+  bool fileExists(const std::string& path) override { return inner_.fileExists(path); }
+  MaybeError createFile(const std::string& path) override { return inner_.createFile(path); }
+  MaybeError appendToFile(const std::string& path, std::string_view text) override {
+    return inner_.appendToFile(path, text);
+  }
+  MaybeError removeFile(const std::string& /*path*/) override {
+    return Error(kFileErrorDomain, EACCES, "not permitted");
+  }
+
+ private:
+  FileSystem& inner_;
+};
+
+class MessageLogTest : public testing::Test {
+ protected:
+  void SetUp() override { world_.files.directories.insert(kDirectory); }
+  std::string addFile(const std::string& name, std::optional<double> age, const std::string& text = "") {
+    const std::string path = kDirectory + "/" + name;
+    world_.files.files[path] = {text, age ? std::optional(Date{kNow - *age}) : std::nullopt};
+    return path;
+  }
+  bool exists(const std::string& path) { return world_.files.fileExists(path); }
+  std::string textOf(const std::string& path) { return world_.files.files.at(path).text; }
+  size_t fileCount() { return world_.files.files.size(); }
+  bool logged(LogLevel level, const std::string& text) { return world_.log.contains(level, text); }
+  bool loggedDeletion(const std::string& path, const std::string& date) {
+    return logged(LogLevel::information,
+                  "writeToLogFile: Deleted expired tarneld log file " + path + " (" + date + ")");
+  }
+  void write() { writeToLogFile(world_.dependencies, "%s", "message"); }
+
+  fake::FakeWorld world_;
+};
+
+TEST_F(MessageLogTest, EmptyDirectoryGivesAFileNamedAfterTheTime) {
+  writeToLogFile(world_.dependencies, "[%s -> sendMessage] %d", "httppost", 7);
+  EXPECT_EQ(fileCount(), 1U);
+  EXPECT_EQ(textOf(kNewFile), "(" + kNowText + ") [httppost -> sendMessage] 7\n");
+  EXPECT_EQ(world_.log.lines(),
+            (std::vector<fake::FakeLog::Line>{
+                {LogLevel::information,
+                 "writeToLogFile: Created new tarneld log file " + kNewFile + " (" + kNowText + ")"},
+                {LogLevel::information, "writeToLogFile: Saved log message to " + kNewFile}}));
+}
+
+TEST_F(MessageLogTest, LaterMessagesAreAppended) {
+  write();
+  world_.clock.advance(61.5);
+  writeToLogFile(world_.dependencies, "second");
+  EXPECT_EQ(fileCount(), 1U);
+  EXPECT_EQ(textOf(kNewFile), "(" + kNowText + ") message\n(2023-11-14 22:14:21 +0000) second\n");
+}
+
+TEST_F(MessageLogTest, LongMessagesAreKeptWhole) {
+  const std::string text(300000, 'x');
+  writeToLogFile(world_.dependencies, "<%s>", text.c_str());
+  EXPECT_EQ(textOf(kNewFile), "(" + kNowText + ") <" + text + ">\n");
+}
+
+TEST_F(MessageLogTest, EmptyMessageStillGetsItsLine) {
+  writeToLogFile(world_.dependencies, "%s", "");
+  EXPECT_EQ(textOf(kNewFile), "(" + kNowText + ") \n");
+}
+
+TEST_F(MessageLogTest, NameHoldsTheSecondsAsASigned32BitNumber) {
+  world_.clock.set({int64_t{1} << 31, 0});
+  write();
+  EXPECT_TRUE(exists(kDirectory + "/tarneld_-2147483648_messageLog.diag"));
+}
+
+TEST_F(MessageLogTest, MissingDirectoryIsCreated) {
+  world_.files.directories.clear();
+  write();
+  EXPECT_TRUE(
+      logged(LogLevel::information, "writeToLogFile: Creating tarneld log directory at /log/Retired"));
+  EXPECT_TRUE(world_.files.directories.contains(kDirectory));
+  EXPECT_TRUE(exists(kNewFile));
+}
+
+TEST_F(MessageLogTest, AnyOtherListingErrorCountsAsAnEmptyDirectory) {
+  const auto old = addFile("tarneld_1_messageLog.diag", 100);
+  world_.files.listingError = Error(kFileErrorDomain, EACCES, "not permitted");
+  write();
+  EXPECT_TRUE(logged(LogLevel::error, "writeToLogFile: Error reading from log directory: " +
+                                          world_.files.listingError->description()));
+  EXPECT_TRUE(exists(kNewFile));
+  EXPECT_TRUE(exists(old));
+  EXPECT_TRUE(world_.log.startingWith("writeToLogFile: Creating").empty());
+}
+
+TEST_F(MessageLogTest, FileOlderThanADayIsDeletedAndANewOneStarted) {
+  const auto old = addFile("tarneld_1_messageLog.diag", 86401, "old\n");
+  write();
+  EXPECT_FALSE(exists(old));
+  EXPECT_TRUE(loggedDeletion(old, "2023-11-13 22:13:19 +0000"));
+  EXPECT_TRUE(exists(kNewFile));
+}
+
+TEST_F(MessageLogTest, FileOfADayOrLessIsAppendedTo) {
+  for (const double age : {86399.0, 86400.0, -5.0}) {
+    world_.files.files.clear();
+    const auto path = addFile("tarneld_1_messageLog.diag", age, "old\n");
+    write();
+    EXPECT_EQ(fileCount(), 1U) << age;
+    EXPECT_EQ(textOf(path), "old\n(" + kNowText + ") message\n") << age;
+  }
+}
+
+TEST_F(MessageLogTest, NewerOfTwoFreshFilesIsKept) {
+  // Listed by name: once the newer comes last, once first.
+  for (const bool newerLast : {true, false}) {
+    world_.files.files.clear();
+    world_.log.clear();
+    const auto older = addFile(newerLast ? "tarneld_1_messageLog.diag" : "tarneld_2_messageLog.diag", 200);
+    const auto newer = addFile(newerLast ? "tarneld_2_messageLog.diag" : "tarneld_1_messageLog.diag", 100);
+    write();
+    EXPECT_FALSE(exists(older));
+    EXPECT_TRUE(loggedDeletion(older, "2023-11-14 22:10:00 +0000"));
+    EXPECT_EQ(textOf(newer), "(" + kNowText + ") message\n");
+    EXPECT_EQ(fileCount(), 1U);
+  }
+}
+
+TEST_F(MessageLogTest, OfTwoFilesOfOneDateTheFirstListedStays) {
+  const auto first = addFile("tarneld_1_messageLog.diag", 100);
+  const auto second = addFile("tarneld_2_messageLog.diag", 100);
+  write();
+  EXPECT_TRUE(exists(first));
+  EXPECT_FALSE(exists(second));
+}
+
+TEST_F(MessageLogTest, KeptFileWithoutADateIsReplacedButNotDeleted) {
+  const auto undated = addFile("tarneld_1_messageLog.diag", std::nullopt);
+  const auto dated = addFile("tarneld_2_messageLog.diag", 100);
+  write();
+  EXPECT_EQ(textOf(undated), "");
+  EXPECT_EQ(textOf(dated), "(" + kNowText + ") message\n");
+}
+
+TEST_F(MessageLogTest, FileWithoutADateLosesAgainstADatedOne) {
+  const auto dated = addFile("tarneld_1_messageLog.diag", 100);
+  const auto undated = addFile("tarneld_2_messageLog.diag", std::nullopt);
+  write();
+  EXPECT_TRUE(exists(dated));
+  EXPECT_FALSE(exists(undated));
+  EXPECT_TRUE(loggedDeletion(undated, "(null)"));
+}
+
+TEST_F(MessageLogTest, OnlyFileWithoutADateIsAppendedTo) {
+  const auto undated = addFile("tarneld_1_messageLog.diag", std::nullopt);
+  write();
+  EXPECT_EQ(textOf(undated), "(" + kNowText + ") message\n");
+}
+
+TEST_F(MessageLogTest, NamesOfThreePartsCountAndOthersAreLeftAlone) {
+  const auto counted = addFile("tarneld_x_messageLog.diag", 90000);
+  const auto emptyMiddle = addFile("tarneld__messageLog.diag", 90000);
+  const std::vector<std::string> others = {addFile("tarneld_1_2_messageLog.diag", 90000),
+                                           addFile("tarneld_messageLog.diag", 90000),
+                                           addFile("Tarneld_1_messageLog.diag", 90000),
+                                           addFile("tarneld_1_messageLog.diag.old", 90000),
+                                           addFile("xtarneld_1_messageLog.diag", 90000),
+                                           addFile("tarneld_1_messageLog.diag_", 90000),
+                                           addFile("tarneld", 90000),
+                                           addFile("_tarneld_messageLog.diag", 90000)};
+  write();
+  EXPECT_FALSE(exists(counted));
+  EXPECT_FALSE(exists(emptyMiddle));
+  for (const auto& other : others) EXPECT_TRUE(exists(other)) << other;
+}
+
+TEST_F(MessageLogTest, FileThatCannotBeCreatedLosesTheMessage) {
+  world_.files.createError = Error(kFileErrorDomain, ENOSPC, "no space");
+  write();
+  EXPECT_EQ(world_.log.lines(),
+            (std::vector<fake::FakeLog::Line>{
+                {LogLevel::error, "writeToLogFile: Failed to create new tarneld log file " + kNewFile}}));
+}
+
+// Another call may have made it in between: it exists, which is what counts.
+TEST_F(MessageLogTest, FileThatExistsAlreadyIsUsed) {
+  addFile("tarneld_1700000000_messageLog.diag", 0, "other\n");
+  world_.files.listingError = Error(kFileErrorDomain, EACCES, "not permitted");
+  write();
+  EXPECT_EQ(textOf(kNewFile), "other\n(" + kNowText + ") message\n");
+}
+
+TEST_F(MessageLogTest, WriteFailureDeletesTheFile) {
+  const auto path = addFile("tarneld_1_messageLog.diag", 60, "old\n");
+  world_.files.appendError = Error(kFileErrorDomain, ENOSPC, "no space");
+  write();
+  EXPECT_FALSE(exists(path));
+  EXPECT_TRUE(loggedDeletion(path, "2023-11-14 22:12:20 +0000"));
+  EXPECT_TRUE(logged(LogLevel::warning, "writeToLogFile: Failed to write to tarneld log file " + path + " (" +
+                                            world_.files.appendError->description() + ")"));
+  EXPECT_TRUE(world_.log.startingWith("writeToLogFile: Saved").empty());
+}
+
+TEST_F(MessageLogTest, FileThatCannotBeDeletedIsReportedAndTheMessageStillWritten) {
+  UndeletableFiles files(world_.files);
+  Dependencies dependencies{.log = world_.log,
+                            .clock = world_.clock,
+                            .random = world_.random,
+                            .http = world_.http,
+                            .deviceInformation = world_.deviceInformation,
+                            .settings = world_.settings,
+                            .consent = world_.consent,
+                            .locale = world_.locale,
+                            .files = files,
+                            .clientBundle = world_.clientBundle,
+                            .keepAlive = world_.keepAlive,
+                            .consentIdentifiers = world_.consentIdentifiers,
+                            .process = world_.process,
+                            .messageLogDirectory = kDirectory};
+  const auto old = addFile("tarneld_1_messageLog.diag", 90000);
+  writeToLogFile(dependencies, "message");
+  EXPECT_TRUE(exists(old));
+  EXPECT_EQ(world_.log.startingWith("writeToLogFile: Failed to delete tarneld log file " + old).size(), 1U);
+  EXPECT_TRUE(world_.log.startingWith("writeToLogFile: Deleted").empty());
+  EXPECT_EQ(textOf(kNewFile), "(" + kNowText + ") message\n");
+}
+
+}  // namespace
+}  // namespace tarnel
