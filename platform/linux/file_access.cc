@@ -44,7 +44,8 @@ std::optional<std::string> distrust(const std::string& path, const struct stat& 
            "); change that with: chown root " + path;
   }
   if ((status.st_mode & (S_IWGRP | S_IWOTH)) != 0) {
-    return std::string(kind) + " can be written by its group or by others; change that with: chmod go-w " + path;
+    return std::string(kind) + " can be written by its group or by others; change that with: chmod go-w " +
+           path;
   }
   return std::nullopt;
 }
@@ -176,7 +177,8 @@ std::vector<std::string> sortedEntries(const std::string& directory, std::string
   while (const dirent* entry = ::readdir(stream.get())) {
     const std::string_view name(&entry->d_name[0]);
     // Hidden files are an editor's, not the administrator's.
-    if (!name.starts_with('.') && name.size() > ending.size() && name.ends_with(ending)) names.emplace_back(name);
+    if (!name.starts_with('.') && name.size() > ending.size() && name.ends_with(ending))
+      names.emplace_back(name);
   }
   std::sort(names.begin(), names.end());
   return names;
@@ -185,7 +187,8 @@ std::vector<std::string> sortedEntries(const std::string& directory, std::string
 Result<UniqueFd> lockFile(const std::string& path) {
   UniqueFd fd(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600));
   if (!fd) return systemError(path, "cannot be opened");
-  if (!giveToDirectoryOwner(fd.get(), path)) return systemError(path, "cannot be given to its directory's owner");
+  if (!giveToDirectoryOwner(fd.get(), path))
+    return systemError(path, "cannot be given to its directory's owner");
   int locked = 0;
   do {
     locked = ::flock(fd.get(), LOCK_EX);

@@ -10,9 +10,9 @@ namespace {
 
 // Seconds since 1970; without an offset the time counts as UTC.
 Date dateOf(const toml::date_time& moment) {
-  const auto day = std::chrono::sys_days(std::chrono::year(moment.date.year) /
-                                         std::chrono::month(moment.date.month) /
-                                         std::chrono::day(moment.date.day));
+  const auto day =
+      std::chrono::sys_days(std::chrono::year(moment.date.year) / std::chrono::month(moment.date.month) /
+                            std::chrono::day(moment.date.day));
   int64_t seconds = static_cast<int64_t>(day.time_since_epoch().count()) * 86400 + moment.time.hour * 3600 +
                     moment.time.minute * 60 + moment.time.second;
   if (moment.offset) seconds -= static_cast<int64_t>(moment.offset->minutes) * 60;

@@ -21,9 +21,9 @@ struct TomlNode {
   enum class Kind : uint8_t { scalar, array, table };
 
   Kind kind = Kind::scalar;
-  uint32_t line = 0;                                       // 1 and up
-  Value scalar;                                            // null: a local time, which no value can hold
-  std::vector<TomlNode> elements;                          // of an array
+  uint32_t line = 0;                                      // 1 and up
+  Value scalar;                                           // null: a local time, which no value can hold
+  std::vector<TomlNode> elements;                         // of an array
   std::vector<std::pair<std::string, TomlNode>> entries;  // of a table, sorted by key
 
   // The entry of a table, or null.

@@ -45,7 +45,8 @@ TEST(Toml, RealsAndDatesKeepTheirType) {
 }
 
 TEST(Toml, ADateReadsWithItsOffsetOrAsUtc) {
-  const auto values = parsed("a = 1970-01-01T01:00:00+01:00\nb = 1970-01-01T00:00:01\nc = 1970-01-02\nd = 10:00:00\n");
+  const auto values =
+      parsed("a = 1970-01-01T01:00:00+01:00\nb = 1970-01-01T00:00:01\nc = 1970-01-02\nd = 10:00:00\n");
   EXPECT_EQ(*values.find("a")->date(), Date{0});
   EXPECT_EQ(*values.find("b")->date(), Date{1});
   EXPECT_EQ(*values.find("c")->date(), Date{86400});
@@ -55,9 +56,9 @@ TEST(Toml, ADateReadsWithItsOffsetOrAsUtc) {
 TEST(Toml, WhatCannotStandIsRefusedByItsKey) {
   Value deep = Value(1);
   for (int level = 0; level < 34; ++level) deep = Value(Array{deep});
-  for (const Value& value : {Value(), Value(std::numeric_limits<uint64_t>::max()), Value(Data{1}), Value("\xFF"),
-                             Value(Date{1e18}), Value(Date{std::nan("")}), Value(Array{Value()}),
-                             Value(Dictionary{{"\xC3", 1}}), deep}) {
+  for (const Value& value : {Value(), Value(std::numeric_limits<uint64_t>::max()), Value(Data{1}),
+                             Value("\xFF"), Value(Date{1e18}), Value(Date{std::nan("")}),
+                             Value(Array{Value()}), Value(Dictionary{{"\xC3", 1}}), deep}) {
     const auto text = writeToml(Dictionary{{"good", 1}, {"bad key", value}});
     ASSERT_FALSE(text) << value.description();
     EXPECT_NE(text.error().localizedDescription().find("\"bad key\""), std::string::npos);

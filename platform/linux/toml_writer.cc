@@ -141,10 +141,11 @@ Result<std::string> writeToml(const Dictionary& entries) {
     const bool keyWritten = writer.writeText(key);
     out += " = ";
     if (!keyWritten || !writer.writeValue(value, 0)) {
-      return Error(kTomlErrorDomain, 0,
-                   "the value of \"" + key +
-                       "\" cannot be stored: only booleans, signed 64-bit integers, reals, UTF-8 texts, dates "
-                       "and arrays and dictionaries of them can");
+      return Error(
+          kTomlErrorDomain, 0,
+          "the value of \"" + key +
+              "\" cannot be stored: only booleans, signed 64-bit integers, reals, UTF-8 texts, dates "
+              "and arrays and dictionaries of them can");
     }
     out += '\n';
   }
