@@ -1,0 +1,166 @@
+#include <cmath>
+#include <limits>
+#include <string>
+#include <string_view>
+
+#include "platform/cryptography.h"
+#include "platform/document.h"
+#include "platform/linux/document_builder.h"
+#include "platform/linux/json_emitter.h"
+#include "platform/linux/rfc3339.h"
+
+#include <rapidjson/error/en.h>
+#include <rapidjson/memorystream.h>
+#include <rapidjson/reader.h>
+
+namespace tarnel {
+namespace {
+
+constexpr std::string_view kDateKey = "$date";
+constexpr std::string_view kDataKey = "$data";
+
+// What the reader calls for every item of the text; false ends the reading.
+class TextHandler {
+ public:
+  explicit TextHandler(detail::DocumentBuilder& builder) : builder_(builder) {}
+
+  bool Null() { return builder_.add(Value()); }
+  bool Bool(bool value) { return builder_.add(value); }
+  bool Int(int value) { return builder_.add(value); }
+  bool Uint(unsigned value) { return builder_.add(value); }
+  bool Int64(int64_t value) { return builder_.add(value); }
+  bool Uint64(uint64_t value) { return builder_.add(value); }
+  bool Double(double value) { return builder_.add(value); }
+  bool RawNumber(const char*, rapidjson::SizeType, bool) { return false; }
+  bool String(const char* text, rapidjson::SizeType length, bool) {
+    return builder_.add(std::string(text, length));
+  }
+  bool Key(const char* text, rapidjson::SizeType length, bool) {
+    return builder_.key(std::string(text, length));
+  }
+  bool StartObject() { return builder_.openDictionary(); }
+  bool StartArray() { return builder_.openArray(); }
+  bool EndArray(rapidjson::SizeType) {
+    return builder_.close([](Value&) { return true; });
+  }
+  bool EndObject(rapidjson::SizeType) {
+    return builder_.close([this](Value& value) { return convert(value); });
+  }
+
+ private:
+  bool convert(Value& value) {
+    const Dictionary& dictionary = *value.dictionary();
+    if (dictionary.size() != 1) return true;
+    const auto& [key, held] = *dictionary.begin();
+    const auto* text = held.string();
+    if (key == kDateKey) {
+      const auto date = text == nullptr ? std::nullopt : parseRfc3339(*text);
+      if (!date) return builder_.fail(kDocumentMalformed, "a \"$date\" that is no RFC 3339 time");
+      value = *date;
+    } else if (key == kDataKey) {
+      auto data = text == nullptr ? std::nullopt : base64Decode(*text);
+      if (!data) return builder_.fail(kDocumentMalformed, "a \"$data\" that is no base-64 text");
+      value = std::move(*data);
+    }
+    return true;
+  }
+
+  detail::DocumentBuilder& builder_;
+};
+
+// Well-formed characters as they are, every other byte as U+FFFD.
+std::string repairedUtf8(std::string_view text) {
+  std::string out;
+  while (!text.empty()) {
+    size_t length = 1;
+    while (length < 4 && length < text.size() && !isValidUtf8(text.substr(0, length))) ++length;
+    if (isValidUtf8(text.substr(0, length))) {
+      out += text.substr(0, length);
+    } else {
+      length = 1;
+      out += "\xEF\xBF\xBD";
+    }
+    text.remove_prefix(length);
+  }
+  return out;
+}
+
+struct DocumentLeaves {
+  template <class Writer>
+  bool string(Writer& writer, std::string_view text) {
+    return detail::fits(text) ? writer.String(text.data(), detail::sizeOf(text)) : writer.Null();
+  }
+  template <class Writer>
+  bool text(Writer& writer, const std::string& text) {
+    return isValidUtf8(text) ? string(writer, text) : string(writer, repairedUtf8(text));
+  }
+  template <class Writer>
+  bool key(Writer& writer, const std::string& key) {
+    return text(writer, key);
+  }
+  template <class Writer>
+  bool real(Writer& writer, double number) {
+    return std::isfinite(number) ? detail::emitReal(writer, number) : writer.Null();
+  }
+  template <class Writer>
+  bool date(Writer& writer, Date date) {
+    const auto time = rfc3339Text(date);
+    return time ? single(writer, kDateKey, *time) : writer.Null();
+  }
+  template <class Writer>
+  bool data(Writer& writer, const Data& data) {
+    return single(writer, kDataKey, base64Encode(data));
+  }
+  template <class Writer>
+  bool single(Writer& writer, std::string_view key, std::string_view text) {
+    return writer.StartObject() && string(writer, key) && string(writer, text) && writer.EndObject();
+  }
+};
+
+template <class Writer>
+void emitDocument(Writer& writer, const Value& value) {
+  DocumentLeaves leaves;
+  detail::JsonEmitter<Writer, DocumentLeaves>(writer, leaves).emit(value);
+}
+
+}  // namespace
+
+namespace detail {
+
+Result<Value> parseTextDocument(std::string_view bytes, const DocumentLimits& limits) {
+  constexpr std::string_view kByteOrderMark = "\xEF\xBB\xBF";
+  const size_t skipped = bytes.starts_with(kByteOrderMark) ? kByteOrderMark.size() : 0;
+  rapidjson::MemoryStream stream(bytes.data() + skipped, bytes.size() - skipped);
+  rapidjson::Reader reader;
+  DocumentBuilder builder(limits);
+  TextHandler handler(builder);
+  constexpr unsigned kFlags = rapidjson::kParseIterativeFlag | rapidjson::kParseFullPrecisionFlag;
+  const auto result = reader.Parse<kFlags>(stream, handler);
+  if (result.IsError()) {
+    if (!builder.failed()) builder.fail(kDocumentMalformed, rapidjson::GetParseError_En(result.Code()));
+    return builder.error(skipped + result.Offset());
+  }
+  // The reader takes a NUL for the end of the text.
+  if (stream.Tell() != bytes.size() - skipped) {
+    builder.fail(kDocumentMalformed, "bytes after the document");
+    return builder.error(skipped + stream.Tell());
+  }
+  return builder.take();
+}
+
+}  // namespace detail
+
+std::string writeTextDocument(const Value& value, bool pretty) {
+  rapidjson::StringBuffer buffer;
+  if (pretty) {
+    rapidjson::PrettyWriter<rapidjson::StringBuffer> writer(buffer);
+    writer.SetIndent(' ', 2);
+    emitDocument(writer, value);
+  } else {
+    rapidjson::Writer<rapidjson::StringBuffer> writer(buffer);
+    emitDocument(writer, value);
+  }
+  return {buffer.GetString(), buffer.GetSize()};
+}
+
+}  // namespace tarnel
