@@ -1,0 +1,49 @@
+#include "tools/tarnelctl/consent_command.h"
+
+#include <ostream>
+#include <string_view>
+
+#include "platform/base/log.h"
+#include "platform/linux/file_consent.h"
+
+namespace tarnel::ctl {
+namespace {
+
+// Why a consent file counts as "off" is worth seeing.
+class TerminalLog final : public Log {
+ public:
+  explicit TerminalLog(const Terminal& terminal) : terminal_(terminal) {}
+
+ protected:
+  void write(LogLevel /*level*/, std::string_view text) override {
+    terminal_.err << "tarnelctl: " << text << '\n';
+  }
+
+ private:
+  const Terminal& terminal_;
+};
+
+}  // namespace
+
+ExitStatus showConsent(const std::string& configurationDirectory, bool json, const Terminal& terminal) {
+  TerminalLog log(terminal);
+  const bool allowed = FileConsent(configurationDirectory, log).isDiagnosticSubmissionAllowed();
+  if (json) {
+    terminal.out << "{\"diagnostics\":" << (allowed ? "true" : "false") << "}\n";
+  } else {
+    terminal.out << "Submission of diagnostics is " << (allowed ? "on" : "off") << ".\n";
+  }
+  return ExitStatus::ok;
+}
+
+ExitStatus storeConsent(const std::string& configurationDirectory, bool allowed, const Terminal& terminal) {
+  if (const auto error = FileConsent::store(configurationDirectory, allowed)) {
+    terminal.err << "tarnelctl: " << error->localizedDescription() << '\n';
+    return ExitStatus::failed;
+  }
+  terminal.out << "Submission of diagnostics is now " << (allowed ? "on" : "off")
+               << ". Sessions that start from now on follow it.\n";
+  return ExitStatus::ok;
+}
+
+}  // namespace tarnel::ctl
