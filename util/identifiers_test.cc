@@ -79,14 +79,17 @@ TEST_F(IdentifiersTest, StoreThatCannotBeReadGivesANewOneEveryTime) {
   EXPECT_EQ(identifier("App", "Media"), kept);
 }
 
-TEST_F(IdentifiersTest, ValueOfAnotherKindIsReplaced) {
-  world_.settings.setObject("com.orvane.tarnel", "uuid:App:Media", 17);
-  const auto made = identifier("App", "Media");
-  EXPECT_EQ(made.size(), 36U);
-  EXPECT_EQ(stored("uuid:App:Media"), made);
-  EXPECT_TRUE(world_.log.contains(LogLevel::warning,
-                                  "getPersistentIdentifierForCustomClientIDSuffix: ignoring the setting "
-                                  "'uuid:App:Media' of com.orvane.tarnel: expected a text; remove it"));
+TEST_F(IdentifiersTest, ValueThatIsNoIdentifierIsReplaced) {
+  for (const Value& value : {Value(17), Value("")}) {
+    world_.log.clear();
+    world_.settings.setObject("com.orvane.tarnel", "uuid:App:Media", value);
+    const auto made = identifier("App", "Media");
+    EXPECT_EQ(made.size(), 36U);
+    EXPECT_EQ(stored("uuid:App:Media"), made);
+    EXPECT_TRUE(world_.log.contains(LogLevel::warning,
+                                    "getPersistentIdentifierForCustomClientIDSuffix: ignoring the setting "
+                                    "'uuid:App:Media' of com.orvane.tarnel: expected a text; remove it"));
+  }
 }
 
 TEST_F(IdentifiersTest, ThreadsThatAskAtOnceGetTheSame) {

@@ -238,6 +238,7 @@ TEST_F(StorebagTest, MissingSectionWinsOverMissingVersion) {
 
 TEST_F(StorebagTest, RefreshCycleSetsTheMaximumAge) {
   const std::vector<std::pair<Value, int32_t>> rows = {{100000, 86400},
+                                                       {86401, 86400},
                                                        {86400, 86400},
                                                        {86399, 86399},
                                                        {0, 0},
