@@ -407,7 +407,9 @@ TEST_F(DbusCodecTest, TextsThatTheOtherEndWouldRefuseAreNotSent) {
   EXPECT_THAT(refusal("\xEF\xB7\x90"), HasSubstr("no character"));
   EXPECT_THAT(refusal("\xF0\x9F\xBF\xBE"), HasSubstr("no character"));
   auto message = buses_.newMessage();
-  EXPECT_TRUE(appendDictionary(message.get(), {{"\xFF", Value(1)}}));
+  const auto inKey = appendDictionary(message.get(), {{"\xFF", Value(1)}});
+  ASSERT_TRUE(inKey);
+  EXPECT_EQ(inKey->localizedDescription(), "at a key that is not UTF-8: the text is not UTF-8");
   message = buses_.newMessage();
   EXPECT_TRUE(appendMaybeError(message.get(), Error("d", 1, "\xFF")));
   // Neighbours of what is refused.

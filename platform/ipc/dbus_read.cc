@@ -1,11 +1,11 @@
 #include <systemd/sd-bus.h>
 
-#include <algorithm>
-#include <cerrno>
+#include <concepts>
 #include <string_view>
 #include <utility>
 
 #include "platform/ipc/dbus_codec.h"
+#include "platform/ipc/error_text.h"
 #include "platform/ipc/wire.h"
 
 namespace tarnel::wire {
@@ -16,18 +16,8 @@ namespace {
 constexpr size_t kReserveOutermost = 16;
 constexpr size_t kReserveNested = 4;
 
-// The longest part of a key that an error repeats.
-constexpr size_t kMaxQuotedKey = 64;
-
 constexpr char kNotUtf8[] = "the text is not UTF-8, holds a NUL byte or is cut off";
 constexpr char kCutOff[] = "the value is cut off or not what its signature says";
-
-std::string_view shortened(std::string_view key) {
-  if (key.size() <= kMaxQuotedKey) return key;
-  size_t length = kMaxQuotedKey;
-  while (length > 0 && (static_cast<unsigned char>(key[length]) & 0xC0U) == 0x80) --length;
-  return key.substr(0, length);
-}
 
 // Walks one argument of a message. Every function returns false when it failed; why is then in failure().
 //
@@ -276,11 +266,11 @@ class Reader {
 
   // On the way out of a failure, each level puts its key or index in front.
   bool under(std::string_view key) {
-    path_ = "key \"" + std::string(shortened(key)) + (path_.empty() ? "\"" : "\", " + path_);
+    prependStep(path_, quotedKey(key));
     return false;
   }
   bool under(size_t index) {
-    path_ = "element " + std::to_string(index) + (path_.empty() ? "" : ", " + path_);
+    prependStep(path_, "element " + std::to_string(index));
     return false;
   }
 

@@ -6,6 +6,7 @@
 #include <variant>
 
 #include "platform/ipc/dbus_codec.h"
+#include "platform/ipc/error_text.h"
 #include "platform/ipc/wire.h"
 
 namespace tarnel::wire {
@@ -27,7 +28,7 @@ class Writer {
     for (const auto& [key, value] : held) {
       if (value.isNull()) continue;
       if (!open(SD_BUS_TYPE_DICT_ENTRY, "sv") || !string(key) || !variant(value, depth) || !close()) {
-        path_ = "key \"" + key.substr(0, 64) + (path_.empty() ? "\"" : "\", " + path_);
+        prependStep(path_, quotedKey(key));
         return false;
       }
     }
@@ -39,7 +40,7 @@ class Writer {
     for (const auto& value : held) {
       if (value.isNull()) continue;
       if (!variant(value, depth)) {
-        path_ = "element " + std::to_string(&value - held.begin()) + (path_.empty() ? "" : ", " + path_);
+        prependStep(path_, "element " + std::to_string(&value - held.begin()));
         return false;
       }
     }

@@ -1,0 +1,16 @@
+#pragma once
+
+#include <cstddef>
+
+#include "platform/base/value.h"
+
+// About how many bytes values take on the wire; for bounding what waits to be sent.
+
+namespace tarnel::wire {
+
+size_t approximateSize(const Value& value);
+size_t approximateSize(const Dictionary& dictionary);
+size_t approximateSize(const Array& array);
+size_t approximateSize(const MaybeDictionary& dictionary);
+
+}  // namespace tarnel::wire

@@ -1,0 +1,95 @@
+#pragma once
+
+#include <pthread.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <unordered_map>
+#include <variant>
+#include <vector>
+
+#include "platform/linux/ipc/connection_link.h"
+#include "platform/linux/ipc/ipc_limits.h"
+#include "platform/linux/unique_fd.h"
+
+namespace tarnel {
+
+// Stack of a connection's thread. Only what is touched becomes resident; the sanitizers' frames are larger.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+inline constexpr size_t kConnectionStackBytes = size_t{4} << 20U;
+#else
+inline constexpr size_t kConnectionStackBytes = size_t{256} << 10U;
+#endif
+
+// The connections of a listener: how many there are, and their threads. Threads: any, unless noted.
+class ConnectionRegistry : public std::enable_shared_from_this<ConnectionRegistry> {
+ public:
+  // A connection that counts; gives its place back when destroyed.
+  class Place {
+   public:
+    Place(std::shared_ptr<ConnectionRegistry> registry, uint32_t uid) noexcept
+        : registry_(std::move(registry)), uid_(uid) {}
+    Place(Place&&) noexcept = default;
+    Place& operator=(Place&&) = delete;
+    ~Place() {
+      if (registry_ != nullptr) registry_->leave(uid_);
+    }
+
+   private:
+    std::shared_ptr<ConnectionRegistry> registry_;
+    uint32_t uid_;
+  };
+  enum class Full { perUser, total };
+
+  explicit ConnectionRegistry(const IpcLimits& limits);
+
+  // A place, or the limit that stands against it.
+  std::variant<Place, Full> enter(uint32_t uid);
+  size_t connections() const;
+
+  // Runs body on a new thread; link is how stopAll() reaches it. False when the system gives no thread, or
+  // the registry is being stopped.
+  bool start(std::shared_ptr<ConnectionLink> link, std::function<void()> body);
+  size_t threads() const;
+
+  // Readable when a thread is over and waits for reap(); for the main loop.
+  int finishedDescriptor() const noexcept { return finishedEvent_.get(); }
+  // Joins what is over; never waits for a thread that still runs.
+  void reap();
+  // Stops all connections and joins their threads; waits for calls that are being run.
+  void stopAll();
+
+ private:
+  struct Thread {
+    std::shared_ptr<ConnectionLink> link;
+    pthread_t handle{};
+  };
+  struct Start {
+    std::shared_ptr<ConnectionRegistry> registry;
+    uint64_t id;
+    std::function<void()> body;
+  };
+
+  static void* runThread(void* start);
+  void leave(uint32_t uid);
+  void finished(uint64_t id);
+
+  const IpcLimits limits_;
+  const UniqueFd finishedEvent_;
+
+  mutable std::mutex mutex_;
+  // All below guarded by mutex_.
+  size_t connections_ = 0;
+  std::unordered_map<uint32_t, unsigned> connectionsOfUser_;
+  std::map<uint64_t, Thread> running_;
+  std::vector<pthread_t> over_;
+  uint64_t lastId_ = 0;
+  bool stopping_ = false;
+};
+
+}  // namespace tarnel

@@ -1,0 +1,23 @@
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+
+namespace tarnel {
+
+// How much the clients of the IPC service may make the daemon hold. What goes beyond is closed, with a log
+// line that names the limit.
+struct IpcLimits {
+  unsigned connectionsPerUser = 64;
+  unsigned connections = 1024;
+  // Calls and answers that wait for a client to read its socket, bytes (estimated) per connection.
+  size_t queuedBytes = size_t{1} << 20U;
+  // Calls of one connection that are not answered yet; more are not read until some are.
+  size_t unansweredCalls = 1024;
+  // From accepting to the end of the authentication.
+  std::chrono::milliseconds authentication{10'000};
+  // From the peer's end of sending to the end of the connection.
+  std::chrono::milliseconds interruption{5'000};
+};
+
+}  // namespace tarnel

@@ -1,0 +1,67 @@
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/base/log.h"
+#include "platform/entitlements.h"
+#include "platform/ipc/ipc.h"
+#include "platform/linux/ipc/connection_link.h"
+#include "platform/linux/ipc/connection_registry.h"
+#include "platform/linux/ipc/ipc_limits.h"
+#include "platform/linux/unique_fd.h"
+
+namespace tarnel {
+
+// A client's connection over one Unix stream socket, D-Bus messages peer to peer.
+class SdBusConnection final : public IpcConnection, public std::enable_shared_from_this<SdBusConnection> {
+ public:
+  struct Setup {
+    PeerCredentials peer;
+    ConnectionRegistry::Place place;
+    std::shared_ptr<ConnectionRegistry> registry;
+    std::shared_ptr<Entitlements> entitlements;
+    std::shared_ptr<Log> log;
+    IpcLimits limits;
+  };
+  SdBusConnection(UniqueFd socket, Setup setup);
+
+  std::string description() const override { return description_; }
+  bool valueForEntitlement(std::string_view name) override;
+  void setExportedObject(std::shared_ptr<ClientSessionInterface> object) override;
+  void setRemoteObjectInterface() override;
+  void setInterruptionHandler(Handler handler) override;
+  void setInvalidationHandler(Handler handler) override;
+  // Should the system give no thread, the connection is invalidated at once, on the caller's.
+  void resume() override;
+  std::shared_ptr<ClientSessionReplyInterface> remoteObjectProxyWithErrorHandler(
+      ProxyErrorHandler errorHandler) override;
+
+  // The delegate does not want it. Closes the socket and lets go of everything.
+  void reject();
+
+ private:
+  void serve();
+  void invalidate();
+
+  const PeerCredentials peer_;
+  const std::string description_;
+  const std::shared_ptr<ConnectionRegistry> registry_;
+  const std::shared_ptr<Entitlements> entitlements_;
+  const std::shared_ptr<Log> log_;
+  const IpcLimits limits_;
+  const std::shared_ptr<ConnectionLink> link_;
+
+  // Written before resume(), then by the connection's thread.
+  std::optional<ConnectionRegistry::Place> place_;
+  UniqueFd socket_;
+  std::shared_ptr<ClientSessionInterface> object_;
+  Handler interruptionHandler_;
+  Handler invalidationHandler_;
+  bool hasRemoteInterface_ = false;
+  bool resumed_ = false;
+};
+
+}  // namespace tarnel

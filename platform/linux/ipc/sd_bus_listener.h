@@ -1,0 +1,84 @@
+#pragma once
+
+#include <systemd/sd-event.h>
+
+#include <chrono>
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "platform/base/log.h"
+#include "platform/entitlements.h"
+#include "platform/ipc/ipc.h"
+#include "platform/linux/ipc/connection_registry.h"
+#include "platform/linux/ipc/ipc_limits.h"
+#include "platform/linux/ipc/listening_socket.h"
+#include "platform/linux/unique_fd.h"
+
+namespace tarnel {
+
+// Accepts clients on the service's socket: the one that the service manager passed, else its own in the
+// runtime directory.
+//
+// Threads: made, resumed and destroyed on the thread that runs the event loop, which also calls the delegate.
+// Its destruction ends all connections and waits for the calls that they are running.
+class SdBusListener final : public IpcListener {
+ public:
+  struct Options {
+    std::string runtimeDirectory;  // an absolute path
+    IpcLimits limits;
+    // Who is at the other end of an accepted socket; readPeerCredentials but for tests.
+    std::function<PeerCredentials(int socket)> readCredentials;
+  };
+
+  // The event loop's reference is held.
+  SdBusListener(sd_event* event, Options options, std::shared_ptr<Entitlements> entitlements,
+                std::shared_ptr<Log> log);
+  ~SdBusListener() override;
+
+  void setDelegate(IpcListenerDelegate* delegate) override { delegate_ = delegate; }
+  // The error says what to do about it.
+  MaybeError resume() override;
+
+  // For tests and status.
+  size_t connections() const { return registry_->connections(); }
+  size_t threads() const { return registry_->threads(); }
+
+ private:
+  struct UnrefEvent {
+    void operator()(sd_event* event) const noexcept { sd_event_unref(event); }
+  };
+  struct UnrefSource {
+    void operator()(sd_event_source* source) const noexcept { sd_event_source_disable_unref(source); }
+  };
+  using Source = std::unique_ptr<sd_event_source, UnrefSource>;
+
+  MaybeError watch(int descriptor, sd_event_io_handler_t handler, Source& source);
+  void acceptWaiting();
+  bool acceptOne();
+  void take(UniqueFd socket);
+  void outOfDescriptors(int error);
+  void pauseAccepting();
+  void refused(const std::string& why);
+
+  const std::unique_ptr<sd_event, UnrefEvent> event_;
+  const Options options_;
+  const std::shared_ptr<Entitlements> entitlements_;
+  const std::shared_ptr<Log> log_;
+  const std::shared_ptr<ConnectionRegistry> registry_;
+  IpcListenerDelegate* delegate_ = nullptr;
+
+  ListeningSocket socket_;
+  // Given up to accept and close a client when the process has no descriptor left; otherwise it would stay
+  // in the queue and wake the loop for ever.
+  UniqueFd reserve_;
+  Source accepting_;
+  Source reaping_;
+  Source pause_;
+
+  // Closed connections are logged at most once a second, each line with the number since the last.
+  std::optional<std::chrono::steady_clock::time_point> lastRefusalLine_;
+  size_t refusedSinceLine_ = 0;
+};
+
+}  // namespace tarnel

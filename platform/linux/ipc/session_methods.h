@@ -1,0 +1,34 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+
+#include "platform/base/error.h"
+#include "platform/base/log.h"
+#include "platform/ipc/client_session_interface.h"
+#include "platform/linux/ipc/connection_link.h"
+
+struct sd_bus_message;
+
+namespace tarnel {
+
+// One call of the session's interface, as it came.
+struct SessionCall {
+  sd_bus_message* message;
+  ClientSessionInterface& session;
+  const std::shared_ptr<ConnectionLink>& link;
+  uint64_t serial;
+  const std::string& peer;
+  Log& log;
+};
+
+// Decodes the arguments and calls the session's operation; its reply answers the call, from any thread.
+// Returns what to answer at once instead: an unknown method, or arguments that are not right. Lets through
+// what the session throws. On the connection's thread.
+MaybeError callSessionMethod(const SessionCall& call);
+
+// The session's interface as introspection describes it.
+std::string describeSessionInterface();
+
+}  // namespace tarnel
