@@ -1,0 +1,72 @@
+#include "backends/https/event_batch.h"
+
+#include <gtest/gtest.h>
+
+namespace tarnel {
+namespace {
+
+Dictionary numbered(int number) {
+  return {{"n", number}};
+}
+
+TEST(EventBatchTest, GivesEventsInOrderOfArrival) {
+  EventBatch batch;
+  for (int i = 0; i < 3; ++i) batch.append(numbered(i), 10);
+  EXPECT_EQ(batch.size(), 3U);
+  const Array events = batch.takeEvents();
+  EXPECT_EQ(events, (Array{numbered(0), numbered(1), numbered(2)}));
+  EXPECT_EQ(batch.size(), 0U);
+  EXPECT_TRUE(batch.hasRoomFor(EventBatch::kMaxBytes + 1));
+}
+
+TEST(EventBatchTest, MergesIntoEveryEvent) {
+  EventBatch batch;
+  batch.append({{"a", 1}}, 10);
+  batch.append({{"b", 1}}, 10);
+  batch.mergeIntoAll({{"a", 2}});
+  EXPECT_EQ(batch.takeEvents(), (Array{Dictionary{{"a", 2}}, Dictionary{{"b", 1}, {"a", 2}}}));
+}
+
+TEST(EventBatchTest, BoundsBytesByDroppingTheOldest) {
+  EventBatch batch;
+  for (int i = 0; i < 4; ++i) batch.append(numbered(i), EventBatch::kMaxBytes / 4);
+  EXPECT_FALSE(batch.hasRoomFor(1));
+  EXPECT_TRUE(batch.hasRoomFor(0));
+  EXPECT_EQ(batch.makeRoomFor(1), 1U);
+  EXPECT_EQ(batch.makeRoomFor(EventBatch::kMaxBytes / 2), 1U);
+  EXPECT_EQ(batch.makeRoomFor(EventBatch::kMaxBytes / 2), 0U);
+  EXPECT_EQ(batch.takeEvents(), (Array{numbered(2), numbered(3)}));
+}
+
+TEST(EventBatchTest, OneEventIsHeldHoweverLarge) {
+  EventBatch batch;
+  batch.append(numbered(1), 10);
+  EXPECT_EQ(batch.makeRoomFor(EventBatch::kMaxBytes * 2), 1U);
+  batch.append(numbered(2), EventBatch::kMaxBytes * 2);
+  EXPECT_EQ(batch.makeRoomFor(10), 1U);
+  EXPECT_EQ(batch.size(), 0U);
+}
+
+TEST(EventBatchTest, BoundsTheNumberOfEvents) {
+  EventBatch batch;
+  for (size_t i = 0; i < EventBatch::kMaxEvents; ++i) {
+    ASSERT_TRUE(batch.hasRoomFor(1));
+    batch.append({}, 1);
+  }
+  EXPECT_FALSE(batch.hasRoomFor(1));
+  EXPECT_EQ(batch.makeRoomFor(1), 1U);
+}
+
+TEST(EventBatchTest, EstimateCountsWhatAnEventHolds) {
+  const size_t small = EventBatch::estimateSize({{"n", 1}});
+  EXPECT_GE(small, sizeof(Dictionary::Entry));
+  const std::string text(1000, 'x');
+  EXPECT_GE(EventBatch::estimateSize({{"n", text}}), small + 1000);
+  EXPECT_GE(EventBatch::estimateSize({{text, 1}}), small + 999);
+  EXPECT_GE(EventBatch::estimateSize({{"n", Data(1000)}}), small + 1000);
+  EXPECT_GE(EventBatch::estimateSize({{"n", Array{text, Array{text}}}}), small + 2000);
+  EXPECT_GE(EventBatch::estimateSize({{"n", Dictionary{{"m", text}}}}), small + 1000);
+}
+
+}  // namespace
+}  // namespace tarnel

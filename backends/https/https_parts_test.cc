@@ -1,0 +1,116 @@
+#include <gtest/gtest.h>
+
+#include "backends/https/case_folding.h"
+#include "backends/https/list_matching.h"
+#include "backends/https/sender_names.h"
+#include "backends/https/text_format.h"
+
+namespace tarnel {
+namespace {
+
+TEST(CaseFoldingTest, FoldsLettersOfTheCommonScripts) {
+  EXPECT_EQ(foldCase("AbZ az09_@[`{"), "abz az09_@[`{");
+  EXPECT_EQ(foldCase("ÀÖØÞ×÷ßÿŸ"), "àöøþ×÷ßÿÿ");
+  EXPECT_EQ(foldCase("ĀāĲĳĶķĹĺŇňŊŋŶŷŹźŽž"), "āāĳĳķķĺĺňňŋŋŷŷźźžž");
+  EXPECT_EQ(foldCase("ĸŉſ"), "ĸŉſ");
+  EXPECT_EQ(foldCase("ΑΡΣΫΆΈΊΌΎΏς"), "αρσϋάέίόύώσ");
+  EXPECT_EQ(foldCase("ЀЏАЯабв"), "ѐџаяабв");
+  EXPECT_EQ(foldCase("日本😀"), "日本😀");
+}
+
+TEST(CaseFoldingTest, LeavesBrokenTextAlone) {
+  EXPECT_EQ(foldCase("A\xC3"), "a\xC3");
+  EXPECT_EQ(foldCase(std::string("\xFF") + "B"), std::string("\xFF") + "b");
+}
+
+TEST(CaseFoldingTest, ComparesIgnoringCase) {
+  EXPECT_TRUE(equalsFolded("username", "UserName"));
+  EXPECT_TRUE(equalsFolded("größe", "GRÖßE"));
+  EXPECT_FALSE(equalsFolded("username", "UserNames"));
+  EXPECT_FALSE(equalsFolded("username", "userNane"));
+  EXPECT_FALSE(equalsFolded("größe", "GRÄßE"));
+  EXPECT_TRUE(equalsFolded("", ""));
+}
+
+TEST(ListMatchingTest, AbsentOrEmptyListAnswersTheWhitelistArgument) {
+  for (const auto& list : {MaybeTextList(), MaybeTextList(TextList{})}) {
+    for (const auto& text : {MaybeString(), MaybeString("a")}) {
+      EXPECT_TRUE(matchExactStringWithList(list, text, true));
+      EXPECT_FALSE(matchExactStringWithList(list, text, false));
+      EXPECT_TRUE(matchStringWithList(list, text, true));
+      EXPECT_FALSE(matchStringWithList(list, text, false));
+    }
+  }
+}
+
+TEST(ListMatchingTest, AbsentStringAnswersTheOpposite) {
+  const MaybeTextList list = TextList{"a"};
+  EXPECT_FALSE(matchExactStringWithList(list, std::nullopt, true));
+  EXPECT_TRUE(matchExactStringWithList(list, std::nullopt, false));
+  EXPECT_FALSE(matchStringWithList(list, std::nullopt, true));
+  EXPECT_TRUE(matchStringWithList(list, std::nullopt, false));
+}
+
+TEST(ListMatchingTest, ExactMatchTakesWholeStringsIgnoringCase) {
+  const MaybeTextList list = TextList{"Alpha", "beta"};
+  for (const bool whitelist : {true, false}) {
+    EXPECT_TRUE(matchExactStringWithList(list, "ALPHA", whitelist));
+    EXPECT_TRUE(matchExactStringWithList(list, "Beta", whitelist));
+    EXPECT_FALSE(matchExactStringWithList(list, "alph", whitelist));
+    EXPECT_FALSE(matchExactStringWithList(list, "alphabet", whitelist));
+  }
+  EXPECT_TRUE(matchExactStringWithList(TextList{""}, "", true));
+  EXPECT_FALSE(matchExactStringWithList(TextList{""}, "a", true));
+}
+
+TEST(ListMatchingTest, PartialMatchFindsItemsAnywhereButNeverTheEmptyOne) {
+  const MaybeTextList list = TextList{"Video", "x"};
+  for (const bool whitelist : {true, false}) {
+    EXPECT_TRUE(matchStringWithList(list, "my-VIDEO-call", whitelist));
+    EXPECT_TRUE(matchStringWithList(list, "X", whitelist));
+    EXPECT_FALSE(matchStringWithList(list, "vide", whitelist));
+    EXPECT_FALSE(matchStringWithList(TextList{""}, "anything", whitelist));
+    EXPECT_FALSE(matchStringWithList(TextList{""}, "", whitelist));
+  }
+}
+
+TEST(ListMatchingTest, SplitsAtCommasWithoutTrimming) {
+  EXPECT_EQ(splitAtCommas("A,B"), (TextList{"A", "B"}));
+  EXPECT_EQ(splitAtCommas(" A ,, B,"), (TextList{" A ", "", " B", ""}));
+  EXPECT_EQ(splitAtCommas(""), TextList{""});
+}
+
+TEST(SenderNamesTest, HoldsOneNamePerClientType) {
+  EXPECT_EQ(senderName(0), "PX");
+  EXPECT_EQ(senderName(1), "DW");
+  EXPECT_EQ(senderName(2), "BOR");
+  EXPECT_EQ(senderName(3), "HY");
+  EXPECT_EQ(senderName(4), "MQ");
+  EXPECT_EQ(senderName(5), "EJ");
+  EXPECT_EQ(senderName(6), "ZU");
+  EXPECT_EQ(senderName(7), "KA");
+  EXPECT_EQ(senderName(8), "OW");
+  EXPECT_EQ(senderName(9), "FE");
+  EXPECT_EQ(senderName(10), "YL");
+  EXPECT_EQ(senderName(11), "UB");
+  EXPECT_EQ(senderName(12), "PLMA");
+  EXPECT_EQ(senderName(13), "TOVAN");
+  EXPECT_EQ(senderName(14), "VN-KRS");
+  EXPECT_EQ(senderName(15), "VN-DULEX");
+  EXPECT_EQ(senderName(16), "OSTRIK");
+  EXPECT_EQ(senderName(17), "FRANDEL");
+}
+
+TEST(SenderNamesTest, IsEmptyForNumbersThatAreNoClientType) {
+  for (const int32_t type : {-1, 18, 1000000, INT32_MIN, INT32_MAX}) EXPECT_EQ(senderName(type), "");
+}
+
+TEST(TextFormatTest, FormatsTextsOfAnyLength) {
+  EXPECT_EQ(formatText("%s", ""), "");
+  EXPECT_EQ(formatText("%d-%s", 5, "x"), "5-x");
+  const std::string longText(100000, 'y');
+  EXPECT_EQ(formatText("%s!", longText.c_str()), longText + "!");
+}
+
+}  // namespace
+}  // namespace tarnel

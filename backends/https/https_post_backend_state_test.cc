@@ -1,0 +1,506 @@
+#include "backends/https/https_post_backend_fixture.h"
+
+namespace tarnel {
+namespace {
+
+class HTTPSPostBackendStateTest : public HTTPSPostBackendFixture {
+ protected:
+  ReportingState updated() {
+    backend = makeUpdated();
+    return backend->state();
+  }
+  std::string logPrefix() const { return "HTTPSPostBackend(updateBackendState): "; }
+
+  std::shared_ptr<HTTPSPostBackend> backend;
+};
+
+// --- the road to an entry ---
+
+TEST_F(HTTPSPostBackendStateTest, WithoutUserInfoTheStateIsUndecided) {
+  userInfo.reset();
+  EXPECT_EQ(updated(), ReportingState::undecided);
+}
+
+TEST_F(HTTPSPostBackendStateTest, UndecidedBecomesDecidedWhenUserInfoArrives) {
+  const auto later = *userInfo;
+  userInfo.reset();
+  updated();
+  backend->setUserInfoDict(later);
+  backend->updateState();
+  EXPECT_EQ(backend->state(), ReportingState::enabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, NoMatchingEntryDisables) {
+  userInfo->set(kTarnelUserInfoClientName, "Other");
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  clients = Array{5};
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  expectLog(LogLevel::warning, kWarning + std::string("clients[0] is not a dictionary and counts as absent"));
+}
+
+TEST_F(HTTPSPostBackendStateTest, EmptyClientListDisables) {
+  backend = HTTPSPostBackend::initWithName(world.dependencies, "httppost", Dictionary{{"clients", Array()}},
+                                           "Slate");
+  backend->setRequireUserInfo(true);
+  backend->setUserInfoDict(userInfo);
+  EXPECT_EQ(backend->updateBackendState(), ReportingState::disabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, ClientNamesCompareWholeAndServiceNamesPartly) {
+  entry.set("client", "A,B");
+  entry.set("service", "call,chat");
+  const auto with = [this](const char* client, const char* service) {
+    userInfo = Dictionary{{kTarnelUserInfoClientName, client}, {kTarnelUserInfoServiceName, service}};
+    return updated();
+  };
+  EXPECT_EQ(with("b", "my-CALL"), ReportingState::enabled);
+  EXPECT_EQ(with("A", "chatroom"), ReportingState::enabled);
+  EXPECT_EQ(with("B ", "call"), ReportingState::disabled);
+  EXPECT_EQ(with("AB", "call"), ReportingState::disabled);
+  EXPECT_EQ(with("a", "cal"), ReportingState::disabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, EntryWithoutNamesMatchesEveryClient) {
+  entry.remove("client");
+  entry.remove("service");
+  userInfo = Dictionary{{"unrelated", 1}};
+  EXPECT_EQ(updated(), ReportingState::enabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, AbsentNamesDoNotMatchLists) {
+  userInfo = Dictionary{{kTarnelUserInfoClientName, "Meetwell"}};
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  userInfo = Dictionary{{kTarnelUserInfoClientName, 5}, {kTarnelUserInfoServiceName, "video"}};
+  EXPECT_EQ(updated(), ReportingState::disabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, FirstMatchingEntryDecides) {
+  auto first = entry;
+  first.set("hierarchy", 1);
+  auto second = entry;
+  second.set("hierarchy", 2);
+  auto other = entry;
+  other.set("client", "Other");
+  clients = Array{other, first, second};
+  updated();
+  EXPECT_EQ(backend->hierarchy(), 1);
+}
+
+// --- batching override ---
+
+TEST_F(HTTPSPostBackendStateTest, ExpediteOverridesBatching) {
+  entry.set("expedite", 1);
+  updated();
+  EXPECT_FALSE(backend->batchEvents());
+  expectLog(LogLevel::debug, logPrefix() + "Store bag override  _batchEvent=0");
+  entry.set("expedite", 0);
+  batch = false;
+  updated();
+  EXPECT_TRUE(backend->batchEvents());
+  expectLog(LogLevel::debug, logPrefix() + "Store bag override  _batchEvent=1");
+}
+
+TEST_F(HTTPSPostBackendStateTest, BatchingStaysWithoutExpedite) {
+  for (const bool asked : {true, false}) {
+    batch = asked;
+    updated();
+    EXPECT_EQ(backend->batchEvents(), asked);
+  }
+  EXPECT_TRUE(world.log.startingWith(logPrefix() + "Store bag override").empty());
+}
+
+TEST_F(HTTPSPostBackendStateTest, OnlyTheFirstMatchingEntryOverridesBatching) {
+  auto second = entry;
+  second.set("expedite", 1);
+  clients = Array{entry, second};
+  updated();
+  EXPECT_TRUE(backend->batchEvents());
+}
+
+TEST_F(HTTPSPostBackendStateTest, BatchingIsOverriddenEvenWithoutUserInfo) {
+  entry.remove("client");
+  entry.remove("service");
+  entry.set("expedite", 1);
+  userInfo.reset();
+  EXPECT_EQ(updated(), ReportingState::undecided);
+  EXPECT_FALSE(backend->batchEvents());
+  requireUserInfo = false;
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  EXPECT_FALSE(backend->batchEvents());
+}
+
+// --- without required user information ---
+
+TEST_F(HTTPSPostBackendStateTest, WithoutRequiredUserInfoTheStateIsEnabled) {
+  requireUserInfo = false;
+  userInfo.reset();
+  world.consent.allowed = false;
+  entry.remove("filters");
+  entry.remove("locale_whitelist");
+  entry.remove("sampling_threshold");
+  entry.set("hierarchy", 4);
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  EXPECT_EQ(backend->postURL(), "https://events.example/post");
+  EXPECT_EQ(backend->hierarchy(), 0);
+  clients = Array{1};
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  EXPECT_EQ(backend->postURL(), std::nullopt);
+}
+
+TEST_F(HTTPSPostBackendStateTest, WithoutRequiredUserInfoTheFirstEntryWithAnAddressIsTaken) {
+  requireUserInfo = false;
+  userInfo.reset();
+  Dictionary noAddress{
+      {"client", "x"}, {"event_threshold", 1}, {"realtime_post_url", "https://first.example"}};
+  Dictionary taken{{"client", "y"}, {"event_threshold", 2}, {"post_url", "https://second.example"}};
+  clients = Array{noAddress, taken, entry};
+  updated();
+  EXPECT_EQ(backend->postURL(), "https://second.example");
+  expectLog(LogLevel::debug, "resetBackendStateWithClient: event_threshold set to 2");
+  expectLog(LogLevel::debug,
+            "HTTPSPostBackend(updatePostLink): Storebag 'https://first.example' for realtimePostURL");
+  expectLog(LogLevel::debug,
+            "HTTPSPostBackend(updatePostLink): Storebag 'https://second.example' for postURL");
+  expectLog(LogLevel::debug,
+            "HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL 'https://second.example'");
+  EXPECT_EQ(world.log.startingWith("HTTPSPostBackend(updatePostLink)").size(), 3U);
+}
+
+TEST_F(HTTPSPostBackendStateTest, WithoutAnyAddressTheThresholdIsResetToNothing) {
+  requireUserInfo = false;
+  entry.remove("post_url");
+  entry.remove("realtime_post_url");
+  entry.set("extras_on_internal", 1);
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  expectLog(LogLevel::debug, "resetBackendStateWithClient: event_threshold set to 0");
+  expectLog(LogLevel::debug, "setBackendStateWithClient: extras on internal is set to 0");
+  expectLog(LogLevel::debug,
+            "HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL '(null)'");
+}
+
+TEST_F(HTTPSPostBackendStateTest, OwnAddressOfTheSettingsLetsNoEntryBeTaken) {
+  world.settings.setObject("com.orvane.tarnel", "httpsPostURL", "https://own.example");
+  requireUserInfo = false;
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  EXPECT_EQ(backend->postURL(), "https://own.example");
+  expectLog(LogLevel::debug, "resetBackendStateWithClient: event_threshold set to 0");
+  expectLog(
+      LogLevel::debug,
+      "HTTPSPostBackend(updatePostLink): Storebag 'https://events.example/realtime' for realtimePostURL");
+}
+
+// --- hierarchy and consent ---
+
+TEST_F(HTTPSPostBackendStateTest, HierarchyIsThatOfTheEntry) {
+  updated();
+  EXPECT_EQ(backend->hierarchy(), 0);
+  entry.set("hierarchy", 2.9);
+  updated();
+  EXPECT_EQ(backend->hierarchy(), 2);
+}
+
+TEST_F(HTTPSPostBackendStateTest, WithheldConsentDisablesAfterTheHierarchyIsSet) {
+  world.consent.allowed = false;
+  entry.set("hierarchy", 1);
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  EXPECT_EQ(backend->hierarchy(), 1);
+  expectLog(LogLevel::debug, logPrefix() + "reporting disabled by DNU: 0.");
+}
+
+TEST_F(HTTPSPostBackendStateTest, OverrideOtherThanOneRespectsConsent) {
+  world.consent.allowed = false;
+  entry.set("override_dnu", 2);
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  expectLog(LogLevel::debug, logPrefix() + "reporting disabled by DNU: 2.");
+}
+
+TEST_F(HTTPSPostBackendStateTest, OverrideOfOneReportsWithoutConsent) {
+  world.consent.allowed = false;
+  for (const Value& one : {Value(1), Value(true), Value(1.7)}) {
+    entry.set("override_dnu", one);
+    EXPECT_EQ(updated(), ReportingState::enabled);
+  }
+}
+
+TEST_F(HTTPSPostBackendStateTest, RefusalLeavesWhatEarlierStepsSet) {
+  // The first update takes filters, threshold and consent type; the second is refused at the country.
+  entry.set("override_dnu", 1);
+  entry.set("sampling_threshold", 0.75);
+  updated();
+  ASSERT_EQ(backend->state(), ReportingState::enabled);
+  world.locale.country = "US";
+  backend->updateState();
+  EXPECT_EQ(backend->state(), ReportingState::disabled);
+  EXPECT_EQ(backend->samplingThreshold(), Value(0.75));
+  EXPECT_EQ(backend->postURL(), "https://events.example/post");
+  backend->setState(ReportingState::enabled);
+  send(*backend, 3, Flag::realtime, Dictionary{{"secret", "x"}}, 1);
+  const auto event = postedEvents().at(0);
+  EXPECT_FALSE(event.contains("secret"));
+  EXPECT_EQ(*event.find("Opt"), Value(2));
+}
+
+// --- country, family, model ---
+
+TEST_F(HTTPSPostBackendStateTest, CountryMustBeListed) {
+  world.locale.country = "US";
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  expectLog(LogLevel::debug, logPrefix() + "(US) isn't in country code list [\"DE\", \"FR\"]");
+}
+
+TEST_F(HTTPSPostBackendStateTest, EntryWithoutCountryListDisables) {
+  entry.remove("locale_whitelist");
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  expectLog(LogLevel::debug, logPrefix() + "(DE) isn't in country code list (null)");
+  entry.set("locale_whitelist", Array());
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  world.locale.country.reset();
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  expectLog(LogLevel::debug, logPrefix() + "((null)) isn't in country code list []");
+}
+
+TEST_F(HTTPSPostBackendStateTest, UnknownCountryPasses) {
+  world.locale.country.reset();
+  EXPECT_EQ(updated(), ReportingState::enabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, CountryItemsMatchPartlyIgnoringCase) {
+  entry.set("locale_whitelist", Array{"d"});
+  EXPECT_EQ(updated(), ReportingState::enabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, FamilyMustBeListedWhereAListIsGiven) {
+  entry.set("device_whitelist", Array{"Phone"});
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  expectLog(LogLevel::debug, logPrefix() + "(Slate) isn't in device whitelist [\"Phone\"]");
+  entry.set("device_whitelist", Array{"Phone", "slate"});
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  entry.set("device_whitelist", Array());
+  EXPECT_EQ(updated(), ReportingState::enabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, ListedModelIsBarred) {
+  entry.set("device_blacklist", Array{"Slate7"});
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  expectLog(LogLevel::debug, logPrefix() + "(Slate7,1) is in device blacklist [\"Slate7\"]");
+  entry.set("device_blacklist", Array{"Slate8"});
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  entry.set("device_blacklist", Array());
+  EXPECT_EQ(updated(), ReportingState::enabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, UnknownModelIsBarredByAnyList) {
+  entry.set("device_blacklist", Array{"Slate8"});
+  backend = make();
+  backend->setHardwareType(std::nullopt);
+  backend->updateState();
+  EXPECT_EQ(backend->state(), ReportingState::disabled);
+  expectLog(LogLevel::debug, logPrefix() + "((null)) is in device blacklist [\"Slate8\"]");
+}
+
+TEST_F(HTTPSPostBackendStateTest, FiltersAreRequired) {
+  entry.remove("filters");
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  expectLog(LogLevel::warning, logPrefix() + "filters are required.");
+  EXPECT_EQ(backend->samplingThreshold(), std::nullopt);
+  entry.set("filters", Array());
+  EXPECT_EQ(updated(), ReportingState::enabled);
+}
+
+// --- sampling ---
+
+TEST_F(HTTPSPostBackendStateTest, MissingThresholdDisablesButSetsTheRest) {
+  entry.remove("sampling_threshold");
+  entry.set("extras_on_internal", 3);
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  EXPECT_EQ(backend->postURL(), "https://events.example/post");
+  expectLog(LogLevel::debug, "resetBackendStateWithClient: event_threshold set to 49");
+  expectLog(LogLevel::debug, "setBackendStateWithClient: extras on internal is set to 3");
+  expectLog(LogLevel::debug,
+            logPrefix() +
+                "httppost: client found Meetwell:video-call, state=1, samplingFactor=0.500000, "
+                "hierarchy=0");
+}
+
+TEST_F(HTTPSPostBackendStateTest, DrawUpToTheThresholdEnables) {
+  entry.set("sampling_threshold", 0.25);
+  entry.set("override_sampling", 0);
+  world.random.setUniform(0.25);
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  world.random.setUniform(0.2500001);
+  EXPECT_EQ(updated(), ReportingState::disabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, ThresholdOfZeroSamplesOutAllButADrawOfZero) {
+  entry.set("sampling_threshold", 0);
+  world.random.setUniform(0);
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  world.random.setUniform(1e-9);
+  EXPECT_EQ(updated(), ReportingState::sampledOut);
+  world.random.setUniform(0.999);
+  EXPECT_EQ(updated(), ReportingState::sampledOut);
+}
+
+TEST_F(HTTPSPostBackendStateTest, OverrideSamplingBoundsTheSampledOut) {
+  entry.set("sampling_threshold", 0.1);
+  entry.set("override_sampling", 0.5);
+  world.random.setUniform(0.5);
+  EXPECT_EQ(updated(), ReportingState::sampledOut);
+  world.random.setUniform(0.51);
+  EXPECT_EQ(updated(), ReportingState::disabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, ThresholdOfTheCountryReplacesTheGeneralOne) {
+  entry.set("sampling_threshold", 0.126);
+  entry.set("per_country_sampling_thresholds",
+            Array{Dictionary{{"country", Array{"US", "de"}}, {"threshold", 0.9}},
+                  Dictionary{{"country", Array{"FR", "DE"}}, {"threshold", 0.754}},
+                  Dictionary{{"country", Array{"DE"}}, {"threshold", 0.1}}});
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  EXPECT_EQ(backend->samplingThreshold(), Value(0.754));
+  expectLog(LogLevel::debug, logPrefix() + "sampling threshold for DE changed from 0.13 to 0.75");
+  EXPECT_EQ(world.log.startingWith(logPrefix() + "sampling threshold for").size(), 1U);
+}
+
+TEST_F(HTTPSPostBackendStateTest, OtherCountriesKeepTheGeneralThreshold) {
+  entry.set("per_country_sampling_thresholds",
+            Array{Dictionary{{"country", Array{"US"}}, {"threshold", 0.1}}, Dictionary{{"threshold", 0.1}}});
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  world.locale.country.reset();
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  EXPECT_EQ(backend->samplingThreshold(), Value(1));
+}
+
+TEST_F(HTTPSPostBackendStateTest, CountryItemWithoutThresholdTakesTheThresholdAway) {
+  entry.set("per_country_sampling_thresholds", Array{Dictionary{{"country", Array{"DE"}}}});
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  EXPECT_EQ(backend->samplingThreshold(), std::nullopt);
+  expectLog(LogLevel::debug, logPrefix() + "sampling threshold for DE changed from 1.00 to 0.00");
+}
+
+// --- what a decision leaves ---
+
+TEST_F(HTTPSPostBackendStateTest, LogsTheClientThatItFound) {
+  entry.set("hierarchy", 1);
+  updated();
+  expectLog(LogLevel::debug,
+            logPrefix() +
+                "httppost: client found Meetwell:video-call, state=2, samplingFactor=0.500000, "
+                "hierarchy=1");
+  expectLog(LogLevel::debug,
+            "HTTPSPostBackend(updatePostLink): Storebag 'https://events.example/post' for postURL");
+  expectLog(
+      LogLevel::debug,
+      "HTTPSPostBackend(updatePostLink): Storebag 'https://events.example/realtime' for realtimePostURL");
+}
+
+TEST_F(HTTPSPostBackendStateTest, EntryWithoutAddressKeepsTheOldOne) {
+  updated();
+  auto bare = entry;
+  bare.remove("post_url");
+  bare.remove("realtime_post_url");
+  clients = Array{bare};
+  backend = make();
+  backend->setPostURL("https://old.example");
+  backend->updateState();
+  EXPECT_EQ(backend->postURL(), "https://old.example");
+  expectLog(LogLevel::debug,
+            "HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL 'https://old.example'");
+}
+
+TEST_F(HTTPSPostBackendStateTest, MissingEventThresholdFlushesBeforeTheSecondEvent) {
+  entry.remove("event_threshold");
+  updated();
+  send(*backend);
+  EXPECT_TRUE(world.http.requests().empty());
+  send(*backend);
+  EXPECT_EQ(postedEvents().size(), 1U);
+}
+
+TEST_F(HTTPSPostBackendStateTest, UpdateUndoesWhatAServerDisabled) {
+  updated();
+  backend->setState(ReportingState::disabled);
+  backend->updateState();
+  EXPECT_EQ(backend->state(), ReportingState::enabled);
+}
+
+// --- values of the wrong type ---
+
+struct WrongType {
+  const char* key;
+  Value value;
+  const char* expected;
+  ReportingState state;  // as for an entry without the key
+};
+
+class HTTPSPostBackendWrongTypeTest : public HTTPSPostBackendStateTest,
+                                      public ::testing::WithParamInterface<WrongType> {};
+
+TEST_P(HTTPSPostBackendWrongTypeTest, CountsAsAbsentWithOneWarning) {
+  world.random.setUniform(0.5);
+  if (std::string_view(GetParam().key) == "override_sampling") entry.set("sampling_threshold", 0.1);
+  entry.set(GetParam().key, GetParam().value);
+  EXPECT_EQ(updated(), GetParam().state);
+  expectLog(LogLevel::warning, kWarning + std::string("clients[0].") + GetParam().key + " is not " +
+                                   GetParam().expected + " and counts as absent");
+  EXPECT_EQ(world.log.startingWith(kWarning + std::string("clients[0].")).size(), 1U);
+  EXPECT_EQ(batch, backend->batchEvents());
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Keys, HTTPSPostBackendWrongTypeTest,
+    ::testing::Values(WrongType{"client", 1, "a text", ReportingState::enabled},
+                      WrongType{"service", Array{"video"}, "a text", ReportingState::enabled},
+                      WrongType{"expedite", "yes", "a number", ReportingState::enabled},
+                      WrongType{"hierarchy", "1", "a number", ReportingState::enabled},
+                      WrongType{"override_dnu", Value(), "a number", ReportingState::enabled},
+                      WrongType{"locale_whitelist", "DE", "an array", ReportingState::disabled},
+                      WrongType{"device_whitelist", Dictionary(), "an array", ReportingState::enabled},
+                      WrongType{"device_blacklist", "Slate7,1", "an array", ReportingState::enabled},
+                      WrongType{"filters", Dictionary(), "an array", ReportingState::disabled},
+                      WrongType{"sampling_threshold", "1", "a number", ReportingState::disabled},
+                      WrongType{"per_country_sampling_thresholds", 1, "an array", ReportingState::enabled},
+                      WrongType{"override_sampling", Date{1}, "a number", ReportingState::sampledOut},
+                      WrongType{"custom_clientId", Value(), "a value", ReportingState::enabled},
+                      WrongType{"event_threshold", "5", "a number", ReportingState::enabled},
+                      WrongType{"extras_on_internal", Data{1}, "a number", ReportingState::enabled},
+                      WrongType{"post_url", 5, "a text", ReportingState::enabled},
+                      WrongType{"realtime_post_url", Array(), "a text", ReportingState::enabled}),
+    [](const auto& parameter) { return std::string(parameter.param.key); });
+
+TEST_F(HTTPSPostBackendStateTest, WrongTypesInsideListsCountAsAbsent) {
+  entry.set("locale_whitelist", Array{1, "DE", 2});
+  entry.set("per_country_sampling_thresholds",
+            Array{"x", Dictionary{{"country", "DE"}, {"threshold", 0}},
+                  Dictionary{{"country", Array{1, "DE"}}, {"threshold", "0"}}});
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  for (const char* text : {"clients[0].locale_whitelist[0] is not a text",
+                           "clients[0].per_country_sampling_thresholds[0] is not a dictionary",
+                           "clients[0].per_country_sampling_thresholds[1].country is not an array",
+                           "clients[0].per_country_sampling_thresholds[2].country[0] is not a text",
+                           "clients[0].per_country_sampling_thresholds[2].threshold is not a number"}) {
+    expectLog(LogLevel::warning, kWarning + std::string(text) + " and counts as absent");
+  }
+  EXPECT_EQ(world.log.startingWith(kWarning + std::string("clients[0].")).size(), 5U);
+}
+
+TEST_F(HTTPSPostBackendStateTest, ListWithoutAnyTextCountsAsEmpty) {
+  entry.set("device_whitelist", Array{1, 2});
+  EXPECT_EQ(updated(), ReportingState::enabled);
+}
+
+TEST_F(HTTPSPostBackendStateTest, EveryUpdateWarnsAnew) {
+  entry.set("hierarchy", "1");
+  updated();
+  backend->updateState();
+  EXPECT_EQ(world.log.startingWith(kWarning + std::string("clients[0].hierarchy")).size(), 2U);
+}
+
+TEST_F(HTTPSPostBackendStateTest, ManyWrongEntriesAreOneWarning) {
+  for (int i = 0; i < 100; ++i) clients.append(Dictionary{{"client", 1}, {"service", "none"}});
+  EXPECT_EQ(updated(), ReportingState::disabled);
+  EXPECT_EQ(world.log.startingWith(kWarning).size(), 1U);
+}
+
+}  // namespace
+}  // namespace tarnel
