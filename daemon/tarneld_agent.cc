@@ -11,12 +11,17 @@ constexpr char kEntitlement[] = "com.orvane.private.tarneld";
 }  // namespace
 
 std::shared_ptr<TarneldAgent> TarneldAgent::init(const Dependencies& dependencies,
-                                                 BackendFactory backendFactory) {
-  return std::make_shared<TarneldAgent>(Key(), dependencies, std::move(backendFactory));
+                                                 BackendFactory backendFactory,
+                                                 StorebagFetcher storebagFetcher) {
+  return std::make_shared<TarneldAgent>(Key(), dependencies, std::move(backendFactory),
+                                        std::move(storebagFetcher));
 }
 
-TarneldAgent::TarneldAgent(Key /*key*/, const Dependencies& dependencies, BackendFactory backendFactory)
-    : dependencies_(dependencies), backendFactory_(std::move(backendFactory)) {}
+TarneldAgent::TarneldAgent(Key /*key*/, const Dependencies& dependencies, BackendFactory backendFactory,
+                           StorebagFetcher storebagFetcher)
+    : dependencies_(dependencies),
+      backendFactory_(std::move(backendFactory)),
+      storebagFetcher_(std::move(storebagFetcher)) {}
 
 bool TarneldAgent::shouldAcceptNewConnection(IpcListener& /*listener*/,
                                              std::shared_ptr<IpcConnection> connection) {

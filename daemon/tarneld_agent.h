@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -15,6 +16,7 @@
 #include "session/tarneld_session.h"
 #include "session/tarneld_session_delegate.h"
 #include "util/dependencies.h"
+#include "util/storebag.h"
 
 namespace tarnel {
 
@@ -23,6 +25,10 @@ class SessionListLock : public RecursiveLock {};
 
 // Seconds that must lie between a failed storebag fetch and the next.
 inline constexpr int32_t kStorebagRetrySeconds = 900;
+
+// Fetches one section. fetchStorebagForEnvironmentAndClientType everywhere but in tests.
+using StorebagFetcher = std::function<std::optional<Dictionary>(
+    const Dependencies& dependencies, int32_t clientType, StorebagFetchSlots slots)>;
 
 // What the daemon knows of one storebag. Members are absent until a fetch has said something about them.
 struct StorebagCacheEntry {
@@ -55,10 +61,13 @@ class TarneldAgent final : public IpcListenerDelegate,
   static constexpr size_t kCorrelationKeyBytes = 1U << 20U;
 
   // init
-  // dependencies: by reference; must outlive the agent and every session. backendFactory: for the sessions.
+  // dependencies: by reference; must outlive the agent and every session. backendFactory: for the
+  // sessions.
   static std::shared_ptr<TarneldAgent> init(
-      const Dependencies& dependencies, BackendFactory backendFactory = &TarnelBackend::newBackendWithName);
-  TarneldAgent(Key key, const Dependencies& dependencies, BackendFactory backendFactory);
+      const Dependencies& dependencies, BackendFactory backendFactory = &TarnelBackend::newBackendWithName,
+      StorebagFetcher storebagFetcher = &fetchStorebagForEnvironmentAndClientType);
+  TarneldAgent(Key key, const Dependencies& dependencies, BackendFactory backendFactory,
+               StorebagFetcher storebagFetcher);
 
   // IpcListenerDelegate. The session's invalidation handler keeps agent and session alive until it ran.
   bool shouldAcceptNewConnection(IpcListener& listener, std::shared_ptr<IpcConnection> connection) override;
@@ -82,7 +91,7 @@ class TarneldAgent final : public IpcListenerDelegate,
  private:
   using SessionList = std::vector<std::shared_ptr<TarneldSession>>;
 
-  static std::shared_ptr<TarneldSession> getFirstSessionWithHierarchy(int32_t hierarchy,
+  static std::shared_ptr<TarneldSession> getFirstSessionWithHierarchy(int64_t hierarchy,
                                                                       const SessionList& sessionList);
 
   void connectionInvalidated(const std::shared_ptr<TarneldSession>& session);
@@ -101,6 +110,7 @@ class TarneldAgent final : public IpcListenerDelegate,
 
   const Dependencies& dependencies_;
   const BackendFactory backendFactory_;
+  const StorebagFetcher storebagFetcher_;
 
   SessionListLock _sessionListLock;
   SessionList _sessionList TARNEL_GUARDED_BY(_sessionListLock);

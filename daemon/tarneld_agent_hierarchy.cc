@@ -27,11 +27,6 @@ std::optional<int32_t> nextLevel(const std::vector<std::shared_ptr<TarneldSessio
   return next;
 }
 
-// One up; wraps below the lowest number.
-int32_t levelAbove(int32_t level) {
-  return static_cast<int32_t>(int64_t{level} - 1);
-}
-
 }  // namespace
 
 void TarneldAgent::userInfoUpdatedForSession(TarneldSession& session) {
@@ -52,7 +47,7 @@ void TarneldAgent::userInfoUpdatedForSession(TarneldSession& session) {
   filedUnder_.emplace(&session, key);
 }
 
-std::shared_ptr<TarneldSession> TarneldAgent::getFirstSessionWithHierarchy(int32_t hierarchy,
+std::shared_ptr<TarneldSession> TarneldAgent::getFirstSessionWithHierarchy(int64_t hierarchy,
                                                                            const SessionList& sessionList) {
   const auto found = std::find_if(sessionList.begin(), sessionList.end(),
                                   [hierarchy](const std::shared_ptr<TarneldSession>& candidate) {
@@ -80,11 +75,11 @@ std::shared_ptr<TarneldSession> TarneldAgent::parentSessionForChild(TarneldSessi
                child.sessionID(), key.c_str());
     return nullptr;
   }
-  auto parent = getFirstSessionWithHierarchy(levelAbove(level), *list);
+  auto parent = getFirstSessionWithHierarchy(int64_t{level} - 1, *list);
   if (parent == nullptr) {
     TARNEL_LOG(log, information,
                "parentSessionForChild: Unable to find session with hierarchy of %d for userInfoKey '%s'",
-               levelAbove(level), key.c_str());
+               static_cast<int32_t>(int64_t{level} - 1), key.c_str());
   }
   return parent;
 }
@@ -110,7 +105,7 @@ MaybeString TarneldAgent::parentSessionIDStringForSession(TarneldSession& sessio
     return std::nullopt;
   }
   MaybeString text;
-  for (int32_t level = hierarchy - 1; level >= 0; --level) {
+  for (int64_t level = int64_t{hierarchy} - 1; level >= 0; --level) {
     const auto ancestor = getFirstSessionWithHierarchy(level, *list);
     if (ancestor == nullptr) {
       TARNEL_LOG(log, information,

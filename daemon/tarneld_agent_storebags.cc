@@ -92,7 +92,7 @@ void TarneldAgent::fetchAndCacheStorebag(int32_t clientType) {
   }
   StorebagCacheEntry& entry = _cachedStorebags[*name];
   FetchRecord record(dependencies_.clock, entry);
-  auto storebag = fetchStorebagForEnvironmentAndClientType(dependencies_, clientType, record.slots());
+  auto storebag = storebagFetcher_(dependencies_, clientType, record.slots());
   TARNEL_LOG(log, debug, "fetchAndCacheStorebag: Storebag max age: %d seconds", record.maxAge());
   if (storebag) {
     entry.StorebagData = std::move(storebag);

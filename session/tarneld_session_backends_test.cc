@@ -1,0 +1,342 @@
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "session/session_fixture.h"
+
+namespace tarnel::fake {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+
+class SessionBackends : public SessionTest {
+ protected:
+  ReportingState stateOf(const std::string& name) { return backends.last(name)->state(); }
+};
+
+TEST_F(SessionBackends, CreateBackendsWantsAStorebagAndSessionInfo) {
+  EXPECT_FALSE(createBackends(world.dependencies, backends.factory(), std::nullopt, info(), user(), "id"));
+  EXPECT_TRUE(logged(LogLevel::error, "createBackends: Attempted to create backends with nil storebag"));
+  EXPECT_FALSE(
+      createBackends(world.dependencies, backends.factory(), Dictionary(), std::nullopt, user(), "id"));
+  EXPECT_TRUE(logged(LogLevel::error, "createBackends: Attempted to create backends with nil session info"));
+}
+
+TEST_F(SessionBackends, CreateBackendsTellsEachWhoReports) {
+  world.deviceInformation.answers["ReleaseType"] = "Internal";
+  world.clock.set({1700000007, 500000});
+  backends.scripts["httppost"];
+  Dictionary sessionInfo = info(77);
+  sessionInfo.set(kTarnelSessionInfoClientVersion, 0x20003);
+  sessionInfo.set(kTarnelSessionInfoBatchEvent, true);
+  const Dictionary profile = {{"clients", Array{}}};
+  const auto made = createBackends(world.dependencies, backends.factory(), Dictionary{{"httppost", profile}},
+                                   sessionInfo, user(), "0123456789");
+  ASSERT_TRUE(made);
+  ASSERT_EQ(made->size(), 1U);
+  const auto backend = backends.last("httppost");
+  EXPECT_EQ(made->find("httppost"), backend.get());
+  EXPECT_EQ(made->find("dashboard"), nullptr);
+  EXPECT_EQ(backend->sessionID(), 77U);
+  EXPECT_EQ(backend->compType(), 8);
+  EXPECT_EQ(backend->factoryClientType, 8);
+  EXPECT_EQ(backend->clientVersion(), 3);
+  EXPECT_EQ(backend->udid(), "0123456789");
+  EXPECT_EQ(backend->productVersion(), "12.5");
+  EXPECT_EQ(backend->buildVersion(), "24A100");
+  EXPECT_EQ(backend->hardwareType(), "Slate7,1");
+  EXPECT_EQ(backend->productFamily(), "Slate");
+  EXPECT_TRUE(backend->isInternal());
+  EXPECT_TRUE(backend->requireUserInfo());
+  EXPECT_TRUE(backend->batchEvents());
+  EXPECT_EQ(backend->userInfoDict(), user());
+  EXPECT_EQ(backend->selfVersion(), std::pair(3, 2));
+  EXPECT_DOUBLE_EQ(backend->startTime(), 1700000007.5);
+  EXPECT_EQ(backend->profileValue, Value(profile));
+}
+
+TEST_F(SessionBackends, CreateBackendsTakesVersionEightWithoutABundle) {
+  world.clientBundle.versionText.reset();
+  world.deviceInformation.answers.erase("DeviceName");
+  backends.scripts["httppost"];
+  createBackends(world.dependencies, backends.factory(), sectionOf({"httppost"}), info(7, false), user(), "");
+  const auto backend = backends.last("httppost");
+  EXPECT_EQ(backend->selfVersion(), std::pair(8, 0));
+  EXPECT_FALSE(backend->productFamily());
+  EXPECT_FALSE(backend->isInternal());
+  EXPECT_FALSE(backend->requireUserInfo());
+  EXPECT_FALSE(backend->batchEvents());
+}
+
+TEST_F(SessionBackends, AKeyThatIsNoBackendCreatesNothing) {
+  offer({"httppost"});
+  delegate->storebag = sectionOf({"surprise", "httppost"});
+  configureAndStart();
+  EXPECT_EQ(session->backends().size(), 1U);
+  EXPECT_TRUE(world.log.startingWith("createBackends: ").empty());
+}
+
+TEST_F(SessionBackends, ProfilesOfAnyKindReachTheFactory) {
+  offer({"httppost"});
+  delegate->storebag = Dictionary{{"httppost", "no dictionary"}};
+  configureAndStart();
+  EXPECT_EQ(backends.last("httppost")->profileValue, Value("no dictionary"));
+}
+
+TEST_F(SessionBackends, NewBackendsCarryTheSessionsIdentifier) {
+  offer({"httppost", "dashboard"});
+  configureAndStart();
+  EXPECT_EQ(backends.last("httppost")->combinedSessionIDString(), session->sessionIDString());
+  EXPECT_EQ(backends.last("dashboard")->combinedSessionIDString(), session->sessionIDString());
+}
+
+TEST_F(SessionBackends, CreatingBackendsIsLogged) {
+  offer({"httppost"});
+  session->setSessionInfo(info(), user(), std::nullopt, false);
+  session->startConfigWithCompletionHandler(nullptr);
+  EXPECT_TRUE(logged(LogLevel::debug, "createBackendsWithStorebag: Creating backends for session 7"));
+}
+
+TEST_F(SessionBackends, HierarchyIsThatOfHttpPost2ElseOfHttpPostElseZero) {
+  offer({"dravik", "httppost", "httppost2"});
+  backends.scripts["dravik"].hierarchy = 9;
+  backends.scripts["httppost"].hierarchy = 1;
+  backends.scripts["httppost2"].hierarchy = 2;
+  EXPECT_EQ(session->getSessionHierarchy(), 0);
+  configureAndStart();
+  EXPECT_EQ(session->getSessionHierarchy(), 2);
+  delegate->storebag = sectionOf({"dravik", "httppost"});
+  session->startConfigWithCompletionHandler(nullptr);
+  EXPECT_EQ(session->getSessionHierarchy(), 1);
+  delegate->storebag = sectionOf({"dravik"});
+  session->startConfigWithCompletionHandler(nullptr);
+  EXPECT_EQ(session->getSessionHierarchy(), 0);
+}
+
+// User info.
+
+TEST_F(SessionBackends, FirstUserInfoIsNew) {
+  offer({"httppost"});
+  session->setSessionInfo(info(), std::nullopt, std::nullopt, false);
+  session->startConfigWithCompletionHandler(nullptr);
+  backends.journal.clear();
+  session->receivedUserInfo(std::nullopt);
+  EXPECT_THAT(backends.journal.lines(), IsEmpty());
+  session->receivedUserInfo(user());
+  EXPECT_THAT(backends.journal.lines(), ElementsAre("httppost setUserInfoDict", "userInfoUpdatedForSession",
+                                                    "httppost updateState", "updateDownstreamSessions"));
+  EXPECT_TRUE(logged(LogLevel::debug, "receivedUserInfo: Received new user info for session 7"));
+  EXPECT_EQ(backends.last("httppost")->userInfoDict(), user());
+}
+
+TEST_F(SessionBackends, SameNamesUpdateTheBackendsButSyncNothing) {
+  offer({"httppost"});
+  configureAndStart();
+  Dictionary more = user();
+  more.set("extra", 1);
+  session->receivedUserInfo(more);
+  EXPECT_THAT(backends.journal.lines(), ElementsAre("httppost setUserInfoDict"));
+  EXPECT_EQ(session->userInfo(), more);
+  EXPECT_THAT(world.log.startingWith("receivedUserInfo"), IsEmpty());
+}
+
+TEST_F(SessionBackends, AChangeOfEitherNameIsNew) {
+  offer({"httppost"});
+  configureAndStart();
+  const std::string line = "receivedUserInfo: Received new user info for session 7";
+  session->receivedUserInfo(user("Phone", "Video"));
+  EXPECT_EQ(world.log.count(LogLevel::debug, line), 1U);
+  session->receivedUserInfo(user("phone", "Video"));  // compared as it stands, case and all
+  EXPECT_EQ(world.log.count(LogLevel::debug, line), 2U);
+  session->receivedUserInfo(Dictionary{{kTarnelUserInfoServiceName, "Video"}});
+  EXPECT_EQ(world.log.count(LogLevel::debug, line), 3U);
+  session->receivedUserInfo(Dictionary{{kTarnelUserInfoServiceName, "Video"}, {"extra", 1}});
+  EXPECT_EQ(world.log.count(LogLevel::debug, line), 3U);
+}
+
+TEST_F(SessionBackends, MissingUserInfoIsIgnoredWhereItIsRequiredAndElseReplaces) {
+  offer({"httppost"});
+  configureAndStart();
+  session->receivedUserInfo(std::nullopt);
+  EXPECT_EQ(session->userInfo(), user());
+  session->setSessionInfo(info(7, false), user(), std::nullopt, false);
+  session->receivedUserInfo(std::nullopt);
+  EXPECT_FALSE(session->userInfo());
+  EXPECT_FALSE(backends.last("httppost")->userInfoDict());
+  EXPECT_TRUE(logged(LogLevel::debug, "receivedUserInfo: Received new user info for session 7"));
+}
+
+// Sync.
+
+class SessionSync : public SessionBackends {
+ protected:
+  // The parent's backends go with this class; it must not outlive them.
+  ~SessionSync() override { delegate->parent.reset(); }
+
+  // A parent session with these backends, all at this state and threshold.
+  void giveParent(const std::vector<std::string>& names, ReportingState state,
+                  std::optional<Value> threshold) {
+    parentBackends.scripts.clear();
+    for (const auto& name : names) {
+      parentBackends.scripts[name].decides = state;
+      parentBackends.scripts[name].threshold = threshold;
+    }
+    parentDelegate->storebag = sectionOf(names);
+    auto parent = TarneldSession::initWithSessionDelegate(
+        world.dependencies, parentDelegate, std::make_shared<FakeConnection>(), parentBackends.factory());
+    parent->setSessionInfo(info(1), user(), std::nullopt, false);
+    parent->startConfigWithCompletionHandler(nullptr);
+    world.log.clear();
+    delegate->parent = parent;
+  }
+
+  FakeBackends parentBackends;
+  std::shared_ptr<FakeDelegate> parentDelegate = std::make_shared<FakeDelegate>(parentBackends.journal);
+};
+
+TEST_F(SessionSync, ChildTakesStateAndThresholdOfItsParentsBackend) {
+  giveParent({"httppost"}, ReportingState::disabled, Value(0.25));
+  offer({"httppost"});
+  backends.scripts["httppost"].threshold = Value(0.5);
+  session->setSessionInfo(info(), user(), std::nullopt, false);
+  session->startConfigWithCompletionHandler(nullptr);
+  EXPECT_EQ(stateOf("httppost"), ReportingState::disabled);
+  EXPECT_EQ(backends.last("httppost")->samplingThreshold(), Value(0.25));
+  EXPECT_TRUE(logged(LogLevel::debug,
+                     "HTTPSPostBackend(syncReportingStates): httppost: state and sampling rate updated to 1, "
+                     "0.25%"));
+}
+
+TEST_F(SessionSync, AMissingThresholdIsCopiedAndPrintedAsZero) {
+  giveParent({"httppost"}, ReportingState::sampledOut, std::nullopt);
+  offer({"httppost"});
+  backends.scripts["httppost"].threshold = Value(0.5);
+  configureAndStart();
+  EXPECT_EQ(stateOf("httppost"), ReportingState::sampledOut);
+  EXPECT_FALSE(backends.last("httppost")->samplingThreshold());
+  backends.last("httppost")->setState(ReportingState::enabled);
+  session->syncReportingStates();
+  EXPECT_TRUE(logged(LogLevel::debug,
+                     "HTTPSPostBackend(syncReportingStates): httppost: state and sampling rate updated to 3, "
+                     "0.00%"));
+}
+
+TEST_F(SessionSync, AChildThatIsSampledOutKeepsItsStateAndThreshold) {
+  giveParent({"httppost"}, ReportingState::enabled, Value(0.25));
+  offer({"httppost", "dashboard"});
+  for (auto& [name, script] : backends.scripts) {
+    script.decides = ReportingState::sampledOut;
+    script.threshold = Value(0.5);
+  }
+  configureAndStart();
+  EXPECT_EQ(stateOf("httppost"), ReportingState::sampledOut);
+  EXPECT_EQ(backends.last("httppost")->samplingThreshold(), Value(0.5));
+  EXPECT_EQ(stateOf("dashboard"), ReportingState::sampledOut);
+  session->syncReportingStates();
+  EXPECT_THAT(world.log.startingWith("HTTPSPostBackend(syncReportingStates)"), IsEmpty());
+}
+
+TEST_F(SessionSync, ABackendThatTheParentLacksIsDisabled) {
+  giveParent({"httppost"}, ReportingState::enabled, std::nullopt);
+  offer({"httppost", "dashboard"});
+  backends.scripts["dashboard"].threshold = Value(0.5);
+  configureAndStart();
+  EXPECT_EQ(stateOf("httppost"), ReportingState::enabled);
+  EXPECT_EQ(stateOf("dashboard"), ReportingState::disabled);
+  EXPECT_EQ(backends.last("dashboard")->samplingThreshold(), Value(0.5));
+}
+
+TEST_F(SessionSync, AChildWithoutItsParentSaysSoForEachDeeperBackend) {
+  offer({"httppost", "httppost2", "dashboard"});
+  backends.scripts["httppost"].hierarchy = 1;
+  backends.scripts["httppost2"].hierarchy = 2;
+  configureAndStart();
+  session->syncReportingStates();
+  EXPECT_TRUE(logged(LogLevel::information,
+                     "syncReportingStates: child session 7 (backend httppost) with hierarchy 1 is missing "
+                     "its parent"));
+  EXPECT_TRUE(logged(LogLevel::information,
+                     "syncReportingStates: child session 7 (backend httppost2) with hierarchy 2 is missing "
+                     "its parent"));
+  EXPECT_EQ(world.log.startingWith("syncReportingStates").size(), 2U);
+  EXPECT_EQ(stateOf("httppost"), ReportingState::enabled);
+}
+
+TEST_F(SessionSync, SyncTakesTheAgentsLock) {
+  const int locks = delegate->locksTaken;
+  session->syncReportingStates();
+  EXPECT_EQ(delegate->locksTaken, locks + 1);
+}
+
+TEST_F(SessionSync, CombinedIdentifierIsTheParentsAndOnesOwn) {
+  offer({"httppost"});
+  delegate->parentID = "TOP.MIDDLE";
+  configureAndStart();
+  const std::string combined = "TOP.MIDDLE." + session->sessionIDString();
+  EXPECT_EQ(backends.last("httppost")->combinedSessionIDString(), combined);
+  session->updateCombinedSessionID();
+  EXPECT_TRUE(logged(LogLevel::debug, "updateCombinedSessionID: Updating combined session ID '" + combined +
+                                          "' for session 7 backends"));
+}
+
+TEST_F(SessionSync, WithoutParentTheIdentifierStays) {
+  offer({"httppost"});
+  configureAndStart();
+  session->updateCombinedSessionID();
+  EXPECT_THAT(world.log.startingWith("updateCombinedSessionID"), IsEmpty());
+  EXPECT_EQ(backends.last("httppost")->combinedSessionIDString(), session->sessionIDString());
+}
+
+// What other sessions change reaches the backends with this session's next own step.
+
+TEST_F(SessionSync, AnIdentifierFromAnotherSessionIsAppliedBeforeTheNextMessage) {
+  offer({"httppost"});
+  configureAndStart();
+  session->sendMessageWithCategory(1, 2, std::nullopt);
+  delegate->parentID = "TOP";
+  session->updateCombinedSessionID();
+  EXPECT_THAT(backends.journal.lines(), ElementsAre("httppost send 1/2"));
+  session->sendMessageWithCategory(3, 4, std::nullopt);
+  EXPECT_THAT(backends.journal.lines(),
+              ElementsAre("httppost send 1/2", "httppost setCorrelatedSessionID", "httppost send 3/4"));
+  for (const auto& event : backends.last("httppost")->sent) {
+    EXPECT_EQ(event.sessionID, "TOP." + session->sessionIDString());
+  }
+}
+
+TEST_F(SessionSync, AStateFromAnotherSessionHoldsAtOnceAndAThresholdIsSeenAtOnce) {
+  offer({"httppost"});
+  configureAndStart();
+  giveParent({"httppost"}, ReportingState::disabled, Value(0.125));
+  session->syncReportingStates();
+  EXPECT_EQ(stateOf("httppost"), ReportingState::disabled);
+  EXPECT_EQ(session->reports().at(0).samplingThreshold, Value(0.125));
+  EXPECT_FALSE(backends.last("httppost")->samplingThreshold());
+  session->flushMessagesWithCompletion(nullptr);
+  EXPECT_EQ(backends.last("httppost")->samplingThreshold(), Value(0.125));
+}
+
+TEST_F(SessionSync, WhatWasNotedForReplacedBackendsIsVoid) {
+  offer({"httppost"});
+  configureAndStart();
+  delegate->parentID = "TOP";
+  session->updateCombinedSessionID();
+  delegate->parentID.reset();
+  session->startConfigWithCompletionHandler(nullptr);
+  EXPECT_EQ(backends.last("httppost")->combinedSessionIDString(), session->sessionIDString());
+}
+
+TEST_F(SessionSync, TheStopMessageCarriesTheLastIdentifier) {
+  offer({"httppost"});
+  configureAndStart();
+  delegate->parentID = "TOP";
+  session->updateCombinedSessionID();
+  const auto backend = backends.last("httppost");
+  const std::string own = session->sessionIDString();
+  session.reset();
+  EXPECT_EQ(backend->sent.back().respCode, RespCode{1});
+  EXPECT_EQ(backend->sent.back().sessionID, "TOP." + own);
+}
+
+}  // namespace
+}  // namespace tarnel::fake
