@@ -97,7 +97,8 @@ constexpr std::array kRules{
 };
 
 bool isSection(std::string_view name) {
-  return std::any_of(kRules.begin(), kRules.end(), [name](const KeyRule& rule) { return name == rule.section; });
+  return std::any_of(kRules.begin(), kRules.end(),
+                     [name](const KeyRule& rule) { return name == rule.section; });
 }
 
 const KeyRule* findRule(std::string_view section, std::string_view key) {
@@ -141,8 +142,9 @@ void listTrustFiles(const std::string& directory, Configuration& configuration) 
       configuration.problems.push_back({LogLevel::error, contents.error().localizedDescription()});
     } else if (contents->text.find("-----BEGIN CERTIFICATE-----") == std::string::npos) {
       configuration.problems.push_back(
-          {LogLevel::error, path + ": holds no certificate in PEM form (a line -----BEGIN CERTIFICATE-----); it "
-                                   "is not used"});
+          {LogLevel::error, path +
+                                ": holds no certificate in PEM form (a line -----BEGIN CERTIFICATE-----); it "
+                                "is not used"});
     } else {
       configuration.trustFiles.push_back(path);
     }

@@ -25,16 +25,16 @@ struct ConfigurationProblem {
 
 struct Configuration {
   struct Limits {
-    uint32_t connections = 1024;            // of all clients together
+    uint32_t connections = 1024;  // of all clients together
     uint32_t connectionsPerUser = 64;
     std::chrono::seconds idleExit{0};       // 0: an idle process stays
     uint64_t maxUploadBytes = 256U << 20U;  // of one client file
   };
   struct Http {
     std::chrono::seconds connectTimeout{10};
-    std::chrono::seconds noProgress{30};    // without a byte in either direction
-    uint64_t maxAnswerBytes = 16U << 20U;   // of one answer
-    uint64_t maxQueuedBytes = 16U << 20U;   // bodies of all posts that have not ended
+    std::chrono::seconds noProgress{30};   // without a byte in either direction
+    uint64_t maxAnswerBytes = 16U << 20U;  // of one answer
+    uint64_t maxQueuedBytes = 16U << 20U;  // bodies of all posts that have not ended
     uint32_t connectionsPerHost = 4;
     uint32_t connections = 64;
   };

@@ -42,7 +42,9 @@ bool choose(const Directories::Environment& environment, const char* variable, c
   return path != installed;
 }
 
-std::string parentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
+std::string parentOf(const std::string& path) {
+  return path.substr(0, path.rfind('/'));
+}
 
 }  // namespace
 

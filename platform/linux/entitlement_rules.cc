@@ -66,9 +66,10 @@ class GrantReader {
   }
 
   void refuseConditions(const TomlNode& grant) {
-    refuse(grant, rule_.executable ? "executable alone proves nothing, because a user can make another program "
-                                     "look like it; add group, user or unit"
-                                   : "the grant names nobody; add group, user or unit");
+    refuse(grant, rule_.executable
+                      ? "executable alone proves nothing, because a user can make another program "
+                        "look like it; add group, user or unit"
+                      : "the grant names nobody; add group, user or unit");
   }
 
   void readKey(const std::string& key, const TomlNode& node) {
@@ -126,7 +127,8 @@ class GrantReader {
     if (name == nullptr) return std::nullopt;
     const auto number = lookup(*name);
     if (!number || *number == PeerCredentials::kNoId) {
-      refuse(node, "there is no " + key + " \"" + *name + "\" on this system; create it and restart the daemon");
+      refuse(node,
+             "there is no " + key + " \"" + *name + "\" on this system; create it and restart the daemon");
       return std::nullopt;
     }
     return number;
@@ -155,15 +157,6 @@ void loadFile(const std::string& path, std::vector<EntitlementRule>& rules,
   }
 }
 
-bool matches(const EntitlementRule& rule, const PeerCredentials& peer) {
-  if (rule.group && *rule.group != peer.gid) return false;
-  if (rule.user && *rule.user != peer.uid) return false;
-  // Asked only when all else holds: it costs a look into /proc.
-  if (rule.unit && (peer.process == nullptr || peer.process->unit() != rule.unit)) return false;
-  if (rule.executable && (peer.process == nullptr || peer.process->executable() != rule.executable)) return false;
-  return rule.group || rule.user || rule.unit;
-}
-
 }  // namespace
 
 std::unique_ptr<EntitlementRules> EntitlementRules::load(const std::string& configurationDirectory,
@@ -177,9 +170,30 @@ std::unique_ptr<EntitlementRules> EntitlementRules::load(const std::string& conf
 }
 
 bool EntitlementRules::holds(const PeerCredentials& peer, std::string_view entitlement) {
-  return std::any_of(rules_.begin(), rules_.end(), [&peer, entitlement](const EntitlementRule& rule) {
+  return std::any_of(rules_.begin(), rules_.end(), [this, &peer, entitlement](const EntitlementRule& rule) {
     return rule.entitlement == entitlement && matches(rule, peer);
   });
+}
+
+bool EntitlementRules::needsExecutable() const {
+  return std::any_of(rules_.begin(), rules_.end(),
+                     [](const EntitlementRule& rule) { return rule.executable.has_value(); });
+}
+
+std::optional<std::string> EntitlementRules::executableOf(const PeerCredentials& peer) const {
+  if (peer.process == nullptr) return std::nullopt;
+  if (!executableLookup_) return peer.process->executable();
+  auto path = executableLookup_(peer.pid);
+  return peer.process->isAlive() ? std::move(path) : std::nullopt;
+}
+
+bool EntitlementRules::matches(const EntitlementRule& rule, const PeerCredentials& peer) const {
+  if (rule.group && *rule.group != peer.gid) return false;
+  if (rule.user && *rule.user != peer.uid) return false;
+  // Asked only when all else holds: it costs a look into /proc.
+  if (rule.unit && (peer.process == nullptr || peer.process->unit() != rule.unit)) return false;
+  if (rule.executable && executableOf(peer) != rule.executable) return false;
+  return rule.group || rule.user || rule.unit;
 }
 
 }  // namespace tarnel

@@ -1,10 +1,12 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "platform/entitlements.h"
@@ -27,7 +29,7 @@ struct EntitlementRule {
 // path can be forged by its user and therefore only narrows a group, a user or a unit: a rule that has
 // nothing else is refused.
 //
-// Threads: any; immutable.
+// Threads: any; immutable once set up.
 class EntitlementRules final : public Entitlements {
  public:
   explicit EntitlementRules(std::vector<EntitlementRule> rules) : rules_(std::move(rules)) {}
@@ -40,10 +42,21 @@ class EntitlementRules final : public Entitlements {
 
   bool holds(const PeerCredentials& peer, std::string_view entitlement) override;
 
+  // How to look at a process's executable when this process may not itself (see ProcessWitness): gives the
+  // path for a process id, or nothing. Set before the first question.
+  using ExecutableLookup = std::function<std::optional<std::string>(int32_t pid)>;
+  void setExecutableLookup(ExecutableLookup lookup) { executableLookup_ = std::move(lookup); }
+  // True when a rule asks for an executable, which a confined process cannot see without a lookup.
+  bool needsExecutable() const;
+
   const std::vector<EntitlementRule>& rules() const noexcept { return rules_; }
 
  private:
+  bool matches(const EntitlementRule& rule, const PeerCredentials& peer) const;
+  std::optional<std::string> executableOf(const PeerCredentials& peer) const;
+
   std::vector<EntitlementRule> rules_;
+  ExecutableLookup executableLookup_;
 };
 
 }  // namespace tarnel

@@ -38,8 +38,9 @@ bool FileConsent::isDiagnosticSubmissionAllowed() {
 }
 
 MaybeError FileConsent::store(const std::string& configurationDirectory, bool allowed) {
-  const std::string text = std::string("# Whether diagnostics may be submitted; written by tarnelctl consent.\n") +
-                           "diagnostics = " + (allowed ? "true" : "false") + "\n";
+  const std::string text =
+      std::string("# Whether diagnostics may be submitted; written by tarnelctl consent.\n") +
+      "diagnostics = " + (allowed ? "true" : "false") + "\n";
   return replaceFile(consentPath(configurationDirectory), text, 0644);
 }
 

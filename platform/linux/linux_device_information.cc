@@ -18,8 +18,8 @@ namespace tarnel {
 
 namespace {
 
-constexpr std::array<std::string_view, 8> kKeys{"ProductVersion", "BuildVersion", "ProductType",
-                                                "DeviceName",     "HWModelStr",   "SerialNumber",
+constexpr std::array<std::string_view, 8> kKeys{"ProductVersion", "BuildVersion",  "ProductType",
+                                                "DeviceName",     "HWModelStr",    "SerialNumber",
                                                 "ReleaseType",    "UniqueDeviceID"};
 
 // The value of a NAME=value line as os-release(5) writes them: with or without quotes, backslash escapes.
@@ -30,7 +30,8 @@ std::optional<std::string> assignedValue(std::string_view text, std::string_view
     start = end + 1;
     if (!line.starts_with(name) || line.size() <= name.size() || line[name.size()] != '=') continue;
     line.remove_prefix(name.size() + 1);
-    while (!line.empty() && (line.back() == ' ' || line.back() == '\t' || line.back() == '\r')) line.remove_suffix(1);
+    while (!line.empty() && (line.back() == ' ' || line.back() == '\t' || line.back() == '\r'))
+      line.remove_suffix(1);
     if (line.size() >= 2 && (line.front() == '"' || line.front() == '\'') && line.back() == line.front()) {
       line = line.substr(1, line.size() - 2);
     }
@@ -70,12 +71,19 @@ std::optional<std::string> hostName() {
 
 // Firmware vendors leave these in fields that they did not fill.
 bool isPlaceholder(const std::string& text) {
-  constexpr std::array<std::string_view, 9> kPlaceholders{
-      "none",          "not specified", "default string", "to be filled by o.e.m.", "system serial number",
-      "not available", "unknown",       "0",              "system product name"};
+  constexpr std::array<std::string_view, 9> kPlaceholders{"none",
+                                                          "not specified",
+                                                          "default string",
+                                                          "to be filled by o.e.m.",
+                                                          "system serial number",
+                                                          "not available",
+                                                          "unknown",
+                                                          "0",
+                                                          "system product name"};
   std::string lower(text);
-  std::transform(lower.begin(), lower.end(), lower.begin(),
-                 [](char letter) { return letter >= 'A' && letter <= 'Z' ? static_cast<char>(letter + 32) : letter; });
+  std::transform(lower.begin(), lower.end(), lower.begin(), [](char letter) {
+    return letter >= 'A' && letter <= 'Z' ? static_cast<char>(letter + 32) : letter;
+  });
   return std::find(kPlaceholders.begin(), kPlaceholders.end(), lower) != kPlaceholders.end();
 }
 
@@ -130,9 +138,10 @@ std::optional<std::string> LinuxDeviceInformation::overridden(std::string_view k
   return answer;
 }
 
-std::optional<std::string> LinuxDeviceInformation::firmware(const char* deviceTreeName, const char* dmiName) const {
-  for (const std::string& path : {root_ + "/proc/device-tree/" + deviceTreeName,
-                                  root_ + "/sys/class/dmi/id/" + dmiName}) {
+std::optional<std::string> LinuxDeviceInformation::firmware(const char* deviceTreeName,
+                                                            const char* dmiName) const {
+  for (const std::string& path :
+       {root_ + "/proc/device-tree/" + deviceTreeName, root_ + "/sys/class/dmi/id/" + dmiName}) {
     auto text = readFirstLine(path);
     if (!text) continue;
     // The device tree lists several texts behind zero bytes; the first is the most specific.

@@ -46,7 +46,9 @@ std::optional<Date> LinuxFileSystem::creationDate(const std::string& path) {
   return Date{static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) / 1e9};
 }
 
-bool LinuxFileSystem::fileExists(const std::string& path) { return ::access(path.c_str(), F_OK) == 0; }
+bool LinuxFileSystem::fileExists(const std::string& path) {
+  return ::access(path.c_str(), F_OK) == 0;
+}
 
 MaybeError LinuxFileSystem::createFile(const std::string& path) {
   const UniqueFd fd(::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, 0600));

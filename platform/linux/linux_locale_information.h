@@ -13,9 +13,9 @@ namespace tarnel {
 // territory, or one that is no ISO 3166 code of two letters.
 std::optional<std::string> territoryOfLocale(std::string_view name);
 
-// The country comes from the configuration, else from the first of LC_ALL, LC_MEASUREMENT and LANG that is set
-// and not empty. The time zone is the system's (or TZ's) as it is when the object is made, which must be before
-// the process confines itself; changes of the zone's rules over the year are followed.
+// The country comes from the configuration, else from the first of LC_ALL, LC_MEASUREMENT and LANG that is
+// set and not empty. The time zone is the system's (or TZ's) as it is when the object is made, which must be
+// before the process confines itself; changes of the zone's rules over the year are followed.
 class LinuxLocaleInformation final : public LocaleInformation {
  public:
   using Environment = std::function<const char*(const char* name)>;

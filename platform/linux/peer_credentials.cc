@@ -23,16 +23,6 @@ namespace {
 constexpr size_t kMaxCgroupBytes = 16384;
 constexpr size_t kMaxPathBytes = 4096;
 
-// A pidfd becomes readable when its process has ended.
-bool isAlive(const UniqueFd& pidfd) {
-  pollfd entry{.fd = pidfd.get(), .events = POLLIN, .revents = 0};
-  int ready = 0;
-  do {
-    ready = ::poll(&entry, 1, 0);
-  } while (ready < 0 && errno == EINTR);
-  return ready == 0;
-}
-
 std::string procPath(int32_t pid, const char* name) {
   return "/proc/" + std::to_string(pid) + "/" + name;
 }
@@ -57,19 +47,25 @@ class PidfdPeerProcess final : public PeerProcess {
   PidfdPeerProcess(int32_t pid, UniqueFd pidfd) : pid_(pid), pidfd_(std::move(pidfd)) {}
 
   std::optional<std::string> executable() const override {
-    std::string target(kMaxPathBytes, '\0');
-    const ssize_t length = ::readlink(procPath(pid_, "exe").c_str(), target.data(), target.size());
+    auto target = executableOfProcess(pid_);
     // Looked at afterwards: while the process lives, nobody else can have had its number.
-    if (length <= 0 || static_cast<size_t>(length) >= target.size() || !isAlive(pidfd_)) return std::nullopt;
-    target.resize(static_cast<size_t>(length));
-    if (target.front() != '/' || target.ends_with(" (deleted)")) return std::nullopt;
-    return target;
+    return isAlive() ? std::move(target) : std::nullopt;
   }
 
   std::optional<std::string> unit() const override {
     const auto text = readWhole(procPath(pid_, "cgroup"));
-    if (!text || !isAlive(pidfd_)) return std::nullopt;
+    if (!text || !isAlive()) return std::nullopt;
     return unitOfCgroup(*text);
+  }
+
+  // A pidfd becomes readable when its process has ended.
+  bool isAlive() const override {
+    pollfd entry{.fd = pidfd_.get(), .events = POLLIN, .revents = 0};
+    int ready = 0;
+    do {
+      ready = ::poll(&entry, 1, 0);
+    } while (ready < 0 && errno == EINTR);
+    return ready == 0;
   }
 
  private:
@@ -78,6 +74,15 @@ class PidfdPeerProcess final : public PeerProcess {
 };
 
 }  // namespace
+
+std::optional<std::string> executableOfProcess(int32_t pid) {
+  std::string target(kMaxPathBytes, '\0');
+  const ssize_t length = ::readlink(procPath(pid, "exe").c_str(), target.data(), target.size());
+  if (length <= 0 || static_cast<size_t>(length) >= target.size()) return std::nullopt;
+  target.resize(static_cast<size_t>(length));
+  if (target.front() != '/' || target.ends_with(" (deleted)")) return std::nullopt;
+  return target;
+}
 
 std::optional<std::string> unitOfCgroup(std::string_view text) {
   // The unified hierarchy's line: "0::/system.slice/app.service".
@@ -103,7 +108,8 @@ PeerCredentials readPeerCredentials(int socket) {
   PeerCredentials peer;
   ucred credentials{};
   socklen_t size = sizeof(credentials);
-  if (::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &size) != 0 || size != sizeof(credentials)) {
+  if (::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &size) != 0 ||
+      size != sizeof(credentials)) {
     return peer;
   }
   peer.pid = credentials.pid;
@@ -112,7 +118,8 @@ PeerCredentials readPeerCredentials(int socket) {
 
   int pidfd = -1;
   size = sizeof(pidfd);
-  if (peer.pid > 0 && ::getsockopt(socket, SOL_SOCKET, kernel::kSoPeerPidFd, &pidfd, &size) == 0 && pidfd >= 0) {
+  if (peer.pid > 0 && ::getsockopt(socket, SOL_SOCKET, kernel::kSoPeerPidFd, &pidfd, &size) == 0 &&
+      pidfd >= 0) {
     peer.process = std::make_shared<PidfdPeerProcess>(peer.pid, UniqueFd(pidfd));
   }
   return peer;

@@ -25,8 +25,9 @@ std::optional<TomlNode> readTomlFile(const std::string& path, std::vector<Config
 }
 
 ConfigurationProblem unknownKey(const std::string& path, const TomlNode& node, std::string_view name) {
-  return {LogLevel::warning, atLine(path, node.line, "unknown key " + std::string(name) +
-                                                         "; it is ignored, tarneld.conf(5) lists the keys")};
+  return {LogLevel::warning,
+          atLine(path, node.line,
+                 "unknown key " + std::string(name) + "; it is ignored, tarneld.conf(5) lists the keys")};
 }
 
 ConfigurationProblem badValue(const std::string& path, const TomlNode& node, std::string_view name,

@@ -28,9 +28,10 @@ bool isDomainName(std::string_view name) {
 }
 
 Error invalidDomain(std::string_view name) {
-  return Error(kSettingsErrorDomain, EINVAL,
-               "\"" + std::string(name) +
-                   "\" is no domain: use letters, digits, '.', '-' and '_', at most 128, not beginning with '.'");
+  return Error(
+      kSettingsErrorDomain, EINVAL,
+      "\"" + std::string(name) +
+          "\" is no domain: use letters, digits, '.', '-' and '_', at most 128, not beginning with '.'");
 }
 
 // A file that stands in the way of reading, as opposed to one that can be read and makes no sense.
@@ -40,22 +41,21 @@ bool isDamage(const Error& error) {
 
 }  // namespace
 
-TomlSettingsStore::TomlSettingsStore(const std::string& configurationDirectory, const std::string& stateDirectory,
-                                     Log& log)
+TomlSettingsStore::TomlSettingsStore(const std::string& configurationDirectory,
+                                     const std::string& stateDirectory, Log& log)
     : configurationDirectory_(configurationDirectory + "/settings"),
       stateDirectory_(stateDirectory + "/settings"),
       log_(log) {}
 
 std::string TomlSettingsStore::path(SettingsLayer layer, std::string_view domain) const {
-  return (layer == SettingsLayer::own ? stateDirectory_ : configurationDirectory_) + "/" + std::string(domain) +
-         ".toml";
+  return (layer == SettingsLayer::own ? stateDirectory_ : configurationDirectory_) + "/" +
+         std::string(domain) + ".toml";
 }
 
 TomlSettingsStore::Layer TomlSettingsStore::read(SettingsLayer layer, const std::string& path) {
   Layer result;
   // The own file lies in a directory of mode 0700 and may belong to the daemon's user while root reads it.
-  const auto contents =
-      readFile(path, layer == SettingsLayer::own ? FileTrust::any : FileTrust::trusted);
+  const auto contents = readFile(path, layer == SettingsLayer::own ? FileTrust::any : FileTrust::trusted);
   if (!contents) {
     if (contents.error().code() != ENOENT) {
       result.problem = contents.error();

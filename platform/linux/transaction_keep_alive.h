@@ -12,8 +12,8 @@ namespace tarnel {
 // Counts the open transactions and says when the process has been idle long enough to end itself.
 //
 // The timer is the caller's: `arm` is asked to call idleTimeElapsed(generation) once after the delay, and a
-// later arm() replaces an earlier one. A generation that is no longer current is ignored, so that a late timer
-// does no harm.
+// later arm() replaces an earlier one. A generation that is no longer current is ignored, so that a late
+// timer does no harm.
 //
 // Threads: any. `arm` and `idle` run on the thread that caused them, without a lock held.
 class TransactionKeepAlive final : public KeepAlive {
