@@ -42,9 +42,9 @@ TEST(DictionaryTest, isEmptyWhenNew) {
   EXPECT_EQ(none, reserved);
 }
 
-// The index appears at 33 entries; everything must hold on both sides of that edge.
+// The index appears at 65 entries; everything must hold on both sides of that edge.
 TEST(DictionaryTest, findsReplacesAndRemovesAtAnySize) {
-  for (const size_t count : {1, 31, 32, 33, 34, 100, 1000}) {
+  for (const size_t count : {1, 63, 64, 65, 66, 100, 1000}) {
     Dictionary dictionary = numbered(count);
     ASSERT_EQ(dictionary.size(), count);
     for (size_t i = 0; i < count; ++i) {
@@ -68,13 +68,13 @@ TEST(DictionaryTest, findsReplacesAndRemovesAtAnySize) {
 }
 
 TEST(DictionaryTest, shrinksBelowTheIndexAndGrowsAgain) {
-  Dictionary dictionary = numbered(40);
-  for (size_t i = 0; i < 35; ++i) dictionary.remove("key" + std::to_string(i));
-  EXPECT_EQ(*dictionary.find("key39"), Value(39));
-  for (size_t i = 0; i < 35; ++i) dictionary.set("key" + std::to_string(i), "again");
-  EXPECT_EQ(dictionary.size(), 40U);
-  EXPECT_EQ(*dictionary.find("key35"), Value(35));
-  EXPECT_EQ(*dictionary.find("key34"), Value("again"));
+  Dictionary dictionary = numbered(70);
+  for (size_t i = 0; i < 67; ++i) dictionary.remove("key" + std::to_string(i));
+  EXPECT_EQ(*dictionary.find("key69"), Value(69));
+  for (size_t i = 0; i < 67; ++i) dictionary.set("key" + std::to_string(i), "again");
+  EXPECT_EQ(dictionary.size(), 70U);
+  EXPECT_EQ(*dictionary.find("key67"), Value(67));
+  EXPECT_EQ(*dictionary.find("key66"), Value("again"));
 }
 
 TEST(DictionaryTest, copiesShareUntilOneIsWritten) {

@@ -64,7 +64,7 @@ class Array {
 class Dictionary {
  public:
   using Entry = std::pair<std::string, Value>;
-  static constexpr size_t kIndexThreshold = 32;
+  static constexpr size_t kIndexThreshold = 64;
 
   Dictionary() noexcept = default;
   Dictionary(std::initializer_list<Entry> entries);
