@@ -1,0 +1,266 @@
+// The command line of tarnelctl: options in, one call of a command out.
+
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+#include <exception>
+#include <functional>
+#include <iostream>
+#include <string_view>
+
+#include "platform/linux/directories.h"
+#include "tools/tarnelctl/consent_command.h"
+#include "tools/tarnelctl/log_command.h"
+#include "tools/tarnelctl/replay_command.h"
+#include "tools/tarnelctl/send_command.h"
+#include "tools/tarnelctl/settings_command.h"
+#include "tools/tarnelctl/storebag_command.h"
+
+#ifndef TARNEL_VERSION
+#error "TARNEL_VERSION comes from the build"
+#endif
+
+namespace tarnel::ctl {
+namespace {
+
+constexpr char kFooter[] =
+    "Exit status: 0 done, 1 failed, 2 wrong usage, 3 no daemon is listening or it refuses this process.\n"
+    "A private instance is chosen by RUNTIME_DIRECTORY, STATE_DIRECTORY, LOGS_DIRECTORY and\n"
+    "CONFIGURATION_DIRECTORY; the daemon's socket by --socket or TARNEL_SOCKET. See tarnelctl(1).";
+
+// Errors of the settings store are told by the commands; what it logs beside them goes to standard error.
+class StandardErrorLog final : public Log {
+ protected:
+  void write(LogLevel /*level*/, std::string_view text) override {
+    std::cerr << "tarnelctl: " << text << '\n';
+  }
+};
+
+// All that the options of all commands fill in, and the command that was chosen.
+struct CommandLine {
+  CLI::App app{"Runs, configures and debugs the Tarnel reporting daemon."};
+  Terminal terminal{std::cout, std::cerr, isatty(STDOUT_FILENO) == 1, isatty(STDERR_FILENO) == 1};
+  Directories directories = Directories::fromEnvironment();
+  StandardErrorLog log;
+  std::string socketPath;
+  std::function<ExitStatus()> run;
+
+  SendOptions send;
+  ReplayOptions replay;
+  std::string recording;
+  uint32_t timeoutSeconds = 30;
+  LogOptions logOptions;
+  SettingsOptions settings;
+  bool consentJson = false;
+  StorebagOptions storebag;
+
+  TomlSettingsStore store() { return {directories.configuration(), directories.state(), log}; }
+};
+
+void addSocketOption(CommandLine& line, CLI::App* command) {
+  command->add_option("--socket", line.socketPath,
+                      "the daemon's socket (default TARNEL_SOCKET, else the installed one)");
+}
+
+void addMessageOptions(CommandLine& line, CLI::App* command) {
+  auto& send = line.send;
+  addSocketOption(line, command);
+  command->add_option("--client-type", send.clientType, "client type; 5 to 17 have a storebag")->required();
+  command->add_option("--session-id", send.sessionID, "session number")->capture_default_str();
+  command->add_option("--client-version", send.clientVersion, "version of the client")->capture_default_str();
+  command->add_option("--client-name", send.clientName, "user info: name of the client");
+  command->add_option("--service-name", send.serviceName, "user info: name of the service");
+  command->add_option("--user-info", send.userInfo, "more user info, KEY=VALUE or KEY:TYPE=VALUE");
+  command->add_option("--category", send.category, "category of the message, 0 to 65535")->required();
+  command->add_option("--type", send.type, "type of the message, 0 to 65535")->required();
+  command->add_option(
+      "payload", send.payload,
+      "payload, KEY=VALUE or KEY:TYPE=VALUE with TYPE string, int, real, bool, date, data or json");
+  command->add_option("--timeout", line.timeoutSeconds, "seconds to wait for each answer")
+      ->capture_default_str()
+      ->check(CLI::Range(1, 86400));
+  command->add_flag("--json", send.json, "answer in JSON");
+}
+
+void addSend(CommandLine& line) {
+  auto* command = line.app.add_subcommand("send", "send one message through a session of its own");
+  addMessageOptions(line, command);
+  command->add_flag("--batch", line.send.batch, "let the daemon batch events");
+  command->add_option("--flag", line.send.flag, "0 normal, 1 real-time, 2 important, 3 both")
+      ->capture_default_str()
+      ->check(CLI::Range(0, 3));
+  command->add_flag("--flush", line.send.flush, "flush after sending, and wait for it");
+  command->callback([&line] {
+    line.run = [&line] {
+      line.send.socketPath = line.socketPath;
+      line.send.timeout = std::chrono::seconds(line.timeoutSeconds);
+      return sendMessage(line.send, line.terminal);
+    };
+  });
+}
+
+void addSingle(CommandLine& line) {
+  auto* command = line.app.add_subcommand("single", "send one message with its session info in one call");
+  addMessageOptions(line, command);
+  command->callback([&line] {
+    line.run = [&line] {
+      line.send.socketPath = line.socketPath;
+      line.send.timeout = std::chrono::seconds(line.timeoutSeconds);
+      return sendSingleMessage(line.send, line.terminal);
+    };
+  });
+}
+
+void addReplay(CommandLine& line) {
+  auto* command = line.app.add_subcommand("replay", "send recorded sessions anew");
+  addSocketOption(line, command);
+  command->add_option("recording", line.recording, "recording in NDJSON, - for standard input")->required();
+  command->add_flag("--fast", line.replay.fast, "as fast as possible instead of at the recorded pace");
+  command->add_flag("--quiet", line.replay.quiet, "no progress bar");
+  command->add_flag("--json", line.replay.json, "summary in JSON");
+  command->callback([&line] {
+    line.run = [&line] {
+      line.replay.socketPath = line.socketPath;
+      return replayFile(line.recording, line.replay, line.terminal);
+    };
+  });
+}
+
+void addLog(CommandLine& line) {
+  auto* command = line.app.add_subcommand("log", "show the message log: what sessions sent");
+  command->add_option("-n,--lines", line.logOptions.lines, "only the last N lines");
+  command->add_flag("-f,--follow", line.logOptions.follow, "go on with what is written, until interrupted");
+  command->add_flag("--path", line.logOptions.path, "only say where it is");
+  command->callback([&line] {
+    line.run = [&line] {
+      line.logOptions.directory = line.directories.messageLogDirectory();
+      return showMessageLog(line.logOptions, line.terminal);
+    };
+  });
+}
+
+void addSettings(CommandLine& line) {
+  using Action = ExitStatus (*)(const SettingsOptions&, TomlSettingsStore&, const Terminal&);
+  auto* group =
+      line.app.add_subcommand("settings", "list, get, set and unset settings")->require_subcommand(1);
+  const auto add = [&line, group](const char* name, const char* what, Action action) {
+    auto* command = group->add_subcommand(name, what);
+    command->callback([&line, action] {
+      line.run = [&line, action] {
+        auto store = line.store();
+        return action(line.settings, store, line.terminal);
+      };
+    });
+    return command;
+  };
+  auto& settings = line.settings;
+  auto* list = add("list", "all settings with the layer that decides each", listSettings);
+  list->add_option("domain", settings.domain, "only this domain");
+  list->add_flag("--json", settings.json, "answer in JSON");
+  auto* get = add("get", "one setting's value", getSetting);
+  get->add_flag("--json", settings.json, "answer in JSON");
+  auto* set = add("set", "store a value in the daemon's own layer", setSetting);
+  auto* unset = add("unset", "remove a value from the daemon's own layer", unsetSetting);
+  for (auto* command : {get, set, unset}) {
+    command->add_option("domain", settings.domain, "domain, such as com.orvane.tarnel")->required();
+    command->add_option("key", settings.key, "key")->required();
+  }
+  set->add_option("value", settings.value, "value")->required();
+  set->add_option("--type", settings.type,
+                  "string, int, real, bool, date, data or json (default: as it reads)");
+}
+
+void addConsent(CommandLine& line) {
+  auto* group = line.app.add_subcommand("consent", "the user's consent to diagnostics: status, on, off")
+                    ->require_subcommand(1);
+  auto* status = group->add_subcommand("status", "whether diagnostics may be submitted");
+  status->add_flag("--json", line.consentJson, "answer in JSON");
+  status->callback([&line] {
+    line.run = [&line] {
+      return showConsent(line.directories.configuration(), line.consentJson, line.terminal);
+    };
+  });
+  for (const bool allowed : {true, false}) {
+    auto* command =
+        group->add_subcommand(allowed ? "on" : "off", allowed ? "agree to diagnostics" : "withhold consent");
+    command->callback([&line, allowed] {
+      line.run = [&line, allowed] {
+        return storeConsent(line.directories.configuration(), allowed, line.terminal);
+      };
+    });
+  }
+}
+
+void addStorebag(CommandLine& line) {
+  using Action = ExitStatus (*)(const StorebagOptions&, const Terminal&);
+  auto* group = line.app.add_subcommand("storebag", "make, sign and check storebags")->require_subcommand(1);
+  const auto add = [&line, group](const char* name, const char* what, Action action) {
+    auto* command = group->add_subcommand(name, what);
+    command->callback(
+        [&line, action] { line.run = [&line, action] { return action(line.storebag, line.terminal); }; });
+    return command;
+  };
+  auto& options = line.storebag;
+  auto* keygen = add("keygen", "make a signing key and the bundle that trusts it", makeStorebagKey);
+  keygen->add_option("folder", options.output, "where to put them")->required();
+  keygen->add_option("--bits", options.bits, "length of the key")
+      ->capture_default_str()
+      ->check(CLI::Range(2048, 16384));
+  auto* fresh = add("new", "write a storebag to begin with", newStorebag);
+  fresh->add_option("--version", options.version, "its version")->capture_default_str();
+  fresh->add_option("--client-name", options.client, "client names, separated by commas")
+      ->capture_default_str();
+  fresh->add_option("--service-name", options.service, "service names or parts")->capture_default_str();
+  fresh->add_option("--server", options.postURL, "address of the reporting server")->capture_default_str();
+  auto* sign = add("sign", "sign a storebag", signStorebag);
+  sign->add_flag("--binary", options.binary, "outer document in binary form");
+  auto* verify = add("verify", "check signature and contents of a signed storebag", verifyStorebag);
+  auto* show = add("show", "print what a storebag holds", showStorebag);
+  for (auto* command : {sign, verify, show})
+    command->add_option("file", options.input, "the storebag")->required();
+  sign->add_option("--key", options.key, "private key (PEM)")->required();
+  verify->add_option("--key", options.key, "public key (DER) or bundle folder")->required();
+  show->add_option("--key", options.key, "public key (DER) or bundle folder, to check the signature");
+  for (auto* command : {fresh, sign}) {
+    command->add_option("-o,--output", options.output, "file to write (default: standard output)");
+  }
+  for (auto* command : {keygen, fresh, sign}) {
+    command->add_flag("--force", options.force, "replace what is there; sign in spite of errors");
+  }
+}
+
+int runCommandLine(int argc, char** argv) {
+  CommandLine line;
+  line.app.footer(kFooter);
+  line.app.set_version_flag("--version", "tarnelctl " TARNEL_VERSION);
+  line.app.require_subcommand(1);
+  addSend(line);
+  addReplay(line);
+  addSingle(line);
+  addLog(line);
+  addSettings(line);
+  addConsent(line);
+  addStorebag(line);
+  try {
+    line.app.parse(argc, argv);
+  } catch (const CLI::ParseError& error) {
+    // Help and version come this way too, with code 0.
+    return line.app.exit(error) == 0 ? 0 : static_cast<int>(ExitStatus::usage);
+  }
+  for (const auto& problem : line.directories.problems()) std::cerr << "tarnelctl: " << problem << '\n';
+  const auto status = line.run();
+  std::cout.flush();
+  return std::cout.good() ? static_cast<int>(status) : static_cast<int>(ExitStatus::failed);
+}
+
+}  // namespace
+}  // namespace tarnel::ctl
+
+int main(int argc, char** argv) {
+  try {
+    return tarnel::ctl::runCommandLine(argc, argv);
+  } catch (const std::exception& failure) {
+    std::cerr << "tarnelctl: " << failure.what() << '\n';
+    return static_cast<int>(tarnel::ctl::ExitStatus::failed);
+  }
+}

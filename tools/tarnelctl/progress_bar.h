@@ -1,0 +1,30 @@
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+
+#include "tools/tarnelctl/terminal.h"
+
+namespace tarnel::ctl {
+
+// One line on the terminal that grows with the work; nothing where standard error is no terminal. It is
+// redrawn ten times a second at most and wiped when the bar goes.
+class ProgressBar {
+ public:
+  ProgressBar(const Terminal& terminal, size_t total, bool quiet);
+  ProgressBar(const ProgressBar&) = delete;
+  ProgressBar& operator=(const ProgressBar&) = delete;
+  ~ProgressBar();
+
+  void update(size_t done);
+
+ private:
+  void draw(size_t done);
+
+  const Terminal& terminal_;
+  const size_t total_;
+  const bool shown_;
+  std::chrono::steady_clock::time_point next_{};
+};
+
+}  // namespace tarnel::ctl
