@@ -1,5 +1,7 @@
 #pragma once
 
+#include <mutex>
+
 #include "platform/base/value.h"
 #include "platform/consent.h"
 #include "platform/random.h"
@@ -19,15 +21,18 @@ class ConsentIdentifiers {
 
   // getPersistentIdentifierForDNU:
   // respect: 1 for the identifier that honours consent (nothing while consent is withheld),
-  // 0 for the one that overrides it.
+  // 0 for the one that overrides it. A store that cannot be read gives a new one every time.
   MaybeString getPersistentIdentifierForDNU(int respect);
 
  private:
   std::string storedOrNew(const char* key);
+  void dropRespecting();
 
   SettingsStore& settings_;
   Consent& consent_;
   Random& random_;
+  std::mutex mutex_;            // two first questions must get one answer
+  bool mustBeDropped_ = false;  // guarded by mutex_; the store refused to forget
 };
 
 }  // namespace tarnel

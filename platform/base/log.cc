@@ -6,6 +6,14 @@
 
 namespace tarnel {
 
+std::optional<LogLevel> logLevelFromText(std::string_view text) {
+  if (text == "error" || text == "3") return LogLevel::error;
+  if (text == "warning" || text == "4") return LogLevel::warning;
+  if (text == "information" || text == "6") return LogLevel::information;
+  if (text == "debug" || text == "7") return LogLevel::debug;
+  return std::nullopt;
+}
+
 void Log::log(LogLevel level, const char* format, ...) {
   if (!enabled(level)) return;
   std::va_list arguments;

@@ -11,6 +11,9 @@ namespace tarnel {
 // Syslog priorities; the four that the system uses.
 enum class LogLevel : int { error = 3, warning = 4, information = 6, debug = 7 };
 
+// "error", "warning", "information" or "debug", or the numbers 3, 4, 6 and 7; nothing for any other text.
+std::optional<LogLevel> logLevelFromText(std::string_view text);
+
 // Where diagnostics go. Texts are printf formats, checked by the compiler, and begin with the name of the
 // routine that writes them.
 //

@@ -153,14 +153,6 @@ void listTrustFiles(const std::string& directory, Configuration& configuration) 
 
 }  // namespace
 
-std::optional<LogLevel> logLevelFromText(std::string_view text) {
-  if (text == "error" || text == "3") return LogLevel::error;
-  if (text == "warning" || text == "4") return LogLevel::warning;
-  if (text == "information" || text == "6") return LogLevel::information;
-  if (text == "debug" || text == "7") return LogLevel::debug;
-  return std::nullopt;
-}
-
 Configuration loadConfiguration(const std::string& configurationDirectory) {
   Configuration configuration;
   applyFile(configurationDirectory + "/tarneld.toml", configuration);

@@ -51,7 +51,4 @@ struct Configuration {
 // lists trust.d/*.pem. A file with a syntax error is left out whole.
 Configuration loadConfiguration(const std::string& configurationDirectory);
 
-// "error", "warning", "information" or "debug", or the numbers 3, 4, 6 and 7.
-std::optional<LogLevel> logLevelFromText(std::string_view text);
-
 }  // namespace tarnel
