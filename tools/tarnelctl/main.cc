@@ -3,6 +3,7 @@
 #include <unistd.h>
 
 #include <CLI/CLI.hpp>
+#include <algorithm>
 #include <exception>
 #include <functional>
 #include <iostream>
@@ -38,7 +39,7 @@ class StandardErrorLog final : public Log {
 
 // All that the options of all commands fill in, and the command that was chosen.
 struct CommandLine {
-  CLI::App app{"Runs, configures and debugs the Tarnel reporting daemon."};
+  CLI::App app{"Runs, configures and debugs the Tarnel reporting daemon.", "tarnelctl"};
   Terminal terminal{std::cout, std::cerr, isatty(STDOUT_FILENO) == 1, isatty(STDERR_FILENO) == 1};
   Directories directories = Directories::fromEnvironment();
   StandardErrorLog log;
@@ -70,7 +71,10 @@ void addMessageOptions(CommandLine& line, CLI::App* command) {
   command->add_option("--client-version", send.clientVersion, "version of the client")->capture_default_str();
   command->add_option("--client-name", send.clientName, "user info: name of the client");
   command->add_option("--service-name", send.serviceName, "user info: name of the service");
-  command->add_option("--user-info", send.userInfo, "more user info, KEY=VALUE or KEY:TYPE=VALUE");
+  command
+      ->add_option("--user-info", send.userInfo,
+                   "more user info, KEY=VALUE or KEY:TYPE=VALUE; may be repeated")
+      ->allow_extra_args(false);
   command->add_option("--category", send.category, "category of the message, 0 to 65535")->required();
   command->add_option("--type", send.type, "type of the message, 0 to 65535")->required();
   command->add_option(
@@ -229,6 +233,16 @@ void addStorebag(CommandLine& line) {
   }
 }
 
+// The parser itself would only say that a command is missing.
+bool isUnknownCommand(const CLI::App& app, int argc, char** argv) {
+  if (argc < 2 || argv[1][0] == '-') return false;
+  const auto commands = app.get_subcommands([](const CLI::App*) { return true; });
+  const auto isNamed = [name = argv[1]](const CLI::App* command) { return command->check_name(name); };
+  if (std::any_of(commands.begin(), commands.end(), isNamed)) return false;
+  std::cerr << "tarnelctl: unknown command '" << argv[1] << "': tarnelctl --help lists them\n";
+  return true;
+}
+
 int runCommandLine(int argc, char** argv) {
   CommandLine line;
   line.app.footer(kFooter);
@@ -241,6 +255,7 @@ int runCommandLine(int argc, char** argv) {
   addSettings(line);
   addConsent(line);
   addStorebag(line);
+  if (isUnknownCommand(line.app, argc, argv)) return static_cast<int>(ExitStatus::usage);
   try {
     line.app.parse(argc, argv);
   } catch (const CLI::ParseError& error) {
