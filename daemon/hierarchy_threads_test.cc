@@ -94,6 +94,8 @@ TEST_F(HierarchyThreads, AChildSendsWhileItsParentSyncsIt) {
   const auto backend = child.session->backends().find(names()[1]);
   EXPECT_EQ(backend->combinedSessionIDString(),
             parent.session->sessionIDString() + "." + child.session->sessionIDString());
+  child.disconnect();
+  parent.disconnect();
 }
 
 TEST_F(HierarchyThreads, AcceptanceGoesOnWhileAStorebagIsFetched) {
