@@ -29,14 +29,16 @@ struct Configuration {
     uint32_t connectionsPerUser = 64;
     std::chrono::seconds idleExit{0};       // 0: an idle process stays
     uint64_t maxUploadBytes = 256U << 20U;  // of one client file
+    friend bool operator==(const Limits&, const Limits&) = default;
   };
   struct Http {
-    std::chrono::seconds connectTimeout{10};
-    std::chrono::seconds noProgress{30};   // without a byte in either direction
-    uint64_t maxAnswerBytes = 16U << 20U;  // of one answer
-    uint64_t maxQueuedBytes = 16U << 20U;  // bodies of all posts that have not ended
-    uint32_t connectionsPerHost = 4;
-    uint32_t connections = 64;
+    std::chrono::seconds connectTimeout{30};
+    std::chrono::seconds noProgress{60};   // without a byte in either direction
+    uint64_t maxAnswerBytes = 8U << 20U;   // of one answer
+    uint64_t maxQueuedBytes = 64U << 20U;  // bodies of all posts that have not ended
+    uint32_t connectionsPerHost = 6;
+    uint32_t connections = 32;
+    friend bool operator==(const Http&, const Http&) = default;
   };
 
   std::optional<LogLevel> logLevel;    // nothing: the default

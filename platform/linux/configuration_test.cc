@@ -3,7 +3,11 @@
 #include <gmock/gmock.h>
 #include <sys/stat.h>
 
+#include <sstream>
+
+#include "platform/linux/file_access.h"
 #include "platform/linux/linux_test_support.h"
+#include "platform/linux/toml.h"
 
 namespace tarnel {
 namespace {
@@ -28,12 +32,12 @@ TEST(Configuration, WithoutFilesTheDefaultsHold) {
   EXPECT_EQ(configuration.limits.connectionsPerUser, 64U);
   EXPECT_EQ(configuration.limits.idleExit.count(), 0);
   EXPECT_EQ(configuration.limits.maxUploadBytes, 268435456U);
-  EXPECT_EQ(configuration.http.connectTimeout.count(), 10);
-  EXPECT_EQ(configuration.http.noProgress.count(), 30);
-  EXPECT_EQ(configuration.http.maxAnswerBytes, 16777216U);
-  EXPECT_EQ(configuration.http.maxQueuedBytes, 16777216U);
-  EXPECT_EQ(configuration.http.connectionsPerHost, 4U);
-  EXPECT_EQ(configuration.http.connections, 64U);
+  EXPECT_EQ(configuration.http.connectTimeout.count(), 30);
+  EXPECT_EQ(configuration.http.noProgress.count(), 60);
+  EXPECT_EQ(configuration.http.maxAnswerBytes, 8388608U);
+  EXPECT_EQ(configuration.http.maxQueuedBytes, 67108864U);
+  EXPECT_EQ(configuration.http.connectionsPerHost, 6U);
+  EXPECT_EQ(configuration.http.connections, 32U);
 }
 
 TEST(Configuration, EveryKeyIsTaken) {
@@ -159,6 +163,44 @@ TEST(Configuration, AFileThatOthersCanWriteIsNotUsed) {
   EXPECT_EQ(configuration.limits.connections, 1024U);
   EXPECT_THAT(texts(configuration),
               ElementsAre(StartsWith(folder.path("tarneld.toml") + ": is not used, because")));
+}
+
+// The lines of the shipped file's keys, without the mark that makes them comments.
+std::string shippedKeys() {
+  std::istringstream lines(readFile(TARNEL_PACKAGING "/configuration/tarneld.toml")->text);
+  std::string keys;
+  for (std::string line; std::getline(lines, line);) {
+    if (line.starts_with("# ") && line.find(" = ") != std::string::npos) line.erase(0, 2);
+    keys += line + "\n";
+  }
+  return keys;
+}
+
+TEST(Configuration, TheShippedFileShowsEveryKeyWithItsDefault) {
+  const TemporaryFolder folder;
+  folder.write("tarneld.toml", shippedKeys());
+  const Configuration shown = loadConfiguration(folder.path());
+  const Configuration defaults = loadConfiguration(folder.path("none"));
+  EXPECT_THAT(texts(shown), IsEmpty());
+  EXPECT_EQ(shown.logLevel, LogLevel::information);
+  EXPECT_EQ(shown.country, "DE");
+  EXPECT_EQ(shown.limits, defaults.limits);
+  EXPECT_EQ(shown.http, defaults.http);
+}
+
+TEST(Configuration, TheManualNamesEveryKeyOfTheShippedFile) {
+  const std::string manual = readFile(TARNEL_PACKAGING "/man/tarneld.conf.5")->text;
+  const auto document = parseToml(shippedKeys());
+  ASSERT_TRUE(document);
+  size_t keys = 0;
+  for (const auto& [section, table] : document->entries) {
+    EXPECT_NE(manual.find(".SS [" + section + "]\n"), std::string::npos) << section;
+    for (const auto& [key, node] : table.entries) {
+      EXPECT_NE(manual.find(".TP\n.B " + key + "\n"), std::string::npos) << key;
+      ++keys;
+    }
+  }
+  EXPECT_EQ(keys, 12U);
 }
 
 TEST(Configuration, TrustedCertificatesAreListedByName) {
