@@ -8,7 +8,7 @@
 #include <thread>
 #include <vector>
 
-#include "daemon/agent_fixture.h"
+#include "daemon/test_agent_fixture.h"
 
 namespace tarnel::fake {
 namespace {

@@ -1,7 +1,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "daemon/agent_fixture.h"
+#include "daemon/test_agent_fixture.h"
 
 namespace tarnel::fake {
 namespace {

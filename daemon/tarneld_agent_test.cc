@@ -3,7 +3,7 @@
 
 #include <thread>
 
-#include "daemon/agent_fixture.h"
+#include "daemon/test_agent_fixture.h"
 
 namespace tarnel::fake {
 namespace {

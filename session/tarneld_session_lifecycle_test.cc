@@ -1,7 +1,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "session/session_fixture.h"
+#include "session/test_session_fixture.h"
 
 namespace tarnel::fake {
 namespace {

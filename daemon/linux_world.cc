@@ -1,0 +1,225 @@
+#include "daemon/linux_world.h"
+
+#include <signal.h>
+#include <sys/resource.h>
+#include <systemd/sd-daemon.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <chrono>
+#include <cstdlib>
+#include <utility>
+
+#include "client/shared/tarnel_logging.h"
+#include "daemon/counted_http_client.h"
+#include "daemon/event_loop.h"
+#include "platform/linux/configuration.h"
+#include "platform/linux/curl_http_client.h"
+#include "platform/linux/directories.h"
+#include "platform/linux/entitlement_rules.h"
+#include "platform/linux/file_consent.h"
+#include "platform/linux/installed_client_bundle.h"
+#include "platform/linux/ipc/sd_bus_listener.h"
+#include "platform/linux/linux_device_information.h"
+#include "platform/linux/linux_file_system.h"
+#include "platform/linux/linux_locale_information.h"
+#include "platform/linux/linux_sandbox.h"
+#include "platform/linux/peer_credentials.h"
+#include "platform/linux/process_witness.h"
+#include "platform/linux/system_clock.h"
+#include "platform/linux/system_random.h"
+#include "platform/linux/toml_settings_store.h"
+#include "platform/linux/transaction_keep_alive.h"
+
+namespace tarnel {
+namespace {
+
+// What the utility class comes to here: behind whatever the user waits for.
+constexpr int kUtilityNice = 5;
+// Each connection takes a few descriptors; the usual soft limit would end long before the limit on clients.
+constexpr rlim_t kDescriptors = 8192;
+// For the posts of sessions that end with the process.
+constexpr std::chrono::seconds kLastPosts{5};
+
+void raiseDescriptorLimit() {
+  rlimit limit{};
+  if (::getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= kDescriptors) return;
+  limit.rlim_cur = std::min(limit.rlim_max, kDescriptors);
+  ::setrlimit(RLIMIT_NOFILE, &limit);
+}
+
+HttpClientOptions httpOptions(const Configuration& configuration) {
+  HttpClientOptions options;
+  options.extraCertificateFiles = configuration.trustFiles;
+  options.connectTimeout = configuration.http.connectTimeout;
+  options.noProgress = configuration.http.noProgress;
+  options.maxAnswerBytes = configuration.http.maxAnswerBytes;
+  options.maxQueuedBytes = configuration.http.maxQueuedBytes;
+  options.connectionsPerHost = configuration.http.connectionsPerHost;
+  options.connections = configuration.http.connections;
+  return options;
+}
+
+IpcLimits ipcLimits(const Configuration& configuration) {
+  IpcLimits limits;
+  limits.connections = configuration.limits.connections;
+  limits.connectionsPerUser = configuration.limits.connectionsPerUser;
+  return limits;
+}
+
+}  // namespace
+
+// In the order of construction: what stands further down may use what stands above it.
+struct LinuxWorld::Prepared {
+  explicit Prepared(std::shared_ptr<TarnelLogging> logging)
+      : log(std::move(logging)),
+        directories(Directories::fromEnvironment()),
+        configuration(loadConfiguration(directories.configuration())),
+        bundleFolder(InstalledClientBundle::folder(std::getenv("TARNEL_BUNDLE"))),
+        settings(directories.configuration(), directories.state(), *log),
+        deviceInformation(directories.configuration(), "", *log),
+        consent(directories.configuration(), *log),
+        locale(configuration.country, [](const char* name) { return std::getenv(name); }),
+        clientBundle(bundleFolder),
+        curl(*log, httpOptions(configuration)),
+        http(curl),
+        keepAlive({.idleExit = configuration.limits.idleExit,
+                   .arm = [this](std::chrono::seconds delay,
+                                 uint64_t generation) { loop.armTimer(delay, generation); },
+                   .isOtherWorkUnderWay = [this] { return http.underWay() != 0; },
+                   .idle = [this] { loop.exit(); }}),
+        consentIdentifiers(settings, consent, random),
+        process(*log, deviceInformation, settings) {
+    loop.setTimerHandler([this](uint64_t generation) { keepAlive.idleTimeElapsed(generation); });
+  }
+
+  void report(const std::vector<ConfigurationProblem>& problems) const {
+    for (const ConfigurationProblem& problem : problems) {
+      log->log(problem.level, "main: %s", problem.text.c_str());
+    }
+  }
+  void report(const std::vector<std::string>& problems) const {
+    for (const std::string& problem : problems) TARNEL_LOG(*log, warning, "main: %s", problem.c_str());
+  }
+
+  const std::shared_ptr<TarnelLogging> log;
+  const Directories directories;
+  const Configuration configuration;
+  const std::string bundleFolder;
+  EventLoop loop;
+  SystemClock clock;
+  SystemRandom random;
+  TomlSettingsStore settings;
+  LinuxDeviceInformation deviceInformation;
+  FileConsent consent;
+  LinuxLocaleInformation locale;
+  LinuxFileSystem files;
+  InstalledClientBundle clientBundle;
+  CurlHttpClient curl;
+  CountedHttpClient http;
+  TransactionKeepAlive keepAlive;
+  ConsentIdentifiers consentIdentifiers;
+  ProcessValues process;
+  std::unique_ptr<ProcessWitness> witness;
+  std::shared_ptr<EntitlementRules> entitlements;
+  const Dependencies dependencies{.log = *log,
+                                  .clock = clock,
+                                  .random = random,
+                                  .http = http,
+                                  .deviceInformation = deviceInformation,
+                                  .settings = settings,
+                                  .consent = consent,
+                                  .locale = locale,
+                                  .files = files,
+                                  .clientBundle = clientBundle,
+                                  .keepAlive = keepAlive,
+                                  .consentIdentifiers = consentIdentifiers,
+                                  .process = process,
+                                  .messageLogDirectory = directories.messageLogDirectory()};
+};
+
+LinuxWorld::LinuxWorld() = default;
+LinuxWorld::~LinuxWorld() = default;
+
+void LinuxWorld::setUtilityQualityOfService() {
+  errno = 0;
+  const int nice = ::getpriority(PRIO_PROCESS, 0);
+  if (errno == 0 && nice < kUtilityNice) ::setpriority(PRIO_PROCESS, 0, kUtilityNice);
+}
+
+Log& LinuxWorld::startLogging(const char* processName, const char* facility) {
+  ::signal(SIGPIPE, SIG_IGN);
+  log_ = TarnelLogging::startLogging(processName, facility);
+  return *log_;
+}
+
+void LinuxWorld::prepareForConfinement() {
+  raiseDescriptorLimit();
+  preloadLazyFacilities();
+  prepared_ = std::make_unique<Prepared>(log_);
+  Prepared& world = *prepared_;
+  log_->setConfiguredLevel(world.configuration.logLevel);
+  world.report(world.directories.problems());
+  world.report(world.configuration.problems);
+  world.report(world.directories.create());
+  if (const auto failure = world.curl.prepare()) {
+    TARNEL_LOG(*log_, warning, "main: %s", failure->localizedDescription().c_str());
+  }
+  std::vector<ConfigurationProblem> problems;
+  world.entitlements = EntitlementRules::load(world.directories.configuration(), problems);
+  world.report(problems);
+  if (!world.entitlements->needsExecutable()) return;
+  auto witness = ProcessWitness::start();
+  if (!witness) {
+    TARNEL_LOG(*log_, warning, "main: %s; rules that ask for an executable will not match",
+               witness.error().localizedDescription().c_str());
+    return;
+  }
+  world.witness = std::move(*witness);
+  world.entitlements->setExecutableLookup(
+      [&witness = *world.witness](int32_t pid) { return witness.executable(pid); });
+}
+
+std::optional<std::string> LinuxWorld::enterSandbox(const char* profileName) {
+  LinuxSandbox sandbox(prepared_->directories.configuration(),
+                       sandboxVariables(prepared_->directories, prepared_->bundleFolder));
+  return sandbox.enter(profileName);
+}
+
+const Dependencies& LinuxWorld::dependencies() {
+  return prepared_->dependencies;
+}
+
+std::unique_ptr<IpcListener> LinuxWorld::createListener(const char* /*serviceName*/) {
+  return std::make_unique<SdBusListener>(
+      prepared_->loop.handle(),
+      SdBusListener::Options{.runtimeDirectory = prepared_->directories.runtime(),
+                             .limits = ipcLimits(prepared_->configuration),
+                             .readCredentials = readPeerCredentials},
+      prepared_->entitlements, log_);
+}
+
+void LinuxWorld::notifyReady() {
+  ::sd_notify(0, "READY=1");
+  prepared_->keepAlive.start();
+}
+
+int LinuxWorld::runEventLoop() {
+  const int status = prepared_->loop.run();
+  if (status != 0) TARNEL_LOG(*log_, error, "main: the event loop failed; the daemon ends");
+  ::sd_notify(0, "STOPPING=1");
+  return status;
+}
+
+void LinuxWorld::finishPosts() {
+  if (!prepared_->http.waitUntilNone(kLastPosts)) {
+    TARNEL_LOG(*log_, warning, "main: %zu requests had not ended after %lld seconds and are given up",
+               prepared_->http.underWay(), static_cast<long long>(kLastPosts.count()));
+  }
+}
+
+void LinuxWorld::stopLogging() {
+  log_->stopLogging();
+}
+
+}  // namespace tarnel
