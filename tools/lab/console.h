@@ -1,0 +1,48 @@
+#pragma once
+
+#include <cstdio>
+#include <mutex>
+#include <string>
+
+#include "platform/clock.h"
+#include "tools/lab/arrival.h"
+#include "tools/lab/notices.h"
+
+namespace tarnel::lab {
+
+enum class ConsoleStyle { text, json, quiet };
+
+// Prints what happens: arrivals and served storebags to the output, a readable line each (or one JSON object
+// each); warnings to the error output. With ConsoleStyle::quiet only warnings. Threads: any.
+class Console final : public ArrivalObserver, public Notices {
+ public:
+  // Streams and clock outlive the console. colour: only for terminals.
+  Console(std::FILE* output, std::FILE* errors, ConsoleStyle style, bool colour, Clock& clock);
+
+  void arrived(const Arrival& arrival) override;
+  void storebagServed(const ServedStorebag& served) override;
+  void warning(const std::string& text) override;
+
+  // Where the lab listens and what to do with it: text for people, the status with ConsoleStyle::json.
+  void started(const std::string& text, const Dictionary& status);
+  void ended(const std::string& text);
+
+ private:
+  enum class Tint { plain, dim, good, bad };
+
+  std::string tinted(Tint tint, const std::string& text) const;
+  void print(std::FILE* stream, const std::string& text);
+  void printRecord(const char* kind, Dictionary record);
+
+  std::FILE* const output_;
+  std::FILE* const errors_;
+  const ConsoleStyle style_;
+  const bool colour_;
+  Clock& clock_;
+  std::mutex mutex_;
+};
+
+// "OW  Meetwell / video-call  51 events (2 x32, 1 x19)  3.4 kB gzip of 31.2 kB", without time and colour.
+std::string summaryOf(const Arrival& arrival);
+
+}  // namespace tarnel::lab

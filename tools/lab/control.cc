@@ -1,0 +1,92 @@
+#include "tools/lab/control.h"
+
+#include "platform/document.h"
+#include "tools/lab/listener.h"
+#include "tools/lab/service.h"
+#include "tools/lab/text.h"
+
+namespace tarnel::lab {
+namespace {
+
+constexpr uint64_t kDefaultLast = 20;
+
+HttpAnswer jsonAnswer(const Dictionary& value, int status = 200) {
+  HttpAnswer answer;
+  answer.status = status;
+  answer.body = writeTextDocument(value, true) + "\n";
+  return answer;
+}
+
+HttpAnswer errorAnswer(int status, const std::string& text) {
+  return jsonAnswer({{"error", text}}, status);
+}
+
+// "127.0.0.1:8444", "[::1]:8444" or "localhost:8444": a name that a stranger's name server made point to us
+// would be another one.
+bool isLocalHost(const std::string& host) {
+  std::string name = host.substr(0, host.rfind(':'));
+  if (host.ends_with("]") || host.find(':') == std::string::npos) name = host;
+  if (name.size() > 2 && name.front() == '[' && name.back() == ']') name = name.substr(1, name.size() - 2);
+  return lowerCased(name) == "localhost" || isLoopbackAddress(name);
+}
+
+bool isFromElsewhere(const HttpRequest& request) {
+  const std::string* site = findHeader(request.headers, "Sec-Fetch-Site");
+  if (site != nullptr && *site != "none" && *site != "same-origin") return true;
+  const std::string* host = findHeader(request.headers, "Host");
+  if (host != nullptr && !isLocalHost(*host)) return true;
+  const std::string* origin = findHeader(request.headers, "Origin");
+  return origin != nullptr && (host == nullptr || *origin != "http://" + *host);
+}
+
+}  // namespace
+
+HttpAnswer Control::answer(const HttpRequest& request) {
+  if (isFromElsewhere(request)) {
+    return errorAnswer(403, "the control address answers programs of this machine, not pages of other sites");
+  }
+  if (request.path == "/misbehave") return misbehave(request);
+  const bool post = request.method == "POST";
+  if (request.path == "/clear" || request.path == "/stop") {
+    if (!post) return errorAnswer(405, request.path + " takes POST: curl -X POST ...");
+    if (request.path == "/stop") {
+      parts_.stop();
+      return jsonAnswer({{"stopping", true}});
+    }
+    parts_.store.clear();
+    return jsonAnswer({{"cleared", true}});
+  }
+  if (!post && request.path == "/status") return jsonAnswer(parts_.status());
+  if (!post && request.path == "/arrivals") return arrivals(request);
+  return errorAnswer(
+      404,
+      "there is GET /status, GET /arrivals?last=N, GET or POST /misbehave?..., POST /clear and "
+      "POST /stop");
+}
+
+HttpAnswer Control::arrivals(const HttpRequest& request) const {
+  uint64_t last = kDefaultLast;
+  if (const std::string* text = findParameter(request.query, "last")) {
+    const std::optional<uint64_t> number = parseNumber(*text);
+    if (!number) return errorAnswer(400, "last takes a number of arrivals");
+    last = *number;
+  }
+  Array list;
+  for (const Arrival& arrival : parts_.store.last(last)) list.append(recordOfPost(arrival, true));
+  return jsonAnswer({{"arrivals", list}});
+}
+
+HttpAnswer Control::misbehave(const HttpRequest& request) {
+  if (findParameter(request.query, "clear") != nullptr) {
+    parts_.misbehaviours.clear();
+  } else if (!request.query.empty()) {
+    Result<Misbehaviour> misbehaviour = misbehaviourFromQuery(request.query);
+    if (!misbehaviour) return errorAnswer(400, misbehaviour.error().localizedDescription());
+    if (MaybeError error = parts_.misbehaviours.add(*std::move(misbehaviour))) {
+      return errorAnswer(409, error->localizedDescription());
+    }
+  }
+  return jsonAnswer({{"misbehaviours", parts_.misbehaviours.description()}});
+}
+
+}  // namespace tarnel::lab

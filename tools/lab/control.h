@@ -1,0 +1,34 @@
+#pragma once
+
+#include <functional>
+
+#include "tools/lab/arrival_store.h"
+#include "tools/lab/http_message.h"
+#include "tools/lab/misbehaviour.h"
+
+namespace tarnel::lab {
+
+// What stands behind the control address. Requests that a web page of another site makes in a browser are
+// refused. Threads: any.
+class Control final : public HttpHandler {
+ public:
+  struct Parts {
+    ArrivalStore& store;
+    Misbehaviours& misbehaviours;
+    std::function<Dictionary()> status;
+    std::function<void()> stop;
+  };
+
+  explicit Control(Parts parts) : parts_(std::move(parts)) {}
+
+  HttpAnswer answer(const HttpRequest& request) override;
+  void connectionFailed(const std::string&, const std::string&) override {}
+
+ private:
+  HttpAnswer arrivals(const HttpRequest& request) const;
+  HttpAnswer misbehave(const HttpRequest& request);
+
+  const Parts parts_;
+};
+
+}  // namespace tarnel::lab

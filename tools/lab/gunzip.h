@@ -1,0 +1,14 @@
+#pragma once
+
+#include <string>
+#include <string_view>
+
+#include "platform/base/error.h"
+
+namespace tarnel::lab {
+
+// Unpacks one or more gzip members (RFC 1952) that make up the whole input; at most maxBytes come out.
+// The error says what is wrong. Threads: any.
+Result<std::string> gunzip(std::string_view input, size_t maxBytes);
+
+}  // namespace tarnel::lab

@@ -1,0 +1,48 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+
+#include "platform/base/error.h"
+#include "tools/lab/http_message.h"
+
+struct ssl_ctx_st;
+
+namespace tarnel::lab {
+
+struct HttpServerOptions {
+  std::string address = "127.0.0.1";  // numeric, IPv4 or IPv6
+  uint16_t port = 0;                  // 0: any free one
+  std::string portOption;             // named in the error when the port is in use
+  std::shared_ptr<ssl_ctx_st> tls;    // null: plain HTTP
+  size_t maxBodyBytes = 16U << 20U;
+  // Bodies that are held at the same time, all connections together; beyond it a request waits its turn
+  // to fail as too large.
+  size_t maxHeldBytes = 256U << 20U;
+  size_t maxConnections = 128;  // served at the same time; further ones wait
+};
+
+// HTTP/1.1 over one listening socket, one thread a connection. Everything a client can make it hold is
+// bounded: request line and header fields to 64 KiB, the body as above, the time of a request to two
+// minutes, an idle connection to a minute (less while others wait).
+class HttpServer {
+ public:
+  // Listens when it returns. The handler outlives the server. The error names the fix.
+  static Result<std::unique_ptr<HttpServer>> start(const HttpServerOptions& options, HttpHandler& handler);
+
+  HttpServer() = default;
+  HttpServer(const HttpServer&) = delete;
+  HttpServer& operator=(const HttpServer&) = delete;
+  virtual ~HttpServer() = default;
+
+  virtual uint16_t port() const = 0;
+  // Answers what is being answered, ends all connections; returns when no thread is left. Idempotent.
+  virtual void stop() = 0;
+};
+
+// The context that presents this certificate; null with the reason on failure.
+Result<std::shared_ptr<ssl_ctx_st>> makeServerTlsContext(const std::string& certificateFile,
+                                                         const std::string& keyFile);
+
+}  // namespace tarnel::lab

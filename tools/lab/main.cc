@@ -1,0 +1,74 @@
+#include <poll.h>
+#include <sys/signalfd.h>
+#include <sys/time.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+
+#include "tools/lab/lab.h"
+#include "tools/storebag/file_io.h"
+
+namespace {
+
+using namespace tarnel;
+using namespace tarnel::lab;
+
+class WallClock final : public Clock {
+ public:
+  TimeValue timeOfDay() override {
+    timeval now{};
+    ::gettimeofday(&now, nullptr);
+    return {.seconds = now.tv_sec, .microseconds = static_cast<int32_t>(now.tv_usec)};
+  }
+};
+
+// Blocked before any thread begins, so that all of them leave these signals to the descriptor.
+FileDescriptor endSignals() {
+  sigset_t set;
+  sigemptyset(&set);
+  sigaddset(&set, SIGINT);
+  sigaddset(&set, SIGTERM);
+  pthread_sigmask(SIG_BLOCK, &set, nullptr);
+  std::signal(SIGPIPE, SIG_IGN);
+  return FileDescriptor(::signalfd(-1, &set, SFD_CLOEXEC));
+}
+
+void waitForEnd(int signalFd, int stopFd) {
+  pollfd entries[2] = {{.fd = signalFd, .events = POLLIN, .revents = 0},
+                       {.fd = stopFd, .events = POLLIN, .revents = 0}};
+  while (::poll(entries, 2, -1) < 0 && errno == EINTR) {
+  }
+}
+
+bool wantsColour() {
+  const char* noColour = std::getenv("NO_COLOR");
+  const char* terminal = std::getenv("TERM");
+  return ::isatty(STDOUT_FILENO) == 1 && (noColour == nullptr || *noColour == '\0') &&
+         (terminal == nullptr || std::string_view(terminal) != "dumb");
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  const ParsedOptions parsed = parseOptions(argc, argv);
+  if (parsed.exitCode) return *parsed.exitCode;
+  const FileDescriptor signals = endSignals();
+  WallClock clock;
+  const ConsoleStyle style = parsed.options.json
+                                 ? ConsoleStyle::json
+                                 : (parsed.options.quiet ? ConsoleStyle::quiet : ConsoleStyle::text);
+  Console console(stdout, stderr, style, wantsColour(), clock);
+  const Result<std::unique_ptr<Lab>> lab = Lab::start(parsed.options, console, clock);
+  if (!lab) {
+    std::fprintf(stderr, "tarnel-lab: %s\n", lab.error().localizedDescription().c_str());
+    return EXIT_FAILURE;
+  }
+  waitForEnd(signals.get(), (*lab)->stopRequestedFd());
+  (*lab)->stop();
+  const Dictionary status = (*lab)->status();
+  console.ended("ended: " + std::to_string(status.find("posts")->int64Value()) + " posts with " +
+                std::to_string(status.find("events")->int64Value()) + " events received");
+  return EXIT_SUCCESS;
+}

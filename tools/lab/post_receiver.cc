@@ -1,0 +1,89 @@
+#include "tools/lab/post_receiver.h"
+
+#include "platform/document.h"
+#include "tools/lab/event_check.h"
+#include "tools/lab/gunzip.h"
+#include "tools/lab/text.h"
+
+namespace tarnel::lab {
+namespace {
+
+constexpr size_t kMaxHeaderText = 1024;
+
+struct Refusal {
+  int status;
+  std::string reason;
+};
+
+// Unpacks and parses; the refusal when there is nothing to check.
+std::optional<Refusal> readBody(const HttpRequest& request, Arrival& arrival, Value& document) {
+  if (request.bodyState == BodyState::tooLarge) return Refusal{413, "body: larger than the lab takes"};
+  if (request.bodyState == BodyState::cutOff) return Refusal{400, "body: the connection ended within it"};
+  std::string_view plain = request.body;
+  Result<std::string> unpacked = std::string();
+  if (const std::string* encoding = findHeader(request.headers, "Content-Encoding")) {
+    if (*encoding == "gzip") {
+      arrival.gzip = true;
+      unpacked = gunzip(request.body, PostReceiver::kMaxPlainBytes);
+      if (!unpacked) return Refusal{400, "body: " + unpacked.error().localizedDescription()};
+      plain = *unpacked;
+    } else if (*encoding != "identity") {
+      return Refusal{415, "header Content-Encoding: must be gzip or missing, but is \"" +
+                              printable(*encoding, 80) + "\""};
+    }
+  }
+  arrival.plainBytes = plain.size();
+  Result<Value> parsed = parseDocument(plain);
+  if (!parsed) return Refusal{400, "body: no JSON: " + printable(parsed.error().localizedDescription())};
+  document = *std::move(parsed);
+  return std::nullopt;
+}
+
+Arrival arrivalFrom(const HttpRequest& request, double now) {
+  Arrival arrival;
+  arrival.arrived = now;
+  arrival.path = printable(request.path);
+  arrival.sender = request.sender;
+  for (const auto& [name, value] : request.headers) {
+    arrival.headers.emplace_back(printable(name, kMaxHeaderText), printable(value, kMaxHeaderText));
+  }
+  arrival.wireBytes = request.body.size();
+  arrival.plainBytes = request.body.size();
+  return arrival;
+}
+
+}  // namespace
+
+HttpAnswer PostReceiver::receive(const HttpRequest& request) {
+  Arrival arrival = arrivalFrom(request, secondsFromTimeValue(clock_.timeOfDay()));
+  Problems problems;
+  Value document;
+  HttpAnswer answer;
+  if (const auto refusal = readBody(request, arrival, document)) {
+    answer.status = refusal->status;
+    problems.add(refusal->reason);
+  } else {
+    const PostMessage message = readMessage(document, problems);
+    for (size_t i = 0; i < message.events.size(); ++i) checkEvent(message.events[i], i + 1, problems);
+    checkHeaders(request.headers, message,
+                 {.wireBytes = request.body.size(), .plainBytes = arrival.plainBytes, .gzip = arrival.gzip},
+                 problems);
+    arrival.clientId = message.clientId;
+    arrival.postTime = message.postTime;
+    arrival.events = message.events;
+    if (document.dictionary() == nullptr) answer.status = 400;
+  }
+  arrival.problems = problems.take();
+  Array list;
+  for (const std::string& problem : arrival.problems) list.append(problem);
+  answer.body = writeTextDocument(Dictionary{{"received", arrival.events.size()}, {"problems", list}}) + "\n";
+  arrival.answered = std::to_string(answer.status);
+  if (const auto misbehaviour = misbehaviours_.take(RequestKind::post)) {
+    misbehaviour->applyTo(answer);
+    arrival.answered = misbehaviour->description();
+  }
+  store_.add(std::move(arrival));
+  return answer;
+}
+
+}  // namespace tarnel::lab

@@ -1,0 +1,50 @@
+#pragma once
+
+#include <atomic>
+
+#include "platform/clock.h"
+#include "tools/lab/http_message.h"
+#include "tools/lab/misbehaviour.h"
+#include "tools/lab/notices.h"
+#include "tools/lab/post_receiver.h"
+#include "tools/lab/storebag_source.h"
+
+namespace tarnel::lab {
+
+// What stands behind the HTTPS address: GET of storebags, POST of events. Threads: any.
+class Service final : public HttpHandler {
+ public:
+  struct Parts {
+    StorebagSource& storebags;
+    PostReceiver& posts;
+    Misbehaviours& misbehaviours;
+    Notices& notices;
+    Clock& clock;
+  };
+
+  // maxAge: seconds for "Cache-Control" of storebags.
+  Service(const Parts& parts, int maxAge) : parts_(parts), maxAge_(maxAge) {}
+
+  HttpAnswer answer(const HttpRequest& request) override;
+  void connectionFailed(const std::string& sender, const std::string& text) override;
+
+  uint64_t storebagsServed() const { return storebagsServed_; }
+
+ private:
+  HttpAnswer answerStorebag(const HttpRequest& request, const std::string& name);
+  HttpAnswer goodAnswer(const HttpRequest& request, const std::string& name, const Misbehaviour* misbehaviour,
+                        ServedStorebag& served);
+  void tellFindings(const std::string& name, const PreparedStorebag& storebag);
+
+  const Parts parts_;
+  const int maxAge_;
+  std::atomic<uint64_t> storebagsServed_ = 0;
+};
+
+// The storebag name in "/storebags/NAME", "/bags/alder/NAME" and "/storebags/alder/NAME"; empty for other
+// paths.
+std::string storebagNameInPath(const std::string& path);
+
+HttpAnswer plainAnswer(int status, const std::string& text);
+
+}  // namespace tarnel::lab
