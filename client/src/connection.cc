@@ -199,7 +199,7 @@ uint64_t Connection::dueAt() const {
   return sd_bus_get_timeout(bus_.get(), &due) < 0 ? UINT64_MAX : due;
 }
 
-int Connection::onReply(sd_bus_message* reply, void* held, void*) {
+int Connection::onReply(sd_bus_message* reply, void* held, void*) noexcept {
   auto& call = *static_cast<Call*>(held);
   call.connection->handleReply(call, reply);
   return 1;
@@ -228,7 +228,7 @@ void Connection::passBarriers() {
   }
 }
 
-int Connection::onAggregated(sd_bus_message* message, void* self, void*) {
+int Connection::onAggregated(sd_bus_message* message, void* self, void*) noexcept {
   double timestamp = 0;
   uint16_t category = 0;
   uint16_t type = 0;

@@ -84,8 +84,9 @@ class Connection {
     void operator()(sd_bus* bus) const noexcept;
   };
 
-  static int onReply(sd_bus_message* reply, void* call, void* error);
-  static int onAggregated(sd_bus_message* message, void* connection, void* error);
+  // noexcept: nothing may be thrown through the bus library, whatever a callback does.
+  static int onReply(sd_bus_message* reply, void* call, void* error) noexcept;
+  static int onAggregated(sd_bus_message* message, void* connection, void* error) noexcept;
   Outcome transmit(std::vector<Request> requests, BusMessage message);
   void handleReply(Call& call, sd_bus_message* reply);
   void passBarriers();

@@ -42,11 +42,7 @@ SteadyTime fromMonotonic(uint64_t microseconds) {
 
 IoLoop::IoLoop(const Options& options, const Handlers& handlers, Mailbox& mailbox,
                ForkVisibleDescriptor& socket)
-    : options_(options),
-      path_(resolveSocketPath(options.socketPath)),
-      handlers_(handlers),
-      mailbox_(mailbox),
-      socket_(socket) {}
+    : options_(options), path_(options.socketPath), handlers_(handlers), mailbox_(mailbox), socket_(socket) {}
 
 IoLoop::~IoLoop() = default;
 

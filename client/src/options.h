@@ -10,7 +10,7 @@
 namespace tarnel::core {
 
 struct Options {
-  std::string socketPath;  // empty: resolveSocketPath decides
+  std::string socketPath;  // resolved before the session is made
   uint32_t maxQueuedCalls = 4096;
   uint32_t maxQueuedBytes = 8U << 20U;
   uint32_t maxUnanswered = 256;

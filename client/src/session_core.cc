@@ -41,7 +41,9 @@ Outcome SessionCore::create(const Options& options, Handlers handlers,
     return failure(TARNEL_ERROR_SYSTEM,
                    std::string("no descriptor for a session: ") + strerrordesc_np(errno));
   }
-  auto made = std::make_shared<SessionCore>(Token(), options, std::move(handlers), std::move(wake));
+  Options resolved = options;
+  resolved.socketPath = resolveSocketPath(options.socketPath);  // the caller's environment, as it is now
+  auto made = std::make_shared<SessionCore>(Token(), resolved, std::move(handlers), std::move(wake));
   rememberSession(made);
   if (auto outcome = made->startThread(); !outcome.ok()) {
     forgetSession(made.get());
@@ -108,6 +110,7 @@ Outcome SessionCore::checkProcess() const {
 void SessionCore::close() {
   mailbox_.close(std::chrono::steady_clock::now() + options_.linger);
   if (isOnOwnThread()) {
+    const std::lock_guard lock(joinMutex_);
     thread_.detach();
     return;
   }
@@ -116,7 +119,12 @@ void SessionCore::close() {
     const std::lock_guard lock(endMutex_);
     if (!hasEnded_) return;
   }
-  thread_.join();
+  join();
+}
+
+void SessionCore::join() {
+  const std::lock_guard lock(joinMutex_);
+  if (thread_.joinable()) thread_.join();
 }
 
 void SessionCore::beginExit() {
@@ -127,8 +135,11 @@ void SessionCore::beginExit() {
 
 void SessionCore::awaitEnd(SteadyTime latest) {
   if (isOnOwnThread()) return;
-  std::unique_lock lock(endMutex_);
-  ended_.wait_until(lock, latest, [this] { return hasEnded_; });
+  {
+    std::unique_lock lock(endMutex_);
+    if (!ended_.wait_until(lock, latest, [this] { return hasEnded_; })) return;
+  }
+  join();
 }
 
 void SessionCore::closeDescriptorsInChild() {

@@ -54,6 +54,7 @@ class SessionCore : public std::enable_shared_from_this<SessionCore> {
  private:
   void run();
   Outcome startThread();
+  void join();
 
   const Options options_;
   const Handlers handlers_;
@@ -66,7 +67,8 @@ class SessionCore : public std::enable_shared_from_this<SessionCore> {
   std::mutex endMutex_;
   std::condition_variable ended_;
   bool hasEnded_ = false;  // guarded by endMutex_
-  std::thread thread_;
+  std::mutex joinMutex_;
+  std::thread thread_;                        // joined or detached under joinMutex_
   std::atomic<std::thread::id> ownThread_{};  // outlasts detaching
 };
 

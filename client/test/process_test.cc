@@ -261,7 +261,7 @@ int runProgram(const std::string& mode, const char* path) {
 }  // namespace tarnel::client
 
 int main(int argc, char** argv) {
-  if (argc == 3) return tarnel::client::runProgram(argv[1], argv[2]);
+  if (argc == 3 && argv[1][0] != '-') return tarnel::client::runProgram(argv[1], argv[2]);
   ::testing::InitGoogleTest(&argc, argv);
   return RUN_ALL_TESTS();
 }
