@@ -1,5 +1,3 @@
-#include <algorithm>
-
 #include "backends/https/https_post_backend.h"
 #include "backends/https/sender_names.h"
 #include "backends/https/text_format.h"
@@ -14,15 +12,9 @@ namespace {
 // Longer names would make servers refuse the whole request.
 constexpr size_t kMaxHeaderValue = 1024;
 
-// Client-supplied text as a header may carry it: no control characters, which could end the line, and cut to
-// whole characters that fit.
+// Text of a client or the device as a header may carry it, cut to whole characters that fit.
 std::string headerText(std::string_view text) {
-  std::string safe;
-  safe.reserve(std::min(text.size(), kMaxHeaderValue));
-  std::copy_if(text.begin(), text.end(), std::back_inserter(safe), [](char c) {
-    const auto byte = static_cast<uint8_t>(c);
-    return byte >= 0x20 && byte != 0x7F;
-  });
+  std::string safe = headerSafe(text);
   if (safe.size() <= kMaxHeaderValue) return safe;
   size_t end = kMaxHeaderValue;
   while (end > 0 && (static_cast<uint8_t>(safe[end]) & 0xC0U) == 0x80U) --end;
