@@ -236,6 +236,11 @@ TEST_F(LinuxSandboxTest, PrivilegesCannotBeGained) {
   EXPECT_EQ(confined([] { return std::to_string(::prctl(PR_GET_NO_NEW_PRIVS, 0UL, 0UL, 0UL, 0UL)); }), "1");
 }
 
+TEST_F(LinuxSandboxTest, ThePeersUnitCanStillBeRead) {
+  const std::string cgroup = "/proc/" + std::to_string(::getpid()) + "/cgroup";
+  EXPECT_EQ(confined([&cgroup] { return std::string(readFile(cgroup) ? "read" : "unreadable"); }), "read");
+}
+
 TEST_F(LinuxSandboxTest, LocalTimeStaysKnown) {
   EXPECT_EQ(confined([] {
               const time_t time = 1700000000;
