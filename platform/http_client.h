@@ -1,6 +1,7 @@
 #pragma once
 
 #include <chrono>
+#include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
@@ -62,10 +63,18 @@ class HttpClient {
   virtual void startDataTask(HttpRequest request, Completion completion) = 0;
 };
 
+// The text without control characters (line ends and NUL among them): for header values that a stranger
+// wrote. A request with such characters in a header fails, lest anybody add headers of their own.
+std::string headerSafe(std::string_view text);
+
 // Starts the request and holds the calling thread until it has ended. Never call it on the client's thread.
 HttpResult performAndWait(HttpClient& client, HttpRequest request);
 
-// Domain of the errors that a client reports for transport failures; the code is the library's own.
+// Domain of the errors that a client reports for transport failures; a positive code is the HTTP library's
+// own, a negative one means that the client itself refused.
 inline constexpr char kHttpErrorDomain[] = "TarnelHTTPErrorDomain";
+inline constexpr int64_t kHttpClientGoingAway = -1;
+inline constexpr int64_t kHttpTooMuchQueued = -2;
+inline constexpr int64_t kHttpBadRequest = -3;  // URL, method or a header that cannot be sent
 
 }  // namespace tarnel

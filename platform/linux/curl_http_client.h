@@ -1,0 +1,68 @@
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/base/log.h"
+#include "platform/http_client.h"
+
+namespace tarnel {
+
+struct HttpClientOptions {
+  // Whom TLS trusts: the first of these files that exists (the system's bundle), and all that follow.
+  std::vector<std::string> systemCertificateFiles = {"/etc/ssl/certs/ca-certificates.crt",
+                                                     "/etc/pki/tls/certs/ca-bundle.crt",
+                                                     "/etc/ssl/ca-bundle.pem", "/etc/ssl/cert.pem"};
+  std::vector<std::string> extraCertificateFiles;  // PEM
+  std::vector<std::string> extraCertificates;      // PEM texts
+
+  std::chrono::milliseconds connectTimeout{30000};  // name, connection and TLS handshake
+  std::chrono::seconds noProgress{60};              // without a byte in either direction
+  std::chrono::milliseconds longestRequest{
+      std::chrono::hours(1)};  // of a request without a time-out of its own
+
+  size_t maxAnswerBytes = 8U << 20U;       // of one body; a larger one is an error
+  size_t maxHeaderBytes = 256U << 10U;     // of all headers of one answer
+  size_t maxHeldAnswerBytes = 64U << 20U;  // of all bodies that are arriving
+  size_t maxQueuedBytes = 64U << 20U;      // of all request bodies that have not ended
+  size_t maxQueuedRequests = 4096;         // that have not ended
+  size_t connectionsPerHost = 6;
+  size_t connections = 32;
+  size_t maxRedirects = 10;
+};
+
+// The process's HTTP client: one thread, which starts with the first request, carries all transfers.
+//
+// Requests wait for a free connection in the order of their start; waiting counts toward their time-out.
+// Past maxQueuedBytes or maxQueuedRequests a request ends at once with kHttpTooMuchQueued. A redirect (301,
+// 302, 303, 307, 308) is followed by this class: 303, and 301 and 302 after a POST, go on as GET without the
+// body and its "Content-" headers; "Authorization" and "Cookie" stay behind when scheme, host or port change.
+// Answers come as they were sent (nothing is decompressed). No proxy is used, whatever the environment says.
+// A request on a kept connection that the server closed before it answered anything is sent once more on a
+// new one.
+//
+// Threads: any thread may call; the object must not be destroyed by a completion. A completion that throws is
+// logged and otherwise ignored.
+class CurlHttpClient final : public HttpClient {
+ public:
+  // The log must outlive the client.
+  explicit CurlHttpClient(Log& log, HttpClientOptions options = {});
+  // Requests that have not ended complete with kHttpClientGoingAway before this returns.
+  ~CurlHttpClient() override;
+
+  // Loads certificates and the name service, which would otherwise be loaded with the first request: to be
+  // called before the process is confined and before the first request. The error names what could not be
+  // loaded, and the remedy; the client works with the rest.
+  MaybeError prepare();
+
+  void startDataTask(HttpRequest request, Completion completion) override;
+
+ private:
+  class Worker;
+  std::unique_ptr<Worker> worker_;
+};
+
+}  // namespace tarnel

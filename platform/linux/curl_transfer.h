@@ -1,0 +1,94 @@
+#pragma once
+
+#include <curl/curl.h>
+#include <openssl/x509.h>
+
+#include <array>
+#include <chrono>
+#include <cstddef>
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "platform/http_client.h"
+#include "platform/linux/curl_http_client.h"
+
+namespace tarnel::detail {
+
+struct FreeCurl {
+  void operator()(CURL* easy) const { curl_easy_cleanup(easy); }
+  void operator()(curl_slist* list) const { curl_slist_free_all(list); }
+};
+using CurlEasy = std::unique_ptr<CURL, FreeCurl>;
+using CurlList = std::unique_ptr<curl_slist, FreeCurl>;
+
+// What all transfers of one client share.
+struct TransferContext {
+  const HttpClientOptions& options;
+  X509_STORE* certificates = nullptr;
+  size_t heldAnswerBytes = 0;
+};
+
+// One request on its way, redirects included. Threads: the client's own only.
+class CurlTransfer {
+ public:
+  CurlTransfer(HttpRequest request, HttpClient::Completion completion, TransferContext& context);
+  CurlTransfer(const CurlTransfer&) = delete;
+  CurlTransfer& operator=(const CurlTransfer&) = delete;
+  ~CurlTransfer();
+
+  // Prepares a handle for the request as it stands; begin() or followRedirect() comes before every hop.
+  MaybeError begin(CurlEasy easy);
+  CURL* handle() const { return easy_.get(); }
+
+  // After a hop ended well by the library's account: whether its headers came whole. The library takes a
+  // connection that closes between two headers for a complete answer.
+  MaybeError incompleteAnswer() const;
+
+  // After a whole answer: whether another one is due. An error means that the redirect is refused.
+  enum class Next { finished, hop };
+  Result<Next> followRedirect();
+
+  // The final answer, or why there is none.
+  HttpResult result(CURLcode code);
+
+  HttpClient::Completion takeCompletion() { return std::move(completion_); }
+  CurlEasy takeHandle() { return std::move(easy_); }
+  size_t bodyBytes() const { return bodyBytes_; }
+
+ private:
+  template <class T>
+  void set(CURLoption option, T value) {
+    if (setUp_ == CURLE_OK) setUp_ = curl_easy_setopt(easy_.get(), option, value);
+  }
+  void setMethodAndBody();
+  void setHeaders();
+  void addHeaderLine(const std::string& line);
+  void setConnection();
+  void dropAnswer();
+  MaybeError redirectTo(const std::string& url, long status);
+
+  size_t receiveBody(std::string_view bytes);
+  size_t receiveHeader(std::string_view line);
+  static size_t onBody(char* bytes, size_t size, size_t count, void* self);
+  static size_t onHeader(char* bytes, size_t size, size_t count, void* self);
+  static CURLcode onTls(CURL* easy, void* context, void* certificates);
+
+  HttpRequest request_;
+  HttpClient::Completion completion_;
+  TransferContext& context_;
+  const size_t bodyBytes_;
+  CurlEasy easy_;
+  CurlList headerList_;
+  CURLcode setUp_ = CURLE_OK;
+  std::array<char, CURL_ERROR_SIZE> errorText_{};
+  size_t redirects_ = 0;
+
+  std::vector<HttpHeader> headers_;
+  size_t headerBytes_ = 0;
+  bool headersEnded_ = false;
+  std::string data_;
+  MaybeError refusal_;  // why a callback ended the transfer
+};
+
+}  // namespace tarnel::detail
