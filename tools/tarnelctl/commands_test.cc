@@ -85,11 +85,13 @@ TEST_F(CommandTest, ABadValueIsAUsageError) {
 TEST_F(CommandTest, ConsentIsOffUntilTurnedOn) {
   EXPECT_EQ(showConsent(path("config"), false, terminal_), ExitStatus::ok);
   EXPECT_EQ(out(), "Submission of diagnostics is off.\n");
-  EXPECT_EQ(storeConsent(path("config"), true, terminal_), ExitStatus::ok);
+  EXPECT_EQ(storeConsent(path("config"), true, store_, terminal_), ExitStatus::ok);
   clear();
   EXPECT_EQ(showConsent(path("config"), true, terminal_), ExitStatus::ok);
   EXPECT_EQ(out(), "{\"diagnostics\":true}\n");
-  EXPECT_EQ(storeConsent(path("config"), false, terminal_), ExitStatus::ok);
+  store_.setObject("com.orvane.tarnel", "dnu:respect", "old");
+  EXPECT_EQ(storeConsent(path("config"), false, store_, terminal_), ExitStatus::ok);
+  EXPECT_FALSE(store_.objectForKey("com.orvane.tarnel", "dnu:respect"));
   clear();
   EXPECT_EQ(showConsent(path("config"), false, terminal_), ExitStatus::ok);
   EXPECT_EQ(out(), "Submission of diagnostics is off.\n");

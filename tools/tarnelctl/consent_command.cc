@@ -3,8 +3,10 @@
 #include <ostream>
 #include <string_view>
 
+#include "client/shared/consent_identifiers.h"
 #include "platform/base/log.h"
 #include "platform/linux/file_consent.h"
+#include "platform/linux/system_random.h"
 
 namespace tarnel::ctl {
 namespace {
@@ -36,10 +38,17 @@ ExitStatus showConsent(const std::string& configurationDirectory, bool json, con
   return ExitStatus::ok;
 }
 
-ExitStatus storeConsent(const std::string& configurationDirectory, bool allowed, const Terminal& terminal) {
+ExitStatus storeConsent(const std::string& configurationDirectory, bool allowed, TomlSettingsStore& store,
+                        const Terminal& terminal) {
   if (const auto error = FileConsent::store(configurationDirectory, allowed)) {
     terminal.err << "tarnelctl: " << error->localizedDescription() << '\n';
     return ExitStatus::failed;
+  }
+  if (!allowed) {
+    TerminalLog log(terminal);
+    FileConsent consent(configurationDirectory, log);
+    SystemRandom random;
+    ConsentIdentifiers(store, consent, random).getPersistentIdentifierForDNU(1);
   }
   terminal.out << "Submission of diagnostics is now " << (allowed ? "on" : "off")
                << ". Sessions that start from now on follow it.\n";

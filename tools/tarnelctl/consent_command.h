@@ -2,6 +2,7 @@
 
 #include <string>
 
+#include "platform/linux/toml_settings_store.h"
 #include "tools/tarnelctl/terminal.h"
 
 // `tarnelctl consent`: whether the user has agreed to the submission of diagnostics.
@@ -9,6 +10,9 @@
 namespace tarnel::ctl {
 
 ExitStatus showConsent(const std::string& configurationDirectory, bool json, const Terminal& terminal);
-ExitStatus storeConsent(const std::string& configurationDirectory, bool allowed, const Terminal& terminal);
+// Withholding consent also drops the identifier that honours it, so that one made later tells nothing of the
+// old.
+ExitStatus storeConsent(const std::string& configurationDirectory, bool allowed, TomlSettingsStore& store,
+                        const Terminal& terminal);
 
 }  // namespace tarnel::ctl

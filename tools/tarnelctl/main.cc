@@ -189,7 +189,8 @@ void addConsent(CommandLine& line) {
         group->add_subcommand(allowed ? "on" : "off", allowed ? "agree to diagnostics" : "withhold consent");
     command->callback([&line, allowed] {
       line.run = [&line, allowed] {
-        return storeConsent(line.directories.configuration(), allowed, line.terminal);
+        auto store = line.store();
+        return storeConsent(line.directories.configuration(), allowed, store, line.terminal);
       };
     });
   }
