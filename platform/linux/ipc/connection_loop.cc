@@ -1,8 +1,9 @@
 #include "platform/linux/ipc/connection_loop.h"
 
+#include <fcntl.h>
 #include <poll.h>
-#include <sys/ioctl.h>
 #include <sys/socket.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <array>
@@ -17,10 +18,11 @@
 namespace tarnel {
 namespace {
 
-// Messages that are read before the descriptors are looked at again.
-constexpr int kMessagesPerWakeup = 16;
-// Reads without a complete message before the bytes are counted; nearly every message takes fewer.
-constexpr unsigned kFreeReads = 3;
+// Steps of input before the descriptors and tasks are looked at again.
+constexpr int kStepsPerWakeup = 64;
+constexpr size_t kBufferBytes = size_t{16} << 10U;
+// Room of the pipe to the bus. The default, times all connections, would use up what a user may have.
+constexpr int kPipeBytes = 16 << 10;
 
 sd_id128_t randomId() {
   sd_id128_t id{};
@@ -51,15 +53,21 @@ void ConnectionLoop::run() {
 // The bus object speaks the server's side of the authentication and accepts everyone: who is let in was
 // decided before, from what the kernel says.
 bool ConnectionLoop::open() {
+  std::array<int, 2> ends{-1, -1};
+  int r = pipe2(ends.data(), O_CLOEXEC | O_NONBLOCK) == 0 ? 0 : -errno;
+  UniqueFd readEnd(ends[0]);
+  feed_.reset(ends[1]);
+  if (r >= 0) fcntl(feed_.get(), F_SETPIPE_SZ, kPipeBytes);
   sd_bus* made = nullptr;
-  int r = sd_bus_new(&made);
+  if (r >= 0) r = sd_bus_new(&made);
   bus_.reset(made);
-  if (r >= 0) r = sd_bus_set_fd(made, socket_.get(), socket_.get());
-  if (r >= 0) busFd_ = socket_.release();
+  if (r >= 0) r = sd_bus_set_fd(made, readEnd.get(), socket_.get());
+  if (r >= 0) {
+    readEnd.release();
+    busFd_ = socket_.release();
+  }
   if (r >= 0) r = sd_bus_set_server(made, 1, randomId());
   if (r >= 0) r = sd_bus_set_anonymous(made, 1);
-  // No method takes descriptors. Not negotiated, the library closes what comes and ends the connection;
-  // negotiated, a peer could park a thousand of them in the first half of a message.
   if (r >= 0) r = sd_bus_negotiate_fds(made, 0);
   const auto filter = [](sd_bus_message* message, void* self, sd_bus_error*) {
     return static_cast<ConnectionLoop*>(self)->onMessage(message);
@@ -76,10 +84,7 @@ bool ConnectionLoop::open() {
 
 bool ConnectionLoop::step() {
   runTasks();
-  if (stopWanted() || deadlinePassed()) return false;
-  const auto wakeup = wait();
-  if (!wakeup) return false;
-  return ready_ ? serve(*wakeup) : authenticate(*wakeup);
+  return !stopWanted() && !deadlinePassed() && wait() && serve();
 }
 
 bool ConnectionLoop::stopWanted() {
@@ -101,138 +106,150 @@ bool ConnectionLoop::deadlinePassed() {
 }
 
 bool ConnectionLoop::outputPending() {
-  uint64_t count = 0;
-  return sd_bus_get_n_queued_write(bus_.get(), &count) < 0 || count > 0;
+  const int events = sd_bus_get_events(bus_.get());
+  return events > 0 && (events & POLLOUT) != 0;
 }
 
 bool ConnectionLoop::wantsInput() {
-  return !inputEnded_ && !outputPending() && unanswered_.size() < setup_.limits.unansweredCalls;
+  return peerGone_ || (!outputPending() && unanswered_.size() < setup_.limits.unansweredCalls);
 }
 
-std::optional<ConnectionLoop::Wakeup> ConnectionLoop::wait() {
-  const int events = sd_bus_get_events(bus_.get());
-  if (events < 0) return std::nullopt;
-  int wanted = events;
-  if (ready_) {
-    wanted = outputPending() ? POLLOUT : 0;
-    if (wantsInput()) wanted |= POLLIN | POLLRDHUP;
-  }
+bool ConnectionLoop::inputAtHand() const {
+  return isFed_ || admitted_ > 0 || mayHaveMore_;
+}
+
+// False when the bus is closed.
+bool ConnectionLoop::wait() {
+  if (sd_bus_get_events(bus_.get()) < 0) return false;
+  const bool isReading = wantsInput();
+  const bool isBusy = isReading && inputAtHand();
+  if (!isBusy && inputBegin_ == inputEnd_) buffer_.reset();
+  unsigned wanted = outputPending() ? POLLOUT : 0;
+  if (isReading && !inputEnded_) wanted |= POLLIN;
   std::array<pollfd, 2> descriptors{pollfd{busFd_, static_cast<short>(wanted), 0},
                                     pollfd{setup_.link->wakeDescriptor(), POLLIN, 0}};
   timespec timeout{};
-  const bool inputAtHand = mayHoldInput_ && wantsInput();
-  if (deadline_ && !inputAtHand) {
+  if (deadline_ && !isBusy) {
     const auto left = std::max(*deadline_ - std::chrono::steady_clock::now(), SteadyTime::duration::zero());
     const auto seconds = std::chrono::floor<std::chrono::seconds>(left);
     timeout.tv_sec = seconds.count();
     timeout.tv_nsec = std::chrono::nanoseconds(left - seconds).count();
   }
-  const bool bounded = deadline_ || inputAtHand;
-  const int count = ppoll(descriptors.data(), descriptors.size(), bounded ? &timeout : nullptr, nullptr);
-  if (count < 0) return errno == EINTR ? std::optional(Wakeup{}) : std::nullopt;
+  const bool isBounded = deadline_ || isBusy;
+  if (ppoll(descriptors.data(), descriptors.size(), isBounded ? &timeout : nullptr, nullptr) < 0) {
+    return errno == EINTR;
+  }
   if ((descriptors[1].revents & POLLIN) != 0) setup_.link->drainWake();
   const auto got = static_cast<unsigned>(descriptors[0].revents);
-  return Wakeup{inputAtHand || (got & (POLLIN | POLLOUT)) != 0, (got & (POLLHUP | POLLERR)) != 0,
-                (got & POLLRDHUP) != 0};
-}
-
-bool ConnectionLoop::authenticate(const Wakeup& wakeup) {
-  if (!wakeup.input) return !wakeup.hangup;
-  if (sd_bus_process(bus_.get(), nullptr) < 0) return false;
-  if (sd_bus_is_ready(bus_.get()) <= 0) return true;
-  ready_ = true;
-  mayHoldInput_ = true;
-  deadline_.reset();
+  if ((got & POLLIN) != 0) mayHaveMore_ = true;
+  if ((got & (POLLHUP | POLLERR)) != 0) peerIsGone();
   return true;
 }
 
-bool ConnectionLoop::serve(const Wakeup& wakeup) {
-  if (wakeup.hangup) return serveRest();
-  if (!wakeup.input && !wakeup.inputEnded) return true;
-  if (inputEnded_ || outputPending()) return writeOutput();
-  for (int i = 0; i < kMessagesPerWakeup; ++i) {
-    if (wakeup.inputEnded) {
-      int unread = 0;
-      if (!unreadBytes(unread) || unread == 0) {
-        enterInterruption();
-        return true;
-      }
+bool ConnectionLoop::serve() {
+  if (outputPending() && processOnce() == Pump::over) return false;
+  for (int i = 0; i < kStepsPerWakeup && wantsInput() && !setup_.link->closed(); ++i) {
+    const Pump pumped = pump();
+    if (pumped == Pump::over) return false;
+    if (pumped == Pump::progress) {
+      runTasks();
+      continue;
     }
-    const uint64_t before = messages_;
-    if (!countPartialMessage() || !processOnce()) return false;
-    runTasks();
-    if (messages_ == before || !wantsInput() || setup_.link->closed()) break;
+    if (peerGone_ || (inputEnded_ && !ready_)) return false;
+    return !inputEnded_ || interrupted_ || enterInterruption();
   }
   return true;
 }
 
-// Should the library go on to look for input once it has written, it reads one message at most.
-bool ConnectionLoop::writeOutput() {
-  return sd_bus_process(bus_.get(), nullptr) >= 0;
+// One step of input, the one nearest to the bus first.
+ConnectionLoop::Pump ConnectionLoop::pump() {
+  if (isFed_) return processOnce();
+  if (admitted_ > 0) return feed();
+  return mayHaveMore_ ? receive() : Pump::idle;
 }
 
-// The client is gone. What it sent before is carried out; nothing is answered.
-bool ConnectionLoop::serveRest() {
-  peerGone_ = true;
-  unanswered_.clear();
-  // The error that answers unread by the client left behind would hide what it had sent.
-  int error = 0;
-  socklen_t size = sizeof(error);
-  getsockopt(busFd_, SOL_SOCKET, SO_ERROR, &error, &size);
-  while (countPartialMessage() && processOnce()) {
-    int unread = 0;
-    if (!unreadBytes(unread) || unread == 0) break;
-    runTasks();
-  }
-  return false;
-}
-
-bool ConnectionLoop::processOnce() {
-  const uint64_t before = messages_;
+ConnectionLoop::Pump ConnectionLoop::processOnce() {
   const int r = sd_bus_process(bus_.get(), nullptr);
-  if (messages_ == before) {
-    ++quietReads_;
-  } else {
-    quietReads_ = 0;
-    partialBytes_ = 0;
+  if (r == -ECONNRESET || r == -EPIPE) return Pump::over;
+  if (r < 0) return closing(std::string("it broke the protocol: ") + strerror(-r));
+  const bool isDone = admitted_ == 0 && messages_ == framer_.completed() && ready_;
+  if (r == 0 || isDone) isFed_ = false;
+  // The library drops what it finds malformed without a word; a peer that sends such is not to be trusted
+  // with the rest.
+  if (r == 0 && admitted_ == 0 && messages_ < framer_.completed()) {
+    return closing("it broke the protocol: a malformed message");
   }
-  if (r == 0) mayHoldInput_ = false;
-  if (r < 0 && r != -ECONNRESET && r != -EPIPE) {
-    setup_.log.log(LogLevel::warning,
-                   "IpcConnection: Closing the connection of %s: it broke the protocol: %s",
-                   setup_.peer.c_str(), strerror(-r));
+  if (!ready_ && sd_bus_is_ready(bus_.get()) > 0) {
+    ready_ = true;
+    deadline_.reset();
   }
-  return r >= 0;
+  return Pump::progress;
 }
 
-// The library takes messages of up to 128 MiB and has no setting for it. What it is about to read into an
-// unfinished message is counted here instead.
-bool ConnectionLoop::countPartialMessage() {
-  if (quietReads_ < kFreeReads) return true;
-  int unread = 0;
-  if (!unreadBytes(unread)) return true;
-  partialBytes_ += static_cast<size_t>(unread);
-  if (partialBytes_ <= wire::kMaxMessageBytes) return true;
-  setup_.log.log(LogLevel::warning,
-                 "IpcConnection: Closing the connection of %s: a message exceeds the limit of %u bytes",
-                 setup_.peer.c_str(), wire::kMaxMessageBytes);
-  return false;
+ConnectionLoop::Pump ConnectionLoop::feed() {
+  const auto written = write(feed_.get(), buffer_.get() + inputBegin_, admitted_);
+  // The pipe is empty here, as isFed_ is false; it takes at least something.
+  if (written <= 0) return closing(std::string("its input cannot be passed on: ") + strerror(errno));
+  inputBegin_ += static_cast<size_t>(written);
+  admitted_ -= static_cast<size_t>(written);
+  isFed_ = true;
+  return Pump::progress;
 }
 
-bool ConnectionLoop::unreadBytes(int& bytes) const {
-  return ioctl(busFd_, FIONREAD, &bytes) == 0;
+ConnectionLoop::Pump ConnectionLoop::receive() {
+  if (buffer_ == nullptr) buffer_ = std::make_unique_for_overwrite<char[]>(kBufferBytes);
+  // What is left is part of a fixed header.
+  std::memmove(buffer_.get(), buffer_.get() + inputBegin_, inputEnd_ - inputBegin_);
+  inputEnd_ -= std::exchange(inputBegin_, 0);
+  const size_t room = kBufferBytes - inputEnd_;
+  const auto got = recv(busFd_, buffer_.get() + inputEnd_, room, MSG_DONTWAIT);
+  if (got < 0 && errno == ECONNRESET && !peerGone_) {
+    // It closed with answers unread. What it had sent comes with the next read.
+    peerIsGone();
+    return Pump::progress;
+  }
+  mayHaveMore_ = got == static_cast<ssize_t>(room);
+  if (got == 0) inputEnded_ = true;
+  if (got <= 0) return got == 0 || errno == EAGAIN || errno == EINTR ? Pump::idle : Pump::over;
+  inputEnd_ += static_cast<size_t>(got);
+  const auto admitted = framer_.admit({buffer_.get(), inputEnd_});
+  if (!admitted) return closing(framer_.refusal());
+  admitted_ = *admitted;
+  return Pump::progress;
 }
 
-void ConnectionLoop::enterInterruption() {
-  inputEnded_ = true;
+ConnectionLoop::Pump ConnectionLoop::closing(const std::string& why) {
+  setup_.log.log(LogLevel::warning, "IpcConnection: Closing the connection of %s: %s", setup_.peer.c_str(),
+                 why.c_str());
+  return Pump::over;
+}
+
+// Looked at before anything is sent: a failed send closes the bus, and with it what the client had sent
+// before it died would be lost unread.
+bool ConnectionLoop::isPeerGone() {
+  pollfd descriptor{busFd_, 0, 0};
+  if (!peerGone_ && poll(&descriptor, 1, 0) > 0) peerIsGone();
+  return peerGone_;
+}
+
+// What it sent before is still carried out; nothing is answered.
+void ConnectionLoop::peerIsGone() {
+  peerGone_ = true;
+  mayHaveMore_ = !inputEnded_;
+  unanswered_.clear();
+}
+
+bool ConnectionLoop::enterInterruption() {
+  interrupted_ = true;
   deadline_ = std::chrono::steady_clock::now() + setup_.limits.interruption;
-  if (!setup_.interruptionHandler) return;
+  if (!setup_.interruptionHandler) return true;
   try {
     setup_.interruptionHandler();
   } catch (const std::exception& error) {
     setup_.log.log(LogLevel::error, "IpcConnection: The interruption handler of %s failed: %s",
                    setup_.peer.c_str(), error.what());
   }
+  return true;
 }
 
 void ConnectionLoop::runTasks() {
@@ -253,7 +270,7 @@ int ConnectionLoop::onMessage(sd_bus_message* message) {
     onCall(message);
     return 1;
   }
-  if (peerGone_) return 1;
+  if (isPeerGone()) return 1;
   return answerGenericTool(message) ? 1 : 0;
 }
 
@@ -313,7 +330,7 @@ void ConnectionLoop::abandon(uint64_t serial) {
 }
 
 void ConnectionLoop::refuse(sd_bus_message* call, const char* name, const std::string& text) {
-  if (peerGone_ || sd_bus_message_get_expect_reply(call) <= 0) return;
+  if (sd_bus_message_get_expect_reply(call) <= 0 || isPeerGone()) return;
   const bool sendable = isValidUtf8(text);
   sd_bus_reply_method_errorf(call, name, "%s", sendable ? text.c_str() : "(the reason is not UTF-8)");
 }
@@ -329,7 +346,7 @@ MaybeError ConnectionLoop::newClientCall(const char* member, BusMessage& message
 }
 
 MaybeError ConnectionLoop::send(sd_bus_message* message) {
-  const int r = peerGone_ ? -ECONNRESET : sd_bus_send(bus_.get(), message, nullptr);
+  const int r = isPeerGone() ? -ECONNRESET : sd_bus_send(bus_.get(), message, nullptr);
   if (r >= 0) return std::nullopt;
   return Error(wire::kErrorFailed, -1, std::string("cannot call the client: ") + strerror(-r));
 }

@@ -15,6 +15,7 @@
 #include "platform/ipc/client_session_interface.h"
 #include "platform/ipc/wire.h"
 #include "platform/linux/ipc/connection_link.h"
+#include "platform/linux/ipc/input_framer.h"
 #include "platform/linux/ipc/ipc_limits.h"
 #include "platform/linux/unique_fd.h"
 
@@ -30,8 +31,13 @@ using BusMessage = std::unique_ptr<sd_bus_message, UnrefBusMessage>;
 
 // The inside of a connection's thread: reads the client's calls, runs them, writes the answers.
 //
-// One call is read at a time, and none while an earlier answer still waits for the client to read, so that a
-// client holds no more of us than its socket and one answer. Threads: made, run and destroyed on one.
+// The socket is read here and its bytes are fed to the bus object through a pipe: the library by itself
+// reads messages of up to 128 MiB, in one go for as long as the peer keeps sending. One call is carried out
+// at a time, and none while an earlier answer still waits for the client to read, so that a client holds no
+// more of us than a message and an answer. Descriptors that come along are never taken out of the socket; the
+// kernel closes them.
+//
+// Threads: made, run and destroyed on one.
 class ConnectionLoop {
  public:
   struct Setup {
@@ -55,7 +61,7 @@ class ConnectionLoop {
   template <class EncodeAnswer>
   void answer(uint64_t serial, EncodeAnswer encode) {
     const BusMessage call = takeCall(serial);
-    if (call == nullptr || peerGone_) return;
+    if (call == nullptr || isPeerGone()) return;
     sd_bus_message* made = nullptr;
     if (sd_bus_message_new_method_return(call.get(), &made) < 0) return;
     const BusMessage reply(made);
@@ -82,28 +88,26 @@ class ConnectionLoop {
     // Nothing is flushed: a client that does not read must not hold the thread.
     void operator()(sd_bus* bus) const noexcept { sd_bus_close_unref(bus); }
   };
-  struct Wakeup {
-    bool input = false;
-    bool hangup = false;
-    bool inputEnded = false;
-  };
+  enum class Pump { progress, idle, over };
 
   bool open();
   bool step();
-  bool authenticate(const Wakeup& wakeup);
-  bool serve(const Wakeup& wakeup);
-  bool serveRest();
-  bool processOnce();
-  bool countPartialMessage();
-  bool writeOutput();
-  void runTasks();
-  bool stopWanted();
-  std::optional<Wakeup> wait();
+  bool wait();
+  bool serve();
+  Pump pump();
+  Pump processOnce();
+  Pump feed();
+  Pump receive();
+  bool inputAtHand() const;
   bool wantsInput();
   bool outputPending();
+  void runTasks();
+  bool stopWanted();
   bool deadlinePassed();
-  void enterInterruption();
-  bool unreadBytes(int& bytes) const;
+  bool enterInterruption();
+  bool isPeerGone();
+  void peerIsGone();
+  Pump closing(const std::string& why);
 
   int onMessage(sd_bus_message* message);
   void onCall(sd_bus_message* message);
@@ -117,8 +121,20 @@ class ConnectionLoop {
   Setup setup_;
   UniqueFd socket_;  // until the bus owns it
   int busFd_ = -1;
+  UniqueFd feed_;  // what the bus reads is written here
   std::unique_ptr<sd_bus, CloseBus> bus_;
   std::unordered_map<uint64_t, BusMessage> unanswered_;
+
+  // Input between the socket and the bus: bytes [inputBegin_, inputEnd_) of the buffer, of which the first
+  // admitted_ may be fed. There is no buffer while the connection is idle.
+  InputFramer framer_{wire::kMaxMessageBytes};
+  std::unique_ptr<char[]> buffer_;
+  size_t inputBegin_ = 0;
+  size_t inputEnd_ = 0;
+  size_t admitted_ = 0;
+  bool mayHaveMore_ = false;  // the socket, since the last read filled the buffer
+  bool isFed_ = false;        // the bus may have something to read
+  uint64_t messages_ = 0;     // that the bus has read
 
   // The call whose method runs now.
   sd_bus_message* current_ = nullptr;
@@ -126,18 +142,11 @@ class ConnectionLoop {
   bool currentAbandoned_ = false;
   uint64_t lastSerial_ = 0;
 
-  bool ready_ = false;  // authenticated
-  // Until the library was first seen with nothing to do: calls may have come in one piece with the
-  // authentication, and lie in its buffer where no descriptor tells of them.
-  bool mayHoldInput_ = false;
-  bool inputEnded_ = false;  // the peer sends no more, and everything it sent was read
-  bool peerGone_ = false;    // nobody reads answers
+  bool ready_ = false;        // authenticated
+  bool inputEnded_ = false;   // the peer sends no more
+  bool interrupted_ = false;  // and everything it sent was carried out
+  bool peerGone_ = false;     // nobody reads answers
   std::optional<SteadyTime> deadline_;
-
-  // Bounding the size of a message.
-  uint64_t messages_ = 0;
-  unsigned quietReads_ = 0;
-  size_t partialBytes_ = 0;
 };
 
 template <class Encode>

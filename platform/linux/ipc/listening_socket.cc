@@ -60,6 +60,7 @@ ListeningSocket::~ListeningSocket() {
   struct stat bound {};
   if (madePath_.empty() || !socket_ || lstat(madePath_.c_str(), &bound) != 0) return;
   sockaddr_un address{};
+  address.sun_family = AF_UNIX;
   madePath_.copy(address.sun_path, sizeof(address.sun_path) - 1);
   socket_.reset();
   if (!listens(address)) unlink(madePath_.c_str());

@@ -1,0 +1,446 @@
+#include <dirent.h>
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
+
+#include <fstream>
+
+#include "platform/ipc/dbus_codec.h"
+#include "platform/linux/ipc/ipc_test_support.h"
+
+// Clients that misbehave: each harms nobody but itself.
+
+namespace tarnel {
+namespace {
+
+using ::testing::HasSubstr;
+
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kMemoryIsMeasurable = false;  // the sanitizers keep freed memory
+#else
+constexpr bool kMemoryIsMeasurable = true;
+#endif
+
+size_t residentBytes() {
+  std::ifstream statm("/proc/self/statm");
+  size_t total = 0;
+  size_t resident = 0;
+  statm >> total >> resident;
+  return resident * static_cast<size_t>(sysconf(_SC_PAGESIZE));
+}
+
+size_t openDescriptors() {
+  DIR* folder = opendir("/proc/self/fd");
+  size_t count = 0;
+  while (readdir(folder) != nullptr) ++count;
+  closedir(folder);
+  return count;
+}
+
+class IpcHostileTest : public ::testing::Test {
+ protected:
+  void expectOthersAreServed() {
+    BusClient client(service.path());
+    EXPECT_NE(client.call("StartConfig", ""), nullptr) << client.errorText;
+  }
+
+  Service service;
+};
+
+TEST_F(IpcHostileTest, GarbageIsClosed) {
+  service.start();
+  for (const std::string& bytes :
+       {std::string(200'000, 'x'), std::string("\0GET / HTTP/1.1\r\n\r\n", 19) + std::string(200'000, '\n'),
+        std::string(300'000, '\0')}) {
+    const RawClient client(service.path());
+    client.write(bytes);
+    shutdown(client.fd().get(), SHUT_WR);
+    EXPECT_TRUE(isClosedByPeer(client.fd()));
+  }
+  const RawClient client(service.path());
+  client.authenticate();
+  client.write(std::string(1000, 'x'));
+  EXPECT_TRUE(isClosedByPeer(client.fd()));
+  expectOthersAreServed();
+}
+
+TEST_F(IpcHostileTest, HalfAHandshakeEndsWithTheClient) {
+  service.start();
+  {
+    const RawClient client(service.path());
+    client.write(std::string("\0AUTH", 5));
+  }
+  EXPECT_TRUE(eventually([&] { return service.invalidations() == 1; }));
+  expectOthersAreServed();
+}
+
+TEST(IpcHandshakeTest, AHandshakeThatNeverEndsIsDropped) {
+  IpcLimits limits;
+  limits.authentication = std::chrono::milliseconds(50);
+  Service service(limits);
+  service.start();
+  const RawClient silent(service.path());
+  EXPECT_TRUE(isClosedByPeer(silent.fd()));
+  const RawClient half(service.path());
+  half.write(std::string("\0AUTH ANON", 10));
+  EXPECT_TRUE(isClosedByPeer(half.fd()));
+  EXPECT_TRUE(service.logged("not authenticated within 50 ms"));
+  // One that is through is not held to it.
+  BusClient client(service.path());
+  EXPECT_NE(client.call("StartConfig", ""), nullptr);
+  EXPECT_TRUE(eventually([&] { return service.invalidations() == 2; }));
+  EXPECT_NE(client.call("StartConfig", ""), nullptr);
+}
+
+TEST_F(IpcHostileTest, CallsInOnePieceWithTheHandshakeAreServed) {
+  service.start();
+  const RawClient client(service.path());
+  EXPECT_TRUE(client.write(std::string("\0AUTH ANONYMOUS 74\r\nBEGIN\r\n", 27) + rawCall("StartConfig") +
+                           rawCall("FlushMessages") + rawCall("FinishSession")));
+  EXPECT_TRUE(eventually([&] { return service.accepted() == 1 && service.session()->count() == 3; }));
+}
+
+TEST_F(IpcHostileTest, AMessageThatIsTooLargeEndsTheConnection) {
+  service.start();
+  const size_t before = residentBytes();
+  for (const uint32_t claim : {uint32_t{100} << 20U, uint32_t{2} << 20U}) {
+    const RawClient client(service.path());
+    client.authenticate();
+    EXPECT_TRUE(client.write(rawCall("UploadLogData", {}, "av", claim)));
+    const std::string piece(64 << 10U, '\0');
+    size_t written = 0;
+    while (written < claim && client.write(piece)) written += piece.size();
+    EXPECT_LT(written, size_t{2} << 20U);
+    EXPECT_TRUE(isClosedByPeer(client.fd()));
+  }
+  EXPECT_TRUE(service.logged("bytes exceeds the limit of 1048576 bytes"));
+  EXPECT_TRUE(!kMemoryIsMeasurable || residentBytes() < before + (size_t{16} << 20U));
+  expectOthersAreServed();
+}
+
+TEST_F(IpcHostileTest, AMessageUpToTheLimitIsTaken) {
+  service.start();
+  BusClient client(service.path());
+  const std::string text(wire::kMaxMessageBytes - 1000, 'x');
+  EXPECT_NE(client.call("UploadLogData", "av", 1, "s", text.c_str()), nullptr) << client.errorText;
+}
+
+TEST_F(IpcHostileTest, AClaimWithoutBytesHoldsNothing) {
+  service.start();
+  std::vector<RawClient> clients;
+  const size_t before = residentBytes();
+  for (int i = 0; i < 20; ++i) {
+    clients.emplace_back(service.path());
+    clients.back().authenticate();
+    EXPECT_TRUE(clients.back().write(rawCall("UploadLogData", "xxxxxxxx", "av", uint32_t{100} << 20U)));
+  }
+  expectOthersAreServed();
+  EXPECT_TRUE(!kMemoryIsMeasurable || residentBytes() < before + (size_t{16} << 20U));
+}
+
+TEST_F(IpcHostileTest, AFloodWithoutReadingIsHeldBack) {
+  service.start();
+  const RawClient client(service.path());
+  client.authenticate();
+  expectOthersAreServed();
+  const size_t before = residentBytes();
+  std::string calls;
+  for (int i = 0; i < 1000; ++i) calls += rawCall("StartConfig");
+  // Written until the daemon has stopped reading and the socket is full.
+  fcntl(client.fd().get(), F_SETFL, O_NONBLOCK);
+  size_t at = 0;
+  for (int i = 0; i < 400; ++i) {
+    pollfd writable{client.fd().get(), POLLOUT, 0};
+    if (poll(&writable, 1, 200) <= 0) break;
+    const auto sent = send(client.fd().get(), calls.data() + at, calls.size() - at, MSG_NOSIGNAL);
+    if (sent > 0) at = (at + static_cast<size_t>(sent)) % calls.size();
+  }
+  const size_t held = service.session()->count();
+  EXPECT_GT(held, 0U);
+  EXPECT_TRUE(!kMemoryIsMeasurable || residentBytes() < before + (size_t{8} << 20U));
+  expectOthersAreServed();
+  EXPECT_EQ(service.session()->count(), held);
+}
+
+TEST(IpcUnansweredTest, UnansweredCallsAreBounded) {
+  IpcLimits limits;
+  limits.unansweredCalls = 10;
+  Service service(limits);
+  std::mutex mutex;
+  std::vector<SentReply> held;
+  service.prepare = [&](RecordingSession& session) {
+    session.answerSend = [&](SentReply reply) {
+      const std::lock_guard lock(mutex);
+      held.push_back(std::move(reply));
+    };
+  };
+  service.start();
+  BusClient client(service.path());
+  for (int i = 0; i < 30; ++i) {
+    auto call = client.newCall("SendMessage");
+    sd_bus_message_append(call.get(), "qqaa{sv}", 1, 2, 0);
+    ASSERT_GE(sd_bus_call_async(
+                  client.bus(), nullptr, call.get(), [](sd_bus_message*, void*, sd_bus_error*) { return 1; },
+                  nullptr, 0),
+              0);
+  }
+  ASSERT_GE(sd_bus_flush(client.bus()), 0);
+  const auto session = [&] { return service.session(); };
+  EXPECT_TRUE(eventually([&] { return service.accepted() == 1 && session()->count() == 10; }));
+  for (size_t answered = 0; answered < 30;) {
+    std::vector<SentReply> now;
+    EXPECT_TRUE(eventually([&] {
+      const std::lock_guard lock(mutex);
+      now = std::exchange(held, {});
+      return !now.empty();
+    }));
+    answered += now.size();
+    EXPECT_LE(now.size(), 10U);
+    for (auto& reply : now) reply(std::nullopt);
+  }
+  EXPECT_EQ(session()->count(), 30U);
+}
+
+TEST(IpcQueueTest, AClientThatNeverReadsItsCallsIsDropped) {
+  IpcLimits limits;
+  limits.queuedBytes = 100'000;
+  Service service(limits);
+  service.start();
+  const RawClient client(service.path());
+  client.authenticate();
+  EXPECT_TRUE(client.write(rawCall("StartConfig")));
+  EXPECT_TRUE(eventually([&] { return service.accepted() == 1 && service.session()->count() == 1; }));
+  std::atomic<size_t> errors = 0;
+  const auto proxy =
+      service.connection(0)->remoteObjectProxyWithErrorHandler([&errors](const Error&) { ++errors; });
+  const Dictionary payload{{"k", Value(std::string(1000, 'x'))}};
+  size_t sent = 0;
+  while (errors == 0 && sent < 100'000) {
+    proxy->sendMessageToClient(payload, 0, 1, 2, payload);
+    ++sent;
+  }
+  EXPECT_GT(errors, 0U);
+  EXPECT_TRUE(eventually([&] { return service.invalidations() == 1; }));
+  EXPECT_TRUE(service.logged("the limit of 100000 queued bytes is reached"));
+}
+
+TEST(IpcLimitTest, ConnectionsOfAUserAreLimited) {
+  IpcLimits limits;
+  limits.connectionsPerUser = 3;
+  limits.connections = 5;
+  // The user's number is what the client's socket happens to be: each test client says who it is.
+  std::atomic<uint32_t> nextUser{getuid()};
+  Service service(limits, [&nextUser](int) {
+    PeerCredentials peer;
+    peer.uid = nextUser;
+    return peer;
+  });
+  service.start();
+  std::vector<std::unique_ptr<BusClient>> clients;
+  const auto connect = [&] {
+    clients.push_back(std::make_unique<BusClient>(service.path()));
+    return clients.back()->call("StartConfig", "") != nullptr;
+  };
+  for (int i = 0; i < 3; ++i) EXPECT_TRUE(connect());
+  EXPECT_FALSE(connect());
+  EXPECT_TRUE(
+      service.logged("the limit of 3 connections per user is reached by user " + std::to_string(getuid())));
+  clients.clear();
+  EXPECT_TRUE(eventually([&] { return service.listener().connections() == 0; }));
+  EXPECT_TRUE(connect());
+}
+
+TEST(IpcLimitTest, AThousandConnectionsAtOnceAreCutToTheLimit) {
+  IpcLimits limits;
+  limits.connectionsPerUser = 1000;
+  limits.connections = 100;
+  Service service(limits);
+  service.start();
+  const size_t descriptors = openDescriptors();
+  rlimit files{};
+  getrlimit(RLIMIT_NOFILE, &files);
+  files.rlim_cur = files.rlim_max;
+  setrlimit(RLIMIT_NOFILE, &files);
+  std::vector<UniqueFd> clients;
+  for (int i = 0; i < 1000; ++i) clients.push_back(connectTo(service.path()));
+  EXPECT_TRUE(eventually([&] { return service.accepted() == 100; }));
+  // The last in the queue was looked at, so all were.
+  EXPECT_TRUE(isClosedByPeer(clients.back()));
+  EXPECT_EQ(service.accepted(), 100U);
+  const auto lines = service.log().startingWith("IpcListener: Connections closed:");
+  ASSERT_FALSE(lines.empty());
+  EXPECT_LT(lines.size(), 10U);
+  EXPECT_THAT(lines[0].text, HasSubstr("the limit of 100 connections is reached"));
+  clients.clear();
+  EXPECT_TRUE(eventually([&] { return service.invalidations() == 100; }));
+  EXPECT_TRUE(eventually([&] { return service.listener().threads() == 0; }));
+  EXPECT_EQ(service.listener().connections(), 0U);
+  EXPECT_TRUE(eventually([&] { return openDescriptors() <= descriptors; }));
+}
+
+TEST_F(IpcHostileTest, AThousandConnectionsLeaveNoThreadBehind) {
+  service.start();
+  for (int i = 0; i < 1000; ++i) {
+    const RawClient client(service.path());
+    if (i % 2 == 0) client.authenticate();
+    EXPECT_TRUE(eventually([&] { return service.listener().connections() < 32; }));
+  }
+  EXPECT_TRUE(eventually([&] { return service.listener().threads() == 0; }));
+  EXPECT_EQ(service.invalidations(), service.accepted());
+}
+
+TEST(IpcDeathTest, DeathAtAnyInstantIsSurvived) {
+  IpcLimits limits;
+  limits.connectionsPerUser = limits.connections;
+  Service service(limits);
+  service.start();
+  const std::string bytes = std::string("\0AUTH ANONYMOUS 74\r\nBEGIN\r\n", 27) + rawCall("StartConfig") +
+                            rawCall("UploadLogData", std::string("\0\0\0\0", 4), "av") +
+                            rawCall("FlushMessages");
+  for (size_t length = 0; length <= bytes.size(); ++length) {
+    RawClient client(service.path());
+    client.write(std::string_view(bytes).substr(0, length));
+    client.close();
+  }
+  EXPECT_TRUE(eventually([&] { return service.invalidations() == bytes.size() + 1; }));
+  BusClient client(service.path());
+  EXPECT_NE(client.call("StartConfig", ""), nullptr);
+}
+
+TEST_F(IpcHostileTest, AKilledClientIsNoticed) {
+  service.start();
+  std::array<int, 2> told{};
+  ASSERT_EQ(pipe(told.data()), 0);
+  const std::string path = service.path();
+  const pid_t child = fork();
+  if (child == 0) {
+    const RawClient client(path);
+    client.authenticate();
+    client.write(rawCall("StartConfig"));
+    static_cast<void>(write(told[1], "x", 1));
+    for (;;) pause();
+  }
+  char ready = 0;
+  ASSERT_EQ(read(told[0], &ready, 1), 1);
+  kill(child, SIGKILL);
+  waitpid(child, nullptr, 0);
+  EXPECT_TRUE(eventually([&] { return service.invalidations() == 1; }));
+  close(told[0]);
+  close(told[1]);
+}
+
+TEST_F(IpcHostileTest, DescriptorsThatNobodyAskedForAreClosed) {
+  service.start();
+  const RawClient client(service.path());
+  client.authenticate();
+  EXPECT_TRUE(client.write(rawCall("StartConfig")));
+  EXPECT_TRUE(eventually([&] { return service.accepted() == 1 && service.session()->count() == 1; }));
+  const size_t before = openDescriptors();
+  const std::string call = rawCall("FlushMessages");
+  iovec bytes{const_cast<char*>(call.data()), call.size()};
+  constexpr size_t kCount = 100;
+  std::vector<char> control(CMSG_SPACE(kCount * sizeof(int)));
+  msghdr message{};
+  message.msg_iov = &bytes;
+  message.msg_iovlen = 1;
+  message.msg_control = control.data();
+  message.msg_controllen = control.size();
+  auto* header = CMSG_FIRSTHDR(&message);
+  header->cmsg_level = SOL_SOCKET;
+  header->cmsg_type = SCM_RIGHTS;
+  header->cmsg_len = CMSG_LEN(kCount * sizeof(int));
+  const std::vector<int> descriptors(kCount, client.fd().get());
+  std::memcpy(CMSG_DATA(header), descriptors.data(), kCount * sizeof(int));
+  EXPECT_GT(sendmsg(client.fd().get(), &message, 0), 0);
+  EXPECT_TRUE(eventually([&] { return service.session()->count() == 2; }));
+  EXPECT_EQ(openDescriptors(), before);
+}
+
+TEST_F(IpcHostileTest, AMalformedMessageEndsTheConnection) {
+  service.start();
+  const RawClient client(service.path());
+  client.authenticate();
+  std::string call = rawCall("StartConfig");
+  call[2] = '\x7F';  // flags that do not exist are ignored
+  EXPECT_TRUE(client.write(call));
+  call[3] = '\0';  // a protocol version that does not exist
+  EXPECT_TRUE(client.write(call + rawCall("StartConfig")));
+  EXPECT_TRUE(isClosedByPeer(client.fd()));
+  EXPECT_TRUE(eventually([&] { return service.invalidations() == 1; }));
+  EXPECT_TRUE(service.logged("it broke the protocol: a malformed message"));
+}
+
+TEST_F(IpcHostileTest, TextThatIsNotUtf8IsRefusedByName) {
+  service.start();
+  const RawClient client(service.path());
+  client.authenticate();
+  // aa{sv} with one dictionary {"k": <s 0xFF>}.
+  std::string body("\1\0\2\0", 4);                           // category, type
+  body += std::string("\24\0\0\0", 4);                       // bytes of the outer array
+  body += std::string("\14\0\0\0\0\0\0\0", 8).substr(0, 4);  // bytes of the dictionary
+  body += std::string("\0\0\0\0", 4);                        // to 8
+  body += std::string("\1\0\0\0k\0\1s\0\0\0\0\1\0\0\0\xFF\0", 18);
+  body[4] = 26;
+  body[8] = 18;
+  EXPECT_TRUE(client.write(rawCall("SendMessage", body, "qqaa{sv}")));
+  std::string answer;
+  std::array<char, 4096> piece{};
+  while (answer.find("UTF-8") == std::string::npos) {
+    const auto got = recv(client.fd().get(), piece.data(), piece.size(), 0);
+    ASSERT_GT(got, 0) << answer;
+    answer.append(piece.data(), static_cast<size_t>(got));
+  }
+  EXPECT_THAT(answer, HasSubstr(wire::kErrorInvalidArguments));
+  EXPECT_THAT(answer, HasSubstr("at key \"k\": the text is not UTF-8"));
+  EXPECT_EQ(service.session()->count(), 0U);
+}
+
+TEST_F(IpcHostileTest, TooDeepIsRefusedByName) {
+  service.start();
+  BusClient client(service.path());
+  auto call = client.newCall("SendMessageDictionary");
+  sd_bus_message* m = call.get();
+  constexpr unsigned kLevels = wire::kMaxDepth + 1;
+  for (unsigned i = 0; i < kLevels; ++i) {
+    if (i > 0) sd_bus_message_open_container(m, 'v', "a{sv}");
+    sd_bus_message_open_container(m, 'a', "{sv}");
+    sd_bus_message_open_container(m, 'e', "sv");
+    sd_bus_message_append(m, "s", "k");
+  }
+  sd_bus_message_append(m, "v", "i", 1);
+  for (unsigned i = 0; i < 3 * kLevels - 1; ++i) ASSERT_GE(sd_bus_message_close_container(m), 0);
+  EXPECT_EQ(client.call(call), nullptr);
+  EXPECT_EQ(client.errorName, wire::kErrorTooDeep);
+  EXPECT_EQ(service.session()->count(), 0U);
+  EXPECT_NE(client.call("StartConfig", ""), nullptr);
+}
+
+TEST_F(IpcHostileTest, WithoutDescriptorsClientsAreClosedAndLaterOnesServed) {
+  service.start();
+  expectOthersAreServed();
+  EXPECT_TRUE(eventually([&] { return service.listener().threads() == 0; }));
+  rlimit before{};
+  getrlimit(RLIMIT_NOFILE, &before);
+  // The client's own socket comes first; then the process may not open one more.
+  const UniqueFd client(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  std::vector<UniqueFd> hoard;
+  rlimit tight = before;
+  tight.rlim_cur = openDescriptors() + 8;
+  setrlimit(RLIMIT_NOFILE, &tight);
+  for (UniqueFd fd(dup(0)); fd; fd = UniqueFd(dup(0))) hoard.push_back(std::move(fd));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  service.path().copy(address.sun_path, sizeof(address.sun_path) - 1);
+  ASSERT_EQ(connect(client.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
+  EXPECT_TRUE(isClosedByPeer(client));
+  EXPECT_TRUE(eventually([&] { return service.logged("the limit of open files is reached"); }));
+  hoard.clear();
+  setrlimit(RLIMIT_NOFILE, &before);
+  expectOthersAreServed();
+}
+
+}  // namespace
+}  // namespace tarnel
