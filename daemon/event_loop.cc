@@ -88,7 +88,7 @@ void EventLoop::takeRequest() {
     return 0;
   };
   sd_event_source* timer = nullptr;
-  constexpr uint64_t kAccuracy = 1000000;  // a second: idle processes are woken together
+  constexpr uint64_t kAccuracy = 100000;  // a tenth of a second: idle processes are woken together
   if (sd_event_add_time(event_.get(), &timer, CLOCK_MONOTONIC, request->at, kAccuracy, onTime, this) >= 0) {
     timer_.reset(timer);
   }
