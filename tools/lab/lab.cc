@@ -118,15 +118,15 @@ MaybeError RunningLab::begin() {
                                                       .notices = console_,
                                                       .clock = clock_},
                                        options_.storebagMaxAge);
-  control_ = std::make_unique<Control>(
-      Control::Parts{.store = store_,
-                     .misbehaviours = misbehaviours_,
-                     .status = [this] { return status(); },
-                     .stop =
-                         [this] {
-                           const uint64_t one = 1;
-                           return void(::write(stopRequested_.get(), &one, sizeof one));
-                         }});
+  control_ = std::make_unique<Control>(Control::Parts{.store = store_,
+                                                      .misbehaviours = misbehaviours_,
+                                                      .status = [this] { return status(); },
+                                                      .stop =
+                                                          [this] {
+                                                            const uint64_t one = 1;
+                                                            [[maybe_unused]] const ssize_t put = ::write(
+                                                                stopRequested_.get(), &one, sizeof one);
+                                                          }});
   lateService_.set(*service_);
   lateControl_.set(*control_);
   tellStart();
