@@ -7,6 +7,7 @@
 #include <csignal>
 #include <map>
 #include <mutex>
+#include <set>
 #include <stdexcept>
 #include <system_error>
 #include <thread>
@@ -16,6 +17,7 @@
 #include "platform/linux/curl_transfer.h"
 #include "platform/linux/http_request_check.h"
 #include "platform/linux/name_service.h"
+#include "platform/linux/transfer_queue.h"
 
 namespace tarnel {
 namespace {
@@ -42,10 +44,11 @@ CURLM* newMulti() {
 class CurlHttpClient::Worker {
  public:
   Worker(Log& log, HttpClientOptions options)
-      : log_(log), options_(std::move(options)), multi_(newMulti()), context_{options_} {
-    curl_multi_setopt(multi_.get(), CURLMOPT_MAX_HOST_CONNECTIONS,
-                      static_cast<long>(options_.connectionsPerHost));
-    curl_multi_setopt(multi_.get(), CURLMOPT_MAX_TOTAL_CONNECTIONS, static_cast<long>(options_.connections));
+      : log_(log),
+        options_(std::move(options)),
+        multi_(newMulti()),
+        context_{options_},
+        queue_(options_.connectionsPerHost, options_.connections) {
     curl_multi_setopt(multi_.get(), CURLMOPT_MAXCONNECTS, static_cast<long>(options_.connections));
   }
   Worker(const Worker&) = delete;
@@ -71,10 +74,10 @@ class CurlHttpClient::Worker {
     MaybeError refusal;
     SteadyTime deadline;
   };
-  // Requests under way, the first to time out first.
-  using Key = std::pair<SteadyTime, uint64_t>;
+  // A request that has not ended, on the wire or waiting for its turn.
   struct Active {
     std::unique_ptr<CurlTransfer> transfer;
+    SteadyTime deadline;
     std::chrono::milliseconds allowed;
   };
 
@@ -82,11 +85,15 @@ class CurlHttpClient::Worker {
   bool ensureThread();
   void run();
   bool takeIncoming();
-  void begin(Incoming incoming);
+  void accept(Incoming incoming);
+  void startWaiting();
+  MaybeError start(CurlTransfer& transfer);
   void endHops();
+  void endHop(CurlTransfer& transfer, CURLcode code);
   void expire();
   int pollTime() const;
-  void end(Key key, HttpResult result);
+  void end(uint64_t id, HttpResult result);
+  void fail(uint64_t id, Error error) { end(id, HttpResult{std::nullopt, std::nullopt, std::move(error)}); }
   void complete(Completion completion, HttpResult result);
   void stop();
   void failAll();
@@ -121,9 +128,10 @@ class CurlHttpClient::Worker {
 
   // The client's thread only.
   detail::TransferContext context_;
-  std::map<Key, Active> active_;
-  std::map<const CurlTransfer*, Key> keys_;
-  uint64_t counter_ = 0;
+  detail::TransferQueue queue_;
+  std::map<uint64_t, Active> active_;
+  std::set<std::pair<SteadyTime, uint64_t>> deadlines_;
+  uint64_t lastId_ = 0;
   std::vector<CurlEasy> spare_;
 };
 
@@ -190,10 +198,12 @@ void CurlHttpClient::Worker::enqueue(HttpRequest request, Completion completion)
 void CurlHttpClient::Worker::run() {
   loadCertificates();
   while (takeIncoming()) {
+    startWaiting();
     int running = 0;
     curl_multi_perform(multi_.get(), &running);
     endHops();
     expire();
+    startWaiting();
     curl_multi_poll(multi_.get(), nullptr, 0, pollTime(), nullptr);
   }
   failAll();
@@ -207,29 +217,37 @@ bool CurlHttpClient::Worker::takeIncoming() {
     if (stopping_) return false;
     taken.swap(incoming_);
   }
-  for (auto& incoming : taken) begin(std::move(incoming));
+  for (auto& incoming : taken) accept(std::move(incoming));
   return true;
 }
 
-void CurlHttpClient::Worker::begin(Incoming incoming) {
+void CurlHttpClient::Worker::accept(Incoming incoming) {
   if (incoming.refusal) {
     complete(std::move(incoming.completion),
              HttpResult{std::nullopt, std::nullopt, std::move(incoming.refusal)});
     return;
   }
   const auto allowed = incoming.request.timeout.value_or(options_.longestRequest);
-  auto transfer =
-      std::make_unique<CurlTransfer>(std::move(incoming.request), std::move(incoming.completion), context_);
-  CurlTransfer& started = *transfer;
-  const Key key(incoming.deadline, ++counter_);
-  active_.emplace(key, Active{std::move(transfer), allowed});
-  keys_.emplace(&started, key);
-  MaybeError failure = started.begin(spareHandle());
-  if (!failure) {
-    const CURLMcode code = curl_multi_add_handle(multi_.get(), started.handle());
-    if (code != CURLM_OK) failure = Error(kHttpErrorDomain, CURLE_FAILED_INIT, curl_multi_strerror(code));
+  const uint64_t id = ++lastId_;
+  auto transfer = std::make_unique<CurlTransfer>(id, std::move(incoming.request),
+                                                 std::move(incoming.completion), context_);
+  queue_.add(id, transfer->host());
+  deadlines_.emplace(incoming.deadline, id);
+  active_.emplace(id, Active{std::move(transfer), incoming.deadline, allowed});
+}
+
+void CurlHttpClient::Worker::startWaiting() {
+  while (const auto id = queue_.next()) {
+    if (auto failure = start(*active_.at(*id).transfer)) fail(*id, std::move(*failure));
   }
-  if (failure) end(key, HttpResult{std::nullopt, std::nullopt, std::move(failure)});
+}
+
+MaybeError CurlHttpClient::Worker::start(CurlTransfer& transfer) {
+  if (auto failure = transfer.begin(transfer.handle() == nullptr ? spareHandle() : transfer.takeHandle()))
+    return failure;
+  const CURLMcode code = curl_multi_add_handle(multi_.get(), transfer.handle());
+  if (code == CURLM_OK) return std::nullopt;
+  return Error(kHttpErrorDomain, CURLE_FAILED_INIT, curl_multi_strerror(code));
 }
 
 void CurlHttpClient::Worker::endHops() {
@@ -241,51 +259,46 @@ void CurlHttpClient::Worker::endHops() {
     CurlTransfer* transfer = nullptr;
     curl_easy_getinfo(easy, CURLINFO_PRIVATE, &transfer);
     curl_multi_remove_handle(multi_.get(), easy);
-    const Key key = keys_.at(transfer);
-    if (code != CURLE_OK) {
-      end(key, transfer->result(code));
-      continue;
-    }
-    if (auto incomplete = transfer->incompleteAnswer()) {
-      end(key, HttpResult{std::nullopt, std::nullopt, std::move(incomplete)});
-      continue;
-    }
-    const auto next = transfer->followRedirect();
-    if (!next) {
-      end(key, HttpResult{std::nullopt, std::nullopt, next.error()});
-    } else if (*next == CurlTransfer::Next::finished) {
-      end(key, transfer->result(code));
-    } else if (curl_multi_add_handle(multi_.get(), easy) != CURLM_OK) {
-      end(key, transfer->result(CURLE_FAILED_INIT));
-    }
+    endHop(*transfer, code);
   }
 }
 
-// Time-outs count from the start of a request, so that waiting for a connection is part of them.
+void CurlHttpClient::Worker::endHop(CurlTransfer& transfer, CURLcode code) {
+  const uint64_t id = transfer.id();
+  if (code != CURLE_OK) return end(id, transfer.result(code));
+  if (auto incomplete = transfer.incompleteAnswer()) return fail(id, std::move(*incomplete));
+  const auto next = transfer.followRedirect();
+  if (!next) return fail(id, next.error());
+  if (*next == CurlTransfer::Next::finished) return end(id, transfer.result(code));
+  queue_.remove(id);
+  queue_.add(id, transfer.host());
+}
+
+// Time-outs count from the start of a request, so that waiting for its turn is part of them.
 void CurlHttpClient::Worker::expire() {
   const auto now = std::chrono::steady_clock::now();
-  while (!active_.empty() && active_.begin()->first.first <= now) {
-    const auto& [key, active] = *active_.begin();
-    end(key, HttpResult{std::nullopt, std::nullopt,
-                        Error(kHttpErrorDomain, CURLE_OPERATION_TIMEDOUT,
-                              "the request timed out after " + std::to_string(active.allowed.count()) +
-                                  " milliseconds")});
+  while (!deadlines_.empty() && deadlines_.begin()->first <= now) {
+    const uint64_t id = deadlines_.begin()->second;
+    const auto allowed = active_.at(id).allowed;
+    fail(id, Error(kHttpErrorDomain, CURLE_OPERATION_TIMEDOUT,
+                   "the request timed out after " + std::to_string(allowed.count()) + " milliseconds"));
   }
 }
 
 int CurlHttpClient::Worker::pollTime() const {
   constexpr auto kLongest = std::chrono::milliseconds(std::chrono::hours(1));
-  if (active_.empty()) return static_cast<int>(kLongest.count());
-  const auto left = std::chrono::ceil<std::chrono::milliseconds>(active_.begin()->first.first -
+  if (deadlines_.empty()) return static_cast<int>(kLongest.count());
+  const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadlines_.begin()->first -
                                                                  std::chrono::steady_clock::now());
   return static_cast<int>(std::clamp(left, std::chrono::milliseconds(0), kLongest).count());
 }
 
-void CurlHttpClient::Worker::end(Key key, HttpResult result) {
-  const auto found = active_.find(key);
+void CurlHttpClient::Worker::end(uint64_t id, HttpResult result) {
+  const auto found = active_.find(id);
   const std::unique_ptr<CurlTransfer> transfer = std::move(found->second.transfer);
+  deadlines_.erase({found->second.deadline, id});
   active_.erase(found);
-  keys_.erase(transfer.get());
+  queue_.remove(id);
   if (CurlEasy easy = transfer->takeHandle()) {
     curl_multi_remove_handle(multi_.get(), easy.get());  // does nothing for one that is not there
     curl_easy_reset(easy.get());
@@ -320,7 +333,7 @@ void CurlHttpClient::Worker::stop() {
 // Completions may start requests while this goes on; those are refused and completed here too.
 void CurlHttpClient::Worker::failAll() {
   const Error goingAway(kHttpErrorDomain, kHttpClientGoingAway, "the HTTP client is going away");
-  while (!active_.empty()) end(active_.begin()->first, HttpResult{std::nullopt, std::nullopt, goingAway});
+  while (!active_.empty()) fail(active_.begin()->first, goingAway);
   while (true) {
     std::vector<Incoming> taken;
     {

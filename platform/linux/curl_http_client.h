@@ -29,20 +29,20 @@ struct HttpClientOptions {
   size_t maxHeldAnswerBytes = 64U << 20U;  // of all bodies that are arriving
   size_t maxQueuedBytes = 64U << 20U;      // of all request bodies that have not ended
   size_t maxQueuedRequests = 4096;         // that have not ended
-  size_t connectionsPerHost = 6;
-  size_t connections = 32;
+  size_t connectionsPerHost = 6;           // requests on the wire, and so connections, to one host
+  size_t connections = 32;                 // and to all hosts
   size_t maxRedirects = 10;
 };
 
 // The process's HTTP client: one thread, which starts with the first request, carries all transfers.
 //
-// Requests wait for a free connection in the order of their start; waiting counts toward their time-out.
-// Past maxQueuedBytes or maxQueuedRequests a request ends at once with kHttpTooMuchQueued. A redirect (301,
-// 302, 303, 307, 308) is followed by this class: 303, and 301 and 302 after a POST, go on as GET without the
-// body and its "Content-" headers; "Authorization" and "Cookie" stay behind when scheme, host or port change.
-// Answers come as they were sent (nothing is decompressed). No proxy is used, whatever the environment says.
-// A request on a kept connection that the server closed before it answered anything is sent once more on a
-// new one.
+// Past connectionsPerHost or connections, requests wait for their turn in the order of their start; waiting
+// counts toward their time-out. Past maxQueuedBytes or maxQueuedRequests a request ends at once with
+// kHttpTooMuchQueued. A redirect (301, 302, 303, 307, 308) is followed by this class: 303, and 301 and 302
+// after a POST, go on as GET without the body and its "Content-" headers; "Authorization" and "Cookie" stay
+// behind when scheme, host or port change. Answers come as they were sent (nothing is decompressed). No proxy
+// is used, whatever the environment says. A request on a kept connection that the server closed before it
+// answered anything is sent once more on a new one.
 //
 // Threads: any thread may call; the object must not be destroyed by a completion. A completion that throws is
 // logged and otherwise ignored.

@@ -180,7 +180,13 @@ TEST_F(CurlHttpClientTest, takesRequestsFromManyThreadsAndFromCompletions) {
 
 TEST_F(CurlHttpClientTest, outlivesACompletionThatThrows) {
   EchoServer server;
-  client_.startDataTask(get(server.url()), [](HttpResult) { throw std::runtime_error("no version"); });
+  std::binary_semaphore completing{0};
+  client_.startDataTask(get(server.url()), [&completing](HttpResult) {
+    completing.release();
+    throw std::runtime_error("no version");
+  });
+  completing.acquire();
+  // Completed by the same thread, and so after the failure was logged.
   EXPECT_FALSE(perform(get(server.url())).error);
   EXPECT_THAT(log_.lines(),
               testing::ElementsAre("CurlHttpClient(complete): a completion failed: no version"));

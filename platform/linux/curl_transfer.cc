@@ -28,14 +28,21 @@ bool isRedirect(long status) {
 
 }  // namespace
 
-CurlTransfer::CurlTransfer(HttpRequest request, HttpClient::Completion completion, TransferContext& context)
-    : request_(std::move(request)),
+CurlTransfer::CurlTransfer(uint64_t id, HttpRequest request, HttpClient::Completion completion,
+                           TransferContext& context)
+    : id_(id),
+      request_(std::move(request)),
       completion_(std::move(completion)),
       context_(context),
       bodyBytes_(request_.body == nullptr ? 0 : request_.body->size()) {}
 
 CurlTransfer::~CurlTransfer() {
   dropAnswer();
+}
+
+std::string CurlTransfer::host() const {
+  const auto origin = originOf(request_.url);
+  return origin ? origin->scheme + "://" + origin->host + ':' + origin->port : request_.url;
 }
 
 void CurlTransfer::dropAnswer() {
@@ -199,7 +206,6 @@ Result<CurlTransfer::Next> CurlTransfer::followRedirect() {
   }
   if (auto refused = redirectTo(target, status)) return *refused;
   dropAnswer();
-  if (auto failed = begin(std::move(easy_))) return *failed;
   return Next::hop;
 }
 

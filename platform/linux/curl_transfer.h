@@ -6,6 +6,7 @@
 #include <array>
 #include <chrono>
 #include <cstddef>
+#include <cstdint>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -32,12 +33,16 @@ struct TransferContext {
 // One request on its way, redirects included. Threads: the client's own only.
 class CurlTransfer {
  public:
-  CurlTransfer(HttpRequest request, HttpClient::Completion completion, TransferContext& context);
+  CurlTransfer(uint64_t id, HttpRequest request, HttpClient::Completion completion, TransferContext& context);
   CurlTransfer(const CurlTransfer&) = delete;
   CurlTransfer& operator=(const CurlTransfer&) = delete;
   ~CurlTransfer();
 
-  // Prepares a handle for the request as it stands; begin() or followRedirect() comes before every hop.
+  uint64_t id() const { return id_; }
+  // Scheme, name and port of the server that the request goes to next.
+  std::string host() const;
+
+  // Prepares a handle for the request as it stands; comes before every hop.
   MaybeError begin(CurlEasy easy);
   CURL* handle() const { return easy_.get(); }
 
@@ -45,7 +50,8 @@ class CurlTransfer {
   // connection that closes between two headers for a complete answer.
   MaybeError incompleteAnswer() const;
 
-  // After a whole answer: whether another one is due. An error means that the redirect is refused.
+  // After a whole answer: whether another hop is due; the request then stands as that hop
+  // sends it. An error means that the redirect is refused.
   enum class Next { finished, hop };
   Result<Next> followRedirect();
 
@@ -74,6 +80,7 @@ class CurlTransfer {
   static size_t onHeader(char* bytes, size_t size, size_t count, void* self);
   static CURLcode onTls(CURL* easy, void* context, void* certificates);
 
+  const uint64_t id_;
   HttpRequest request_;
   HttpClient::Completion completion_;
   TransferContext& context_;
