@@ -240,6 +240,20 @@ TEST_F(HTTPSPostBackendStateTest, RefusalLeavesWhatEarlierStepsSet) {
   EXPECT_EQ(*event.find("Opt"), Value(2));
 }
 
+TEST_F(HTTPSPostBackendStateTest, ConsentTypeFollowsTheEntryOfTheClient) {
+  auto overriding = entry;
+  overriding.set("override_dnu", 1);
+  overriding.set("client", "First");
+  clients = Array{overriding, entry};
+  userInfo->set(kTarnelUserInfoClientName, "First");
+  updated();
+  userInfo->set(kTarnelUserInfoClientName, "Meetwell");
+  backend->setUserInfoDict(userInfo);
+  backend->updateState();
+  send(*backend, 0, Flag::realtime, Dictionary(), 1);
+  EXPECT_EQ(*postedEvents().at(0).find("Opt"), Value(0));
+}
+
 // --- country, family, model ---
 
 TEST_F(HTTPSPostBackendStateTest, CountryMustBeListed) {
@@ -408,6 +422,17 @@ TEST_F(HTTPSPostBackendStateTest, EntryWithoutAddressKeepsTheOldOne) {
             "HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL 'https://old.example'");
 }
 
+TEST_F(HTTPSPostBackendStateTest, OwnAddressThatWasTakenAwayIsForgotten) {
+  world.settings.setObject("com.orvane.tarnel", "httpsPostURL", "https://own.example");
+  updated();
+  backend->setPostURL(std::nullopt);
+  backend->updateState();
+  EXPECT_EQ(backend->postURL(), "https://events.example/post");
+  backend->setPostURL("https://other.example");
+  backend->updateState();
+  EXPECT_EQ(backend->postURL(), "https://events.example/post");
+}
+
 TEST_F(HTTPSPostBackendStateTest, MissingEventThresholdFlushesBeforeTheSecondEvent) {
   entry.remove("event_threshold");
   updated();
@@ -422,84 +447,6 @@ TEST_F(HTTPSPostBackendStateTest, UpdateUndoesWhatAServerDisabled) {
   backend->setState(ReportingState::disabled);
   backend->updateState();
   EXPECT_EQ(backend->state(), ReportingState::enabled);
-}
-
-// --- values of the wrong type ---
-
-struct WrongType {
-  const char* key;
-  Value value;
-  const char* expected;
-  ReportingState state;  // as for an entry without the key
-};
-
-class HTTPSPostBackendWrongTypeTest : public HTTPSPostBackendStateTest,
-                                      public ::testing::WithParamInterface<WrongType> {};
-
-TEST_P(HTTPSPostBackendWrongTypeTest, CountsAsAbsentWithOneWarning) {
-  world.random.setUniform(0.5);
-  if (std::string_view(GetParam().key) == "override_sampling") entry.set("sampling_threshold", 0.1);
-  entry.set(GetParam().key, GetParam().value);
-  EXPECT_EQ(updated(), GetParam().state);
-  expectLog(LogLevel::warning, kWarning + std::string("clients[0].") + GetParam().key + " is not " +
-                                   GetParam().expected + " and counts as absent");
-  EXPECT_EQ(world.log.startingWith(kWarning + std::string("clients[0].")).size(), 1U);
-  EXPECT_EQ(batch, backend->batchEvents());
-}
-
-INSTANTIATE_TEST_SUITE_P(
-    Keys, HTTPSPostBackendWrongTypeTest,
-    ::testing::Values(WrongType{"client", 1, "a text", ReportingState::enabled},
-                      WrongType{"service", Array{"video"}, "a text", ReportingState::enabled},
-                      WrongType{"expedite", "yes", "a number", ReportingState::enabled},
-                      WrongType{"hierarchy", "1", "a number", ReportingState::enabled},
-                      WrongType{"override_dnu", Value(), "a number", ReportingState::enabled},
-                      WrongType{"locale_whitelist", "DE", "an array", ReportingState::disabled},
-                      WrongType{"device_whitelist", Dictionary(), "an array", ReportingState::enabled},
-                      WrongType{"device_blacklist", "Slate7,1", "an array", ReportingState::enabled},
-                      WrongType{"filters", Dictionary(), "an array", ReportingState::disabled},
-                      WrongType{"sampling_threshold", "1", "a number", ReportingState::disabled},
-                      WrongType{"per_country_sampling_thresholds", 1, "an array", ReportingState::enabled},
-                      WrongType{"override_sampling", Date{1}, "a number", ReportingState::sampledOut},
-                      WrongType{"custom_clientId", Value(), "a value", ReportingState::enabled},
-                      WrongType{"event_threshold", "5", "a number", ReportingState::enabled},
-                      WrongType{"extras_on_internal", Data{1}, "a number", ReportingState::enabled},
-                      WrongType{"post_url", 5, "a text", ReportingState::enabled},
-                      WrongType{"realtime_post_url", Array(), "a text", ReportingState::enabled}),
-    [](const auto& parameter) { return std::string(parameter.param.key); });
-
-TEST_F(HTTPSPostBackendStateTest, WrongTypesInsideListsCountAsAbsent) {
-  entry.set("locale_whitelist", Array{1, "DE", 2});
-  entry.set("per_country_sampling_thresholds",
-            Array{"x", Dictionary{{"country", "DE"}, {"threshold", 0}},
-                  Dictionary{{"country", Array{1, "DE"}}, {"threshold", "0"}}});
-  EXPECT_EQ(updated(), ReportingState::disabled);
-  for (const char* text : {"clients[0].locale_whitelist[0] is not a text",
-                           "clients[0].per_country_sampling_thresholds[0] is not a dictionary",
-                           "clients[0].per_country_sampling_thresholds[1].country is not an array",
-                           "clients[0].per_country_sampling_thresholds[2].country[0] is not a text",
-                           "clients[0].per_country_sampling_thresholds[2].threshold is not a number"}) {
-    expectLog(LogLevel::warning, kWarning + std::string(text) + " and counts as absent");
-  }
-  EXPECT_EQ(world.log.startingWith(kWarning + std::string("clients[0].")).size(), 5U);
-}
-
-TEST_F(HTTPSPostBackendStateTest, ListWithoutAnyTextCountsAsEmpty) {
-  entry.set("device_whitelist", Array{1, 2});
-  EXPECT_EQ(updated(), ReportingState::enabled);
-}
-
-TEST_F(HTTPSPostBackendStateTest, EveryUpdateWarnsAnew) {
-  entry.set("hierarchy", "1");
-  updated();
-  backend->updateState();
-  EXPECT_EQ(world.log.startingWith(kWarning + std::string("clients[0].hierarchy")).size(), 2U);
-}
-
-TEST_F(HTTPSPostBackendStateTest, ManyWrongEntriesAreOneWarning) {
-  for (int i = 0; i < 100; ++i) clients.append(Dictionary{{"client", 1}, {"service", "none"}});
-  EXPECT_EQ(updated(), ReportingState::disabled);
-  EXPECT_EQ(world.log.startingWith(kWarning).size(), 1U);
 }
 
 }  // namespace
