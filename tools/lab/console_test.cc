@@ -1,1 +1,124 @@
-// tests
+#include "tools/lab/console.h"
+
+#include <gmock/gmock.h>
+
+#include <memory>
+
+#include "platform/document.h"
+#include "platform/fake/fake_clock.h"
+#include "tools/lab/test_post.h"
+
+namespace tarnel::lab {
+namespace {
+
+using ::testing::HasSubstr;
+using ::testing::Not;
+
+class ConsoleTest : public ::testing::Test {
+ protected:
+  using Stream = std::unique_ptr<std::FILE, decltype(&std::fclose)>;
+
+  Console console(ConsoleStyle style, bool colour = false) {
+    return {output_.get(), errors_.get(), style, colour, clock_};
+  }
+  static std::string read(const Stream& stream) {
+    std::rewind(stream.get());
+    std::string text(65536, '\0');
+    text.resize(std::fread(text.data(), 1, text.size(), stream.get()));
+    return text;
+  }
+  static Arrival arrival() {
+    Arrival arrival;
+    arrival.number = 1;
+    arrival.path = "/v1/events";
+    arrival.headers = goodRequest(Dictionary{}).headers;
+    arrival.events = {goodEvent(1, 2), goodEvent(2, 2), goodEvent(3, 14)};
+    arrival.gzip = true;
+    arrival.wireBytes = 797;
+    arrival.plainBytes = 17'200;
+    arrival.answered = "200";
+    return arrival;
+  }
+
+  Stream output_{std::tmpfile(), std::fclose};
+  Stream errors_{std::tmpfile(), std::fclose};
+  fake::FakeClock clock_;
+};
+
+TEST_F(ConsoleTest, AnArrivalIsOneLine) {
+  console(ConsoleStyle::text).arrived(arrival());
+  EXPECT_THAT(read(output_),
+              HasSubstr("  POST /v1/events  OW  Meetwell / video-call  3 events (method 2 x2, 14)  "
+                        "797 B gzip of 17.2 kB  ok\n"));
+}
+
+TEST_F(ConsoleTest, ProblemsStandBelowIt) {
+  Arrival bad = arrival();
+  bad.problems = {"event 1: _status: missing"};
+  bad.answered = "400";
+  console(ConsoleStyle::text).arrived(bad);
+  EXPECT_THAT(read(output_),
+              HasSubstr("  1 problem  answered: 400\n              ! event 1: _status: missing\n"));
+}
+
+TEST_F(ConsoleTest, ColourOnlyWhenAskedFor) {
+  console(ConsoleStyle::text, false).arrived(arrival());
+  EXPECT_THAT(read(output_), Not(HasSubstr("\033")));
+  console(ConsoleStyle::text, true).arrived(arrival());
+  EXPECT_THAT(read(output_), HasSubstr("\033[32mok\033[0m"));
+}
+
+TEST_F(ConsoleTest, WhatIsMissingOrHostileIsStillOneLine) {
+  Arrival strange;
+  strange.path = "/";
+  strange.headers = {{"X-TRN-Sender", "\033[2J\nOW"}};
+  EXPECT_EQ(summaryOf(strange), "?[2J?OW  0 events  0 B");
+  strange.headers.clear();
+  EXPECT_EQ(summaryOf(strange), "unknown sender  0 events  0 B");
+  for (int method = 0; method < 20; ++method) strange.events.append(goodEvent(1, method));
+  EXPECT_THAT(summaryOf(strange), HasSubstr("(method 0, 1, 2, 3, 4, 5, 6, 7, ...)"));
+}
+
+TEST_F(ConsoleTest, JsonIsOneObjectALine) {
+  Console json = console(ConsoleStyle::json);
+  json.started("text", {{"url", "https://127.0.0.1:7"}});
+  json.arrived(arrival());
+  json.storebagServed({.time = 1, .sender = "s", .name = "a\xff", .version = "1", .status = 200, .bytes = 5});
+  json.warning("careful");
+  json.ended("bye");
+  std::string text = read(output_);
+  std::vector<std::string> kinds;
+  for (size_t end = text.find('\n'); end != std::string::npos; end = text.find('\n')) {
+    const Result<Value> line = parseDocument(text.substr(0, end));
+    ASSERT_TRUE(line) << text.substr(0, end);
+    kinds.push_back(*findString(*line->dictionary(), "kind"));
+    text.erase(0, end + 1);
+  }
+  EXPECT_THAT(kinds, ::testing::ElementsAre("started", "post", "storebag", "warning", "ended"));
+  EXPECT_EQ(read(errors_), "");
+}
+
+TEST_F(ConsoleTest, QuietSaysWarningsOnly) {
+  Console quiet = console(ConsoleStyle::quiet);
+  quiet.started("text", {});
+  quiet.arrived(arrival());
+  quiet.storebagServed({});
+  quiet.ended("bye");
+  quiet.warning("careful");
+  EXPECT_EQ(read(output_), "");
+  EXPECT_THAT(read(errors_), HasSubstr("  warning  careful\n"));
+}
+
+TEST_F(ConsoleTest, ServedStorebags) {
+  Console text = console(ConsoleStyle::text);
+  text.storebagServed({.name = "brevan", .version = "1.2", .status = 200, .bytes = 8300});
+  text.storebagServed({.name = "brevan", .version = "1.2", .status = 304});
+  text.storebagServed({.name = "none", .status = 404, .remark = "no such file"});
+  const std::string printed = read(output_);
+  EXPECT_THAT(printed, HasSubstr("  GET  storebag brevan  version 1.2  8.3 kB\n"));
+  EXPECT_THAT(printed, HasSubstr("  GET  storebag brevan  version 1.2  not modified\n"));
+  EXPECT_THAT(printed, HasSubstr("  GET  storebag none  404  no such file\n"));
+}
+
+}  // namespace
+}  // namespace tarnel::lab

@@ -33,6 +33,7 @@ constexpr size_t kRequestsTold = 1'000'000;  // for the answer's Keep-Alive fiel
 
 // The library would act on these fields itself (unpack, cut, compress); they pass it by under another name.
 constexpr std::string_view kHeldPrefix = "X-Lab-Held-";
+constexpr char kAddedLength[] = "X-Lab-Added-Length";
 constexpr std::array<const char*, 4> kHeldFields = {"Content-Encoding", "Accept-Encoding", "Content-Type",
                                                     "Range"};
 // Fields that the library adds to what the client sent.
@@ -69,6 +70,12 @@ void holdFields(httplib::Request& request) {
     request.headers.insert(held.begin(), held.end());
   }
   request.ranges.clear();
+  // Without a length there is no body (RFC 9112 section 6.3); the library would wait for the end of the
+  // connection.
+  if (!request.has_header("Content-Length") && !request.has_header("Transfer-Encoding")) {
+    request.headers.emplace("Content-Length", "0");
+    request.headers.emplace(kAddedLength, "1");
+  }
 }
 
 HttpRequest requestFrom(const httplib::Request& from, const Connection& connection) {
@@ -76,7 +83,9 @@ HttpRequest requestFrom(const httplib::Request& from, const Connection& connecti
   request.method = from.method;
   request.path = from.path;
   for (const auto& [name, value] : from.params) request.query.emplace_back(name, value);
+  const bool lengthAdded = from.has_header(kAddedLength);
   for (const auto& [name, value] : from.headers) {
+    if (lengthAdded && (name == kAddedLength || name == "Content-Length")) continue;
     if (std::find(kAddedFields.begin(), kAddedFields.end(), name) != kAddedFields.end()) continue;
     request.headers.emplace_back(name.starts_with(kHeldPrefix) ? name.substr(kHeldPrefix.size()) : name,
                                  value);
@@ -150,7 +159,7 @@ class Protocol final : private httplib::Server {
       return true;
     }
     // A body that nobody reads would be taken for the next request.
-    if (from.has_header("Content-Length") || from.has_header("Transfer-Encoding")) closeAfter(to);
+    if (!from.has_header(kAddedLength)) closeAfter(to);
     send(handler_.answer(requestFrom(from, *current_)), to);
     return true;
   }

@@ -17,7 +17,8 @@ struct Refusal {
 
 // Unpacks and parses; the refusal when there is nothing to check.
 std::optional<Refusal> readBody(const HttpRequest& request, Arrival& arrival, Value& document) {
-  if (request.bodyState == BodyState::tooLarge) return Refusal{413, "body: larger than the lab takes"};
+  if (request.bodyState == BodyState::tooLarge)
+    return Refusal{413, "body: larger than " + byteCount(PostReceiver::kMaxPlainBytes)};
   if (request.bodyState == BodyState::cutOff) return Refusal{400, "body: the connection ended within it"};
   std::string_view plain = request.body;
   Result<std::string> unpacked = std::string();

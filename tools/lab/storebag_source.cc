@@ -38,6 +38,7 @@ std::string parseProblem(const std::string& path, const std::string& inner, cons
     place += ":" + std::to_string(lineOfOffset(inner, *offset));
     reason.erase(reason.rfind(" at byte "));
   }
+  if (reason.ends_with('.')) reason.pop_back();
   return place + ": " + reason + "; correct the file, it is read again with the next request";
 }
 

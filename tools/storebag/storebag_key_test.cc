@@ -2,6 +2,7 @@
 
 #include <gmock/gmock.h>
 #include <openssl/evp.h>
+#include <openssl/x509.h>
 #include <sys/stat.h>
 
 #include <filesystem>
