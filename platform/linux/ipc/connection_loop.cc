@@ -176,7 +176,7 @@ ConnectionLoop::Pump ConnectionLoop::processOnce() {
   if (r == 0 || isDone) isFed_ = false;
   // The library drops what it finds malformed without a word; a peer that sends such is not to be trusted
   // with the rest.
-  if (r == 0 && admitted_ == 0 && messages_ < framer_.completed()) {
+  if (r == 0 && ready_ && admitted_ == 0 && messages_ < framer_.completed()) {
     return closing("it broke the protocol: a malformed message");
   }
   if (!ready_ && sd_bus_is_ready(bus_.get()) > 0) {
