@@ -12,7 +12,6 @@
 #include <csignal>
 
 #include "tools/lab/connection.h"
-#include "tools/lab/listener.h"
 #include "tools/lab/text.h"
 #include "tools/lab/worker_pool.h"
 
@@ -135,13 +134,16 @@ class Protocol final : private httplib::Server {
     mustClose_ = false;
     connection.limitReading(kHeadLimit, kMaxHeadBytes);
     bool closed = false;
+    bool headRead = false;
     const bool served =
-        process_request(stream, false, closed, [this, &connection](httplib::Request& request) {
+        process_request(stream, false, closed, [this, &connection, &headRead](httplib::Request& request) {
+          headRead = true;
           connection.limitReading(kBodyLimit, options_.maxBodyBytes + kMaxHeadBytes);
           holdFields(request);
         });
     current_ = nullptr;
-    return served && !closed && !mustClose_;
+    // After a head that makes no sense nobody knows where the next request begins.
+    return served && headRead && !closed && !mustClose_;
   }
 
  private:
@@ -240,13 +242,10 @@ class ServerOfConnections final : public HttpServer {
         acceptor_([this] { acceptConnections(); }) {}
   ~ServerOfConnections() override { stop(); }
 
-  uint16_t port() const override { return listening_.port; }
-
   void stop() override {
     const uint64_t one = 1;
-    if (::write(stopEvent_.get(), &one, sizeof one) < 0) {
-      // The counter is full: the event is set already.
-    }
+    // A full counter is as readable as one that took this.
+    [[maybe_unused]] const ssize_t written = ::write(stopEvent_.get(), &one, sizeof one);
     workers_.stop();
     if (acceptor_.joinable()) acceptor_.join();
   }
@@ -306,12 +305,9 @@ class ServerOfConnections final : public HttpServer {
 
 }  // namespace
 
-Result<std::unique_ptr<HttpServer>> HttpServer::start(const HttpServerOptions& options,
-                                                      HttpHandler& handler) {
-  Result<ListeningSocket> listening = listenOn(options.address, options.port, options.portOption);
-  if (!listening) return listening.error();
-  return std::unique_ptr<HttpServer>(
-      std::make_unique<ServerOfConnections>(options, *std::move(listening), handler));
+std::unique_ptr<HttpServer> HttpServer::start(const HttpServerOptions& options, ListeningSocket listening,
+                                              HttpHandler& handler) {
+  return std::make_unique<ServerOfConnections>(options, std::move(listening), handler);
 }
 
 Result<std::shared_ptr<ssl_ctx_st>> makeServerTlsContext(const std::string& certificateFile,

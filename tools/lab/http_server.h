@@ -6,16 +6,14 @@
 
 #include "platform/base/error.h"
 #include "tools/lab/http_message.h"
+#include "tools/lab/listener.h"
 
 struct ssl_ctx_st;
 
 namespace tarnel::lab {
 
 struct HttpServerOptions {
-  std::string address = "127.0.0.1";  // numeric, IPv4 or IPv6
-  uint16_t port = 0;                  // 0: any free one
-  std::string portOption;             // named in the error when the port is in use
-  std::shared_ptr<ssl_ctx_st> tls;    // null: plain HTTP
+  std::shared_ptr<ssl_ctx_st> tls;  // null: plain HTTP
   size_t maxBodyBytes = 16U << 20U;
   // Bodies that are held at the same time, all connections together; beyond it a request waits its turn
   // to fail as too large.
@@ -28,15 +26,15 @@ struct HttpServerOptions {
 // minutes, an idle connection to a minute (less while others wait).
 class HttpServer {
  public:
-  // Listens when it returns. The handler outlives the server. The error names the fix.
-  static Result<std::unique_ptr<HttpServer>> start(const HttpServerOptions& options, HttpHandler& handler);
+  // Serves what comes to the socket from now on. The handler outlives the server.
+  static std::unique_ptr<HttpServer> start(const HttpServerOptions& options, ListeningSocket listening,
+                                           HttpHandler& handler);
 
   HttpServer() = default;
   HttpServer(const HttpServer&) = delete;
   HttpServer& operator=(const HttpServer&) = delete;
   virtual ~HttpServer() = default;
 
-  virtual uint16_t port() const = 0;
   // Answers what is being answered, ends all connections; returns when no thread is left. Idempotent.
   virtual void stop() = 0;
 };

@@ -30,27 +30,6 @@ std::vector<std::string> servedNames(const std::string& listen) {
   return names;
 }
 
-// Stands before the service until the port is known, and with it the lab's own address.
-class LateHandler final : public HttpHandler {
- public:
-  void set(HttpHandler& handler) {
-    handler_ = &handler;
-    handler_.notify_all();
-  }
-  HttpAnswer answer(const HttpRequest& request) override { return handler().answer(request); }
-  void connectionFailed(const std::string& sender, const std::string& text) override {
-    handler().connectionFailed(sender, text);
-  }
-
- private:
-  HttpHandler& handler() {
-    handler_.wait(nullptr);
-    return *handler_.load();
-  }
-
-  std::atomic<HttpHandler*> handler_ = nullptr;
-};
-
 class RunningLab final : public Lab {
  public:
   RunningLab(const LabOptions& options, LabDirectory directory, Console& console, Clock& clock)
@@ -74,14 +53,12 @@ class RunningLab final : public Lab {
   }
 
  private:
-  MaybeError beginService();
-  MaybeError beginControl();
+  void makeHandlers();
+  void requestStop();
   void tellStart() const;
-  std::string baseURL() const {
-    return "https://" + urlHost(options_.listen) + ":" + std::to_string(https_->port());
-  }
+  std::string baseURL() const { return "https://" + urlHost(options_.listen) + ":" + std::to_string(port_); }
   std::string controlURL() const {
-    return std::string("http://") + kControlAddress + ":" + std::to_string(controlServer_->port());
+    return std::string("http://") + kControlAddress + ":" + std::to_string(controlPort_);
   }
 
   const LabOptions options_;
@@ -94,22 +71,43 @@ class RunningLab final : public Lab {
   Misbehaviours misbehaviours_;
   PostReceiver posts_;
   const int64_t started_;
+  uint16_t port_ = 0;
+  uint16_t controlPort_ = 0;
   std::unique_ptr<StorebagSource> storebags_;
   std::unique_ptr<Service> service_;
   std::unique_ptr<Control> control_;
-  LateHandler lateService_;
-  LateHandler lateControl_;
   std::unique_ptr<HttpServer> https_;
   std::unique_ptr<HttpServer> controlServer_;
 };
 
 MaybeError RunningLab::begin() {
   if (MaybeError error = writer_.open()) return error;
+  HttpServerOptions forService;
+  Result<std::shared_ptr<ssl_ctx_st>> tls =
+      makeServerTlsContext(directory_.paths.certificates.server, directory_.paths.certificates.serverKey);
+  if (!tls) return tls.error();
+  forService.tls = *tls;
+  HttpServerOptions forControl;
+  forControl.maxConnections = kControlConnections;
+  forControl.maxBodyBytes = kControlBodyBytes;
+  // Both are bound before anything is answered: what is served holds the lab's own address.
+  Result<ListeningSocket> service = listenOn(options_.listen, options_.port, "--port");
+  if (!service) return service.error();
+  Result<ListeningSocket> control = listenOn(kControlAddress, options_.controlPort, "--control-port");
+  if (!control) return control.error();
+  port_ = service->port;
+  controlPort_ = control->port;
+  makeHandlers();
+  https_ = HttpServer::start(forService, *std::move(service), *service_);
+  controlServer_ = HttpServer::start(forControl, *std::move(control), *control_);
+  tellStart();
+  if (options_.readyFile.empty()) return std::nullopt;
+  return writeFile(options_.readyFile, writeTextDocument(status(), true) + "\n", 0644);
+}
+
+void RunningLab::makeHandlers() {
   store_.addObserver(writer_);
   store_.addObserver(console_);
-  // Bound before anything is answered, so that a port in use leaves nothing half begun.
-  if (MaybeError error = beginService()) return error;
-  if (MaybeError error = beginControl()) return error;
   storebags_ =
       std::make_unique<StorebagSource>(directory_.paths.storebags, directory_.key, baseURL(), started_);
   service_ = std::make_unique<Service>(Service::Parts{.storebags = *storebags_,
@@ -121,45 +119,13 @@ MaybeError RunningLab::begin() {
   control_ = std::make_unique<Control>(Control::Parts{.store = store_,
                                                       .misbehaviours = misbehaviours_,
                                                       .status = [this] { return status(); },
-                                                      .stop =
-                                                          [this] {
-                                                            const uint64_t one = 1;
-                                                            [[maybe_unused]] const ssize_t put = ::write(
-                                                                stopRequested_.get(), &one, sizeof one);
-                                                          }});
-  lateService_.set(*service_);
-  lateControl_.set(*control_);
-  tellStart();
-  if (options_.readyFile.empty()) return std::nullopt;
-  return writeFile(options_.readyFile, writeTextDocument(status(), true) + "\n", 0644);
+                                                      .stop = [this] { requestStop(); }});
 }
 
-MaybeError RunningLab::beginService() {
-  Result<std::shared_ptr<ssl_ctx_st>> tls =
-      makeServerTlsContext(directory_.paths.certificates.server, directory_.paths.certificates.serverKey);
-  if (!tls) return tls.error();
-  HttpServerOptions options;
-  options.address = options_.listen;
-  options.port = options_.port;
-  options.portOption = "--port";
-  options.tls = *tls;
-  Result<std::unique_ptr<HttpServer>> server = HttpServer::start(options, lateService_);
-  if (!server) return server.error();
-  https_ = *std::move(server);
-  return std::nullopt;
-}
-
-MaybeError RunningLab::beginControl() {
-  HttpServerOptions options;
-  options.address = kControlAddress;
-  options.port = options_.controlPort;
-  options.portOption = "--control-port";
-  options.maxConnections = kControlConnections;
-  options.maxBodyBytes = kControlBodyBytes;
-  Result<std::unique_ptr<HttpServer>> server = HttpServer::start(options, lateControl_);
-  if (!server) return server.error();
-  controlServer_ = *std::move(server);
-  return std::nullopt;
+void RunningLab::requestStop() {
+  const uint64_t one = 1;
+  // A full counter is as readable as one that took this.
+  [[maybe_unused]] const ssize_t written = ::write(stopRequested_.get(), &one, sizeof one);
 }
 
 Dictionary RunningLab::status() const {

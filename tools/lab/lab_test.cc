@@ -13,6 +13,7 @@
 
 #include "platform/document.h"
 #include "platform/fake/fake_clock.h"
+#include "tools/lab/certificate_authority.h"
 #include "tools/lab/http_message.h"
 #include "tools/lab/test_post.h"
 #include "tools/storebag/file_io.h"
@@ -333,19 +334,24 @@ TEST_F(LabTest, AHeadWithoutEndIsCutOff) {
   EXPECT_LT(sent, 64U << 20U);
 }
 
-TEST_F(LabTest, ClientsThatDoNotSpeakTlsAreNamedWithTheRemedy) {
+TEST_F(LabTest, ClientsThatCannotTalkToItAreNamedWithTheRemedy) {
   start();
   const FileDescriptor socket = connectTo(at("url"));
   const std::string request = "GET / HTTP/1.1\r\n\r\n";
   ::send(socket.get(), request.data(), request.size(), MSG_NOSIGNAL);
   readAll(socket);
-  Client stranger("/dev/null");
-  EXPECT_NE(stranger.get(at("url")).code, CURLE_OK);
+  const CertificateFiles others = {.authority = folder_ + "/a",
+                                   .authorityKey = folder_ + "/b",
+                                   .server = folder_ + "/c",
+                                   .serverKey = folder_ + "/d"};
+  ASSERT_TRUE(ensureCertificates(others, {"localhost"}, std::time(nullptr)));
+  EXPECT_EQ(Client(others.authority).get(at("url")).code, CURLE_PEER_FAILED_VERIFICATION);
   lab_->stop();
   std::rewind(output_.get());
   std::string text(65536, '\0');
   text.resize(std::fread(text.data(), 1, text.size(), output_.get()));
   EXPECT_THAT(text, HasSubstr("write https://"));
+  EXPECT_THAT(text, HasSubstr("copy the lab's ca.pem to the client's trust.d folder"));
 }
 
 TEST_F(LabTest, ManyClientsAtOnce) {
