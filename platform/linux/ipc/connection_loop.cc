@@ -188,7 +188,11 @@ ConnectionLoop::Pump ConnectionLoop::processOnce() {
 
 ConnectionLoop::Pump ConnectionLoop::feed() {
   const auto written = write(feed_.get(), buffer_.get() + inputBegin_, admitted_);
-  // The pipe is empty here, as isFed_ is false; it takes at least something.
+  // Parts of messages that the bus has not read yet may fill it.
+  if (written < 0 && errno == EAGAIN) {
+    isFed_ = true;
+    return Pump::progress;
+  }
   if (written <= 0) return closing(std::string("its input cannot be passed on: ") + strerror(errno));
   inputBegin_ += static_cast<size_t>(written);
   admitted_ -= static_cast<size_t>(written);
