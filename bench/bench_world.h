@@ -1,0 +1,92 @@
+#pragma once
+
+#include <benchmark/benchmark.h>
+#include <systemd/sd-bus.h>
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "backends/https/https_post_backend.h"
+#include "platform/fake/fake_world.h"
+#include "platform/ipc/dbus_codec.h"
+#include "session/fake_connection.h"
+#include "session/tarneld_session.h"
+
+namespace tarnel::bench {
+
+// Events that one post carries: the default threshold of 49 lets a fiftieth in.
+inline constexpr size_t kBatch = 50;
+
+// Tells the time that one message took, whatever number of them one iteration handles.
+inline void reportPerMessage(benchmark::State& state, size_t messagesPerIteration) {
+  const auto messages = static_cast<double>(state.iterations()) * static_cast<double>(messagesPerIteration);
+  state.counters["per_message"] =
+      benchmark::Counter(messages, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
+}
+
+// Takes every post and answers it at once.
+class AcceptingHttpClient final : public HttpClient {
+ public:
+  void startDataTask(HttpRequest request, Completion completion) override {
+    bytes_ += request.body == nullptr ? 0 : request.body->size();
+    ++posts_;
+    completion(HttpResult{std::string(), HttpResponse{200, {}}, std::nullopt});
+  }
+  size_t posts() const noexcept { return posts_; }
+  size_t bytes() const noexcept { return bytes_; }
+
+ private:
+  size_t posts_ = 0;
+  size_t bytes_ = 0;
+};
+
+// Whether a readable copy of every post goes to the message log, as it does when the user has consented and
+// the client entry honours consent.
+enum class MessageLog { off, on };
+
+// The fakes' world as a quiet daemon sees it: diagnostics up to level 6, posts accepted at once.
+class BenchWorld {
+ public:
+  BenchWorld();
+
+  // Called between measurements: the fakes remember what a real log or disk would take away.
+  void forget();
+
+  fake::FakeWorld fakes;
+  AcceptingHttpClient http;
+  Dependencies dependencies;
+};
+
+// One enabled HTTPS backend, set up as a session does it.
+std::shared_ptr<HTTPSPostBackend> makeBackend(BenchWorld& world, MessageLog messageLog);
+
+// One configured session with that one backend.
+std::shared_ptr<TarneldSession> makeSession(BenchWorld& world, MessageLog messageLog);
+
+// Sealed bus messages, as they stand once they have been read from a socket.
+class SealedMessages {
+ public:
+  SealedMessages();
+
+  struct Unref {
+    void operator()(sd_bus_message* message) const noexcept { sd_bus_message_unref(message); }
+  };
+  using Message = std::unique_ptr<sd_bus_message, Unref>;
+
+  // SendMessage of callPayload(index).
+  Message single(size_t index);
+  // SendMessages of the first `count` payloads.
+  Message batch(size_t count);
+
+ private:
+  struct Close {
+    void operator()(sd_bus* bus) const noexcept { sd_bus_close_unref(bus); }
+  };
+  Message newCall(const char* member);
+
+  std::unique_ptr<sd_bus, Close> bus_;
+};
+
+}  // namespace tarnel::bench
