@@ -1,4 +1,3 @@
-#include <dirent.h>
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -30,14 +29,6 @@ size_t residentBytes() {
   size_t resident = 0;
   statm >> total >> resident;
   return resident * static_cast<size_t>(sysconf(_SC_PAGESIZE));
-}
-
-size_t openDescriptors() {
-  DIR* folder = opendir("/proc/self/fd");
-  size_t count = 0;
-  while (readdir(folder) != nullptr) ++count;
-  closedir(folder);
-  return count;
 }
 
 class IpcHostileTest : public ::testing::Test {
@@ -165,133 +156,6 @@ TEST_F(IpcHostileTest, AFloodWithoutReadingIsHeldBack) {
   EXPECT_EQ(service.session()->count(), held);
 }
 
-TEST(IpcUnansweredTest, UnansweredCallsAreBounded) {
-  IpcLimits limits;
-  limits.unansweredCalls = 10;
-  Service service(limits);
-  std::mutex mutex;
-  std::vector<SentReply> held;
-  service.prepare = [&](RecordingSession& session) {
-    session.answerSend = [&](SentReply reply) {
-      const std::lock_guard lock(mutex);
-      held.push_back(std::move(reply));
-    };
-  };
-  service.start();
-  BusClient client(service.path());
-  for (int i = 0; i < 30; ++i) {
-    auto call = client.newCall("SendMessage");
-    sd_bus_message_append(call.get(), "qqaa{sv}", 1, 2, 0);
-    ASSERT_GE(sd_bus_call_async(
-                  client.bus(), nullptr, call.get(), [](sd_bus_message*, void*, sd_bus_error*) { return 1; },
-                  nullptr, 0),
-              0);
-  }
-  ASSERT_GE(sd_bus_flush(client.bus()), 0);
-  const auto session = [&] { return service.session(); };
-  EXPECT_TRUE(eventually([&] { return service.accepted() == 1 && session()->count() == 10; }));
-  for (size_t answered = 0; answered < 30;) {
-    std::vector<SentReply> now;
-    EXPECT_TRUE(eventually([&] {
-      const std::lock_guard lock(mutex);
-      now = std::exchange(held, {});
-      return !now.empty();
-    }));
-    answered += now.size();
-    EXPECT_LE(now.size(), 10U);
-    for (auto& reply : now) reply(std::nullopt);
-  }
-  EXPECT_EQ(session()->count(), 30U);
-}
-
-TEST(IpcQueueTest, AClientThatNeverReadsItsCallsIsDropped) {
-  IpcLimits limits;
-  limits.queuedBytes = 100'000;
-  Service service(limits);
-  service.start();
-  const RawClient client(service.path());
-  client.authenticate();
-  EXPECT_TRUE(client.write(rawCall("StartConfig")));
-  EXPECT_TRUE(eventually([&] { return service.accepted() == 1 && service.session()->count() == 1; }));
-  std::atomic<size_t> errors = 0;
-  const auto proxy =
-      service.connection(0)->remoteObjectProxyWithErrorHandler([&errors](const Error&) { ++errors; });
-  const Dictionary payload{{"k", Value(std::string(1000, 'x'))}};
-  size_t sent = 0;
-  while (errors == 0 && sent < 100'000) {
-    proxy->sendMessageToClient(payload, 0, 1, 2, payload);
-    ++sent;
-  }
-  EXPECT_GT(errors, 0U);
-  EXPECT_TRUE(eventually([&] { return service.invalidations() == 1; }));
-  EXPECT_TRUE(service.logged("the limit of 100000 queued bytes is reached"));
-}
-
-TEST(IpcLimitTest, ConnectionsOfAUserAreLimited) {
-  IpcLimits limits;
-  limits.connectionsPerUser = 3;
-  limits.connections = 5;
-  // The user's number is what the client's socket happens to be: each test client says who it is.
-  std::atomic<uint32_t> nextUser{getuid()};
-  Service service(limits, [&nextUser](int) {
-    PeerCredentials peer;
-    peer.uid = nextUser;
-    return peer;
-  });
-  service.start();
-  std::vector<std::unique_ptr<BusClient>> clients;
-  const auto connect = [&] {
-    clients.push_back(std::make_unique<BusClient>(service.path()));
-    return clients.back()->call("StartConfig", "") != nullptr;
-  };
-  for (int i = 0; i < 3; ++i) EXPECT_TRUE(connect());
-  EXPECT_FALSE(connect());
-  EXPECT_TRUE(
-      service.logged("the limit of 3 connections per user is reached by user " + std::to_string(getuid())));
-  clients.clear();
-  EXPECT_TRUE(eventually([&] { return service.listener().connections() == 0; }));
-  EXPECT_TRUE(connect());
-}
-
-TEST(IpcLimitTest, AThousandConnectionsAtOnceAreCutToTheLimit) {
-  IpcLimits limits;
-  limits.connectionsPerUser = 1000;
-  limits.connections = 100;
-  Service service(limits);
-  service.start();
-  const size_t descriptors = openDescriptors();
-  rlimit files{};
-  getrlimit(RLIMIT_NOFILE, &files);
-  files.rlim_cur = files.rlim_max;
-  setrlimit(RLIMIT_NOFILE, &files);
-  std::vector<UniqueFd> clients;
-  for (int i = 0; i < 1000; ++i) clients.push_back(connectTo(service.path()));
-  EXPECT_TRUE(eventually([&] { return service.accepted() == 100; }));
-  // The last in the queue was looked at, so all were.
-  EXPECT_TRUE(isClosedByPeer(clients.back()));
-  EXPECT_EQ(service.accepted(), 100U);
-  const auto lines = service.log().startingWith("IpcListener: Connections closed:");
-  ASSERT_FALSE(lines.empty());
-  EXPECT_LT(lines.size(), 10U);
-  EXPECT_THAT(lines[0].text, HasSubstr("the limit of 100 connections is reached"));
-  clients.clear();
-  EXPECT_TRUE(eventually([&] { return service.invalidations() == 100; }));
-  EXPECT_TRUE(eventually([&] { return service.listener().threads() == 0; }));
-  EXPECT_EQ(service.listener().connections(), 0U);
-  EXPECT_TRUE(eventually([&] { return openDescriptors() <= descriptors; }));
-}
-
-TEST_F(IpcHostileTest, AThousandConnectionsLeaveNoThreadBehind) {
-  service.start();
-  for (int i = 0; i < 1000; ++i) {
-    const RawClient client(service.path());
-    if (i % 2 == 0) client.authenticate();
-    EXPECT_TRUE(eventually([&] { return service.listener().connections() < 32; }));
-  }
-  EXPECT_TRUE(eventually([&] { return service.listener().threads() == 0; }));
-  EXPECT_EQ(service.invalidations(), service.accepted());
-}
-
 TEST(IpcDeathTest, DeathAtAnyInstantIsSurvived) {
   IpcLimits limits;
   limits.connectionsPerUser = limits.connections;
@@ -416,30 +280,6 @@ TEST_F(IpcHostileTest, TooDeepIsRefusedByName) {
   EXPECT_EQ(client.errorName, wire::kErrorTooDeep);
   EXPECT_EQ(service.session()->count(), 0U);
   EXPECT_NE(client.call("StartConfig", ""), nullptr);
-}
-
-TEST_F(IpcHostileTest, WithoutDescriptorsClientsAreClosedAndLaterOnesServed) {
-  service.start();
-  expectOthersAreServed();
-  EXPECT_TRUE(eventually([&] { return service.listener().threads() == 0; }));
-  rlimit before{};
-  getrlimit(RLIMIT_NOFILE, &before);
-  // The client's own socket comes first; then the process may not open one more.
-  const UniqueFd client(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  std::vector<UniqueFd> hoard;
-  rlimit tight = before;
-  tight.rlim_cur = openDescriptors() + 8;
-  setrlimit(RLIMIT_NOFILE, &tight);
-  for (UniqueFd fd(dup(0)); fd; fd = UniqueFd(dup(0))) hoard.push_back(std::move(fd));
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  service.path().copy(address.sun_path, sizeof(address.sun_path) - 1);
-  ASSERT_EQ(connect(client.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
-  EXPECT_TRUE(isClosedByPeer(client));
-  EXPECT_TRUE(eventually([&] { return service.logged("the limit of open files is reached"); }));
-  hoard.clear();
-  setrlimit(RLIMIT_NOFILE, &before);
-  expectOthersAreServed();
 }
 
 }  // namespace
