@@ -195,6 +195,14 @@ TEST_F(TarnelBackendTest, FactoryComparesNamesExactly) {
   }
 }
 
+TEST_F(TarnelBackendTest, FactoryMakesNoDravikBackendOnADesktopMachine) {
+  world.deviceInformation.answers["ProductType"] = "Deskbox";
+  EXPECT_EQ(fromFactory(kTarnelBackendDravik, profile), nullptr);
+  EXPECT_EQ(
+      world.log.lines(),
+      (std::vector<fake::FakeLog::Line>{{LogLevel::error, "TarnelBackend(newBackendWithName): dravik"}}));
+}
+
 TEST_F(TarnelBackendTest, FactoryPassesAnInitializersRefusalOn) {
   EXPECT_EQ(fromFactory("httppost", Dictionary()), nullptr);
   EXPECT_EQ(TarnelBackend::newBackendWithName(world.dependencies, "httppost", profile, std::nullopt, 7),

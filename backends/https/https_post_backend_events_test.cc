@@ -139,6 +139,14 @@ TEST_F(HTTPSPostBackendEventsTest, SessionIdentifierIsAbsentUntilSet) {
   EXPECT_EQ(*newEvent(*backend).find("_sessionID"), Value(77));
 }
 
+TEST_F(HTTPSPostBackendEventsTest, SessionNumberHas32BitsWithoutASign) {
+  internal = true;
+  const auto backend = make();
+  backend->setCompType(11);
+  backend->setSessionID(4294967295U);
+  EXPECT_THAT(json(newEvent(*backend)), ::testing::HasSubstr(R"("_sessionID":4294967295,)"));
+}
+
 TEST_F(HTTPSPostBackendEventsTest, SystemVersionAndBuildAreAbsentWhenUnknown) {
   const auto backend = make();
   backend->setProductVersion(std::nullopt);
