@@ -54,12 +54,14 @@ std::string noise(size_t length, unsigned seed) {
 // What the fake calls below were told, and what they answer.
 struct FakeZlib {
   int initCode = Z_OK;
+  std::vector<int> deflateCodesBefore;  // answered first, each after one more byte
   int deflateCode = Z_STREAM_END;
   int resetCode = Z_OK;
   const char* message = nullptr;
   int level = 0, method = 0, windowBits = 0, memoryLevel = 0, strategy = -1, streamSize = 0;
   std::string version;
   int flush = 0;
+  std::vector<unsigned> rooms;  // for output, at each call of deflate
   int inits = 0, resets = 0, ends = 0;
 };
 FakeZlib fakeZlib;
@@ -81,7 +83,13 @@ const ZlibCalls kFakeCalls = {[](z_stream* stream, int level, int method, int wi
                               [](z_stream* stream, int flush) {
                                 fakeZlib.flush = flush;
                                 stream->msg = const_cast<char*>(fakeZlib.message);
-                                return fakeZlib.deflateCode;
+                                fakeZlib.rooms.push_back(stream->avail_out);
+                                if (fakeZlib.deflateCodesBefore.empty()) return fakeZlib.deflateCode;
+                                *stream->next_out = 'x';
+                                ++stream->total_out;
+                                const int code = fakeZlib.deflateCodesBefore.back();
+                                fakeZlib.deflateCodesBefore.pop_back();
+                                return code;
                               },
                               [](z_stream*) {
                                 ++fakeZlib.resets;
@@ -234,6 +242,13 @@ TEST_F(CompressionTest, DeflateTextsByCode) {
     EXPECT_EQ(fakeZlib.ends, 1) << "the stream is ended, not kept";
     EXPECT_EQ(idle_.take(CompressionFormat::gzip), nullptr);
   }
+}
+
+TEST_F(CompressionTest, GoesOnBehindWhatWasProducedUntilTheStreamEnds) {
+  fakeZlib.deflateCodesBefore = {Z_OK, Z_OK};
+  EXPECT_EQ(compressWithFakes(), "xx");
+  // The room is what deflateBound gave, less what was produced; it never grows.
+  EXPECT_EQ(fakeZlib.rooms, (std::vector<unsigned>{105, 104, 103}));
 }
 
 TEST_F(CompressionTest, MissingZlibMessageIsEmpty) {
