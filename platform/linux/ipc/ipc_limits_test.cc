@@ -82,7 +82,6 @@ TEST(IpcLimitTest, ConnectionsOfAUserAreLimited) {
   IpcLimits limits;
   limits.connectionsPerUser = 3;
   limits.connections = 5;
-  // The user's number is what the client's socket happens to be: each test client says who it is.
   std::atomic<uint32_t> nextUser{getuid()};
   Service service(limits, [&nextUser](int) {
     PeerCredentials peer;
@@ -96,7 +95,12 @@ TEST(IpcLimitTest, ConnectionsOfAUserAreLimited) {
     return clients.back()->call("StartConfig", "") != nullptr;
   };
   for (int i = 0; i < 3; ++i) EXPECT_TRUE(connect());
-  EXPECT_FALSE(connect());
+  EXPECT_TRUE(isClosedByPeer(RawClient(service.path()).fd()));
+  // Another user has a limit of its own: its connection reaches the delegate.
+  nextUser = getuid() + 1;
+  EXPECT_TRUE(isClosedByPeer(RawClient(service.path()).fd()));
+  EXPECT_EQ(service.rejected(), 1U);
+  nextUser = getuid();
   EXPECT_TRUE(
       service.logged("the limit of 3 connections per user is reached by user " + std::to_string(getuid())));
   clients.clear();
