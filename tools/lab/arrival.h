@@ -21,7 +21,7 @@ struct Arrival {
   Array events;
   bool gzip = false;
   uint64_t wireBytes = 0;             // of the body
-  uint64_t plainBytes = 0;            // unpacked
+  uint64_t plainBytes = 0;            // unpacked; 0 when it could not be
   std::vector<std::string> problems;  // plain sentences; empty when all is as it should be
   std::string answered;               // "200", "status 503" or what else was done on purpose
 };

@@ -38,7 +38,7 @@ std::string summaryOf(const Arrival& arrival) {
   if (const std::string methods = methodsText(arrival.events); !methods.empty())
     text += " (method " + methods + ")";
   text += "  " + byteCount(arrival.wireBytes);
-  if (arrival.gzip) text += " gzip of " + byteCount(arrival.plainBytes);
+  if (arrival.gzip) text += arrival.plainBytes == 0 ? " gzip" : " gzip of " + byteCount(arrival.plainBytes);
   return text;
 }
 

@@ -25,6 +25,7 @@ std::optional<Refusal> readBody(const HttpRequest& request, Arrival& arrival, Va
   if (const std::string* encoding = findHeader(request.headers, "Content-Encoding")) {
     if (*encoding == "gzip") {
       arrival.gzip = true;
+      arrival.plainBytes = 0;
       unpacked = gunzip(request.body, PostReceiver::kMaxPlainBytes);
       if (!unpacked) return Refusal{400, "body: " + unpacked.error().localizedDescription()};
       plain = *unpacked;
