@@ -60,7 +60,8 @@ Outcome check(const Options& options) {
 
 std::string resolveSocketPath(const std::string& wanted) {
   if (!wanted.empty()) return wanted;
-  const char* fromEnvironment = std::getenv("TARNEL_SOCKET");
+  // Not of a set-group-id program: whoever starts it must not say where its reports go.
+  const char* fromEnvironment = secure_getenv("TARNEL_SOCKET");
   return fromEnvironment != nullptr && *fromEnvironment != '\0' ? fromEnvironment : kDefaultSocketPath;
 }
 

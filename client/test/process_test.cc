@@ -1,16 +1,23 @@
 #include <gtest/gtest.h>
+#include <sys/auxv.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <csignal>
 #include <cstdlib>
+#include <filesystem>
 #include <functional>
 #include <future>
+#include <optional>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "client/src/c_support.h"
+#include "client/src/options.h"
 #include "client/test/test_daemon.h"
 #include "tarnel/tarnel.h"
 
@@ -28,6 +35,9 @@ constexpr bool kChildMayStartThreads = false;  // ThreadSanitizer's rule
 #else
 constexpr bool kChildMayStartThreads = true;
 #endif
+
+// Result of a program that was to be privileged and is not.
+constexpr int kNotPrivileged = 77;
 
 // Runs `body` in a forked child; its result, or 100 plus the signal that ended it.
 int inChild(const std::function<int()>& body) {
@@ -52,6 +62,31 @@ int asProgram(const std::string& mode, const std::string& path) {
   int status = 0;
   EXPECT_EQ(::waitpid(child, &status, 0), child);
   return WIFEXITED(status) ? WEXITSTATUS(status) : 100 + WTERMSIG(status);
+}
+
+// Runs a copy of this test program that is set-group-id to a group other than the process's own; nothing
+// where that cannot be made or the system does not honour it.
+std::optional<int> asPrivilegedProgram(const std::string& mode, const std::string& copy) {
+  gid_t group = ::getegid() + 1;  // root may take any
+  if (::geteuid() != 0) {
+    std::vector<gid_t> groups(static_cast<size_t>(std::max(::getgroups(0, nullptr), 0)));
+    if (::getgroups(static_cast<int>(groups.size()), groups.data()) < 0) return std::nullopt;
+    std::erase(groups, ::getegid());
+    if (groups.empty()) return std::nullopt;
+    group = groups.front();
+  }
+  std::filesystem::copy_file("/proc/self/exe", copy);
+  if (::chown(copy.c_str(), static_cast<uid_t>(-1), group) != 0) return std::nullopt;
+  if (::chmod(copy.c_str(), 02755) != 0) return std::nullopt;
+  const pid_t child = ::fork();
+  if (child == 0) {
+    ::execl(copy.c_str(), "process_test", mode.c_str(), "", nullptr);
+    ::_exit(99);
+  }
+  int status = 0;
+  EXPECT_EQ(::waitpid(child, &status, 0), child);
+  const int result = WIFEXITED(status) ? WEXITSTATUS(status) : 100 + WTERMSIG(status);
+  return result == kNotPrivileged ? std::nullopt : std::optional(result);
 }
 
 class ProcessTest : public ::testing::Test {
@@ -177,6 +212,15 @@ TEST_F(ProcessTest, TheThreadTakesNoSignals) {
   EXPECT_EQ(asProgram("signal", path_), 7);
 }
 
+// Who starts such a program must not say where its reports go.
+TEST_F(ProcessTest, ASetGroupIdProgramDoesNotTakeItsSocketFromTheEnvironment) {
+  ASSERT_EQ(::setenv("TARNEL_SOCKET", "/elsewhere", 1), 0);
+  const auto result = asPrivilegedProgram("socket", folder_.file("copy"));
+  ::unsetenv("TARNEL_SOCKET");
+  if (!result) GTEST_SKIP() << "no set-group-id program can be made here";
+  EXPECT_EQ(*result, 7);
+}
+
 // The programs that the tests above run: each ends with code 7.
 
 Session* leaked = nullptr;
@@ -242,6 +286,11 @@ int signalProgram(const char* path) {
   return taken == SIGUSR1 ? 7 : 1;
 }
 
+int socketProgram() {
+  if (::getauxval(AT_SECURE) == 0) return kNotPrivileged;
+  return core::resolveSocketPath("") == "/run/tarneld/com.orvane.tarneld" ? 7 : 1;
+}
+
 int runProgram(const std::string& mode, const char* path) {
   if (mode == "leak") {
     leaked = std::make_unique<Session>(programOptions(path)).release();
@@ -251,6 +300,7 @@ int runProgram(const std::string& mode, const char* path) {
     static Session session(programOptions(path));
     return sendFive(session);
   }
+  if (mode == "socket") return socketProgram();
   if (mode == "callbacks") return callbacksProgram(path);
   if (mode == "exit-in-callback") return exitInCallbackProgram(path);
   if (mode == "stuck-callback") return stuckCallbackProgram(path);

@@ -66,8 +66,8 @@ typedef void (*tarnel_aggregation_end_handler)(void* context);
 
 typedef struct tarnel_options {
   size_t size;
-  /* The daemon's socket, an absolute path of at most 107 bytes. NULL: the environment variable TARNEL_SOCKET,
-   * else /run/tarneld/com.orvane.tarneld. */
+  /* The daemon's socket, an absolute path of at most 107 bytes. NULL: the environment variable TARNEL_SOCKET
+   * (which set-user-id and set-group-id programs ignore), else /run/tarneld/com.orvane.tarneld. */
   const char* socket_path;
   /* Calls that may wait to be sent; 1 to 1,000,000, default 4,096. */
   uint32_t max_queued_calls;
