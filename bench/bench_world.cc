@@ -110,7 +110,7 @@ std::shared_ptr<TarneldSession> makeSession(BenchWorld& world, MessageLog messag
   const auto delegate =
       std::make_shared<OneStorebag>(Dictionary{{kTarnelBackendHTTPPost, httpProfile(messageLog)}});
   auto session = TarneldSession::initWithSessionDelegate(world.dependencies, delegate,
-                                                         std::make_shared<fake::FakeConnection>());
+                                                         std::make_shared<fake::FakeIpcConnection>());
   session->setSessionInfo(Dictionary{{kTarnelSessionInfoSessionID, 4102},
                                      {kTarnelSessionInfoClientType, 9},
                                      {kTarnelSessionInfoRequireUserInfo, true},

@@ -9,9 +9,9 @@
 #include <vector>
 
 #include "backends/https/https_post_backend.h"
+#include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
 #include "platform/ipc/dbus_codec.h"
-#include "session/fake_connection.h"
 #include "session/tarneld_session.h"
 
 namespace tarnel::bench {

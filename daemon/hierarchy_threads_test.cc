@@ -51,9 +51,9 @@ class HierarchyThreads : public AgentTest {
     }
   }
   Client accept() {
-    auto connection = std::make_shared<FakeConnection>();
+    auto connection = entitledConnection();
     agent->shouldAcceptNewConnection(listener, connection);
-    return {connection, std::static_pointer_cast<TarneldSession>(connection->exported)};
+    return {connection, std::static_pointer_cast<TarneldSession>(connection->exportedObject)};
   }
 };
 

@@ -7,9 +7,9 @@
 #include <string>
 #include <vector>
 
+#include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
 #include "session/fake_backends.h"
-#include "session/fake_connection.h"
 
 namespace tarnel::fake {
 namespace {
@@ -30,7 +30,8 @@ class FakeListener final : public IpcListener {
   MaybeError resume() override {
     journal_.add("resume");
     if (failure_) return failure_;
-    connection_ = std::make_shared<FakeConnection>();
+    connection_ = std::make_shared<FakeIpcConnection>();
+    connection_->entitlements["com.orvane.private.tarneld"] = true;
     EXPECT_TRUE(delegate_->shouldAcceptNewConnection(*this, connection_));
     return std::nullopt;
   }
@@ -39,7 +40,7 @@ class FakeListener final : public IpcListener {
   Journal& journal_;
   const MaybeError failure_;
   IpcListenerDelegate* delegate_ = nullptr;
-  std::shared_ptr<FakeConnection> connection_;
+  std::shared_ptr<FakeIpcConnection> connection_;
 };
 
 class FakeHost final : public ServiceHost {

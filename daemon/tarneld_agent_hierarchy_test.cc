@@ -1,6 +1,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <thread>
+
 #include "daemon/test_agent_fixture.h"
 
 namespace tarnel::fake {
@@ -43,6 +45,30 @@ TEST_F(AgentHierarchy, ChangedNamesMoveTheSessionAndTheOldListStays) {
   EXPECT_THAT(listed("phone:call"), IsEmpty());
   EXPECT_THAT(listed("phone:video"), ElementsAre(a.session));
   EXPECT_EQ(agent->correlatedSessions().size(), 2U);
+}
+
+TEST_F(AgentHierarchy, FilingAnewUnderTheSameKeyGoesToTheEnd) {
+  const Client a = start("A", 1, 0);
+  const Client b = start("B", 2, 0);
+  world.log.clear();
+  a.session->receivedUserInfo(user("PHONE"));
+  EXPECT_THAT(listed(), ElementsAre(b.session, a.session));
+  EXPECT_TRUE(logged(LogLevel::debug,
+                     "userInfoUpdatedForSession: Adding session 1 to list for userInfoKey phone:call"));
+  EXPECT_EQ(agent->correlatedSessions().size(), 1U);
+}
+
+TEST_F(AgentHierarchy, WhatNeedsNoWalkTakesNoLock) {
+  const Client top = start("A", 1, 0);
+  const Client nobody = connect();
+  const LockGuard guard(agent->agentLock());
+  std::thread([this, &top, &nobody] {
+    agent->userInfoUpdatedForSession(*nobody.session);
+    agent->updateDownstreamSessions(*nobody.session);
+    agent->getAncestorWithAggregatorForSession(*nobody.session);
+    agent->parentSessionIDStringForSession(*top.session);
+    agent->getAncestorWithAggregatorForSession(*top.session);
+  }).join();
 }
 
 TEST_F(AgentHierarchy, TopLevelSessionHasNoParent) {
@@ -174,15 +200,19 @@ TEST_F(AgentHierarchy, AncestorOfASessionWithoutUserInfoIsNone) {
 TEST_F(AgentHierarchy, MessageOfAChildReachesTheAncestorsClient) {
   const Client parent = start("A", 1, 0, true);
   const Client child = start("B", 2, 1);
-  const size_t before = parent.connection->received().size();
+  const size_t before = parent.connection->sentToClient().size();
+  bool isLocked = false;
+  parent.connection->whenProxyIsAsked = [this, &isLocked] { isLocked = !isFree(agent->agentLock()); };
   child.session->sendMessageWithCategory(3, 4, Dictionary{{"a", 1}});
-  const auto received = parent.connection->received();
+  parent.connection->whenProxyIsAsked = nullptr;
+  EXPECT_TRUE(isLocked);
+  const auto received = parent.connection->sentToClient();
   ASSERT_EQ(received.size(), before + 1);
   EXPECT_EQ(received.back().messageInfo, info(2, 8));
   EXPECT_EQ(
       received.back().payload,
       (Dictionary{{"a", 1}, {kTarnelUserInfoClientName, "Phone"}, {kTarnelUserInfoServiceName, "Call"}}));
-  EXPECT_THAT(child.connection->received(), IsEmpty());
+  EXPECT_THAT(child.connection->sentToClient(), IsEmpty());
 }
 
 // Downstream.
@@ -236,7 +266,7 @@ TEST_F(AgentHierarchy, AggregatingParentEndsTheAggregationBelow) {
   world.log.clear();
   start("A", 1, 0, true);
   EXPECT_FALSE(child.session->hasAggregator());
-  EXPECT_FALSE(child.connection->received().back().messageInfo);
+  EXPECT_FALSE(child.connection->sentToClient().back().messageInfo);
   EXPECT_TRUE(
       logged(LogLevel::debug, "shutdownSessionAggregation: Disable aggregation module for session 2"));
   // Who has none is not told.
@@ -263,12 +293,12 @@ TEST_F(AgentHierarchy, WithoutAnyAggregatorAboveTheDeeperOnesKeepTheirs) {
 TEST_F(AgentHierarchy, DestroyedSessionIsNotBroughtBack) {
   const Client parent = start("A", 1, 0, true);
   Client child = start("B", 2, 1);
-  const size_t before = parent.connection->received().size();
+  const size_t before = parent.connection->sentToClient().size();
   child.disconnect();
   EXPECT_THAT(listed(), ElementsAre(parent.session));
   // Its stop message still reaches the ancestor.
-  ASSERT_EQ(parent.connection->received().size(), before + 1);
-  EXPECT_EQ(parent.connection->received().back().type, 1);
+  ASSERT_EQ(parent.connection->sentToClient().size(), before + 1);
+  EXPECT_EQ(parent.connection->sentToClient().back().type, 1);
 }
 
 }  // namespace

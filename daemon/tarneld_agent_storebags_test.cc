@@ -85,6 +85,18 @@ TEST_F(AgentStorebags, SuccessIsServedWhileYoungerThanItsMaximumAge) {
   EXPECT_EQ(fetches, 2);
 }
 
+TEST_F(AgentStorebags, LookupHoldsTheAgentsLockForTheFetchAndGivesItBack) {
+  bool isLocked = false;
+  fetch = [this, &isLocked](int32_t /*clientType*/,
+                            StorebagFetchSlots /*slots*/) -> std::optional<Dictionary> {
+    isLocked = !isFree(agent->agentLock());
+    return std::nullopt;
+  };
+  ask(8);
+  EXPECT_TRUE(isLocked);
+  EXPECT_TRUE(isFree(agent->agentLock()));
+}
+
 TEST_F(AgentStorebags, ExpiredSuccessIsRefetchedWithoutWaiting) {
   fetchSucceeds(10, "one");
   ask(8);
@@ -125,6 +137,7 @@ TEST_F(AgentStorebags, FailureIsNotRetriedFor900Seconds) {
   fetchFails();
   EXPECT_FALSE(ask(8));
   EXPECT_TRUE(logged(LogLevel::error, "fetchAndCacheStorebag: Unable to fetch storebag for client type 8"));
+  EXPECT_TRUE(logged(LogLevel::debug, "fetchAndCacheStorebag: Storebag max age: 0 seconds"));
   EXPECT_EQ(entry().StorebagFetchState, "Fetch Failure");
   EXPECT_EQ(entry().StorebagFetchTime, now());
   EXPECT_FALSE(entry().StorebagVersion);

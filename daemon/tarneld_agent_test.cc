@@ -20,15 +20,16 @@ TEST_F(AgentAcceptance, AgentBeginsWithThreeEmptyCollections) {
 }
 
 TEST_F(AgentAcceptance, ConnectionWithoutTheEntitlementIsRefusedBeforeAnythingIsMade) {
-  const auto connection = std::make_shared<FakeConnection>("<stranger>", false);
+  const auto connection = std::make_shared<FakeIpcConnection>("<stranger>");
+  connection->entitlements["com.orvane.private.other"] = true;
   EXPECT_FALSE(agent->shouldAcceptNewConnection(listener, connection));
   EXPECT_THAT(world.log.lines(),
               ElementsAre(FakeLog::Line{LogLevel::debug,
                                         "listener: new LNK connection <stranger> does not have required "
                                         "tarnel entitlement. Closing connection..."}));
-  EXPECT_THAT(connection->asked, ElementsAre("com.orvane.private.tarneld"));
-  EXPECT_EQ(connection->exported, nullptr);
-  EXPECT_EQ(connection->resumed, 0);
+  EXPECT_EQ(connection->exportedObject, nullptr);
+  EXPECT_EQ(connection->invalidationHandler, nullptr);
+  EXPECT_FALSE(connection->isResumed);
   EXPECT_THAT(agent->sessionList(), IsEmpty());
   EXPECT_EQ(world.keepAlive.begun, 0);
   connect("<client>");
@@ -37,15 +38,28 @@ TEST_F(AgentAcceptance, ConnectionWithoutTheEntitlementIsRefusedBeforeAnythingIs
                      "connections."));
 }
 
-TEST_F(AgentAcceptance, AcceptedConnectionIsBoundToItsSession) {
-  const Client client = connect();
-  EXPECT_THAT(client.connection->asked, ElementsAre("com.orvane.private.tarneld"));
-  EXPECT_NE(client.session, nullptr);
-  EXPECT_TRUE(client.connection->hasRemote);
-  EXPECT_EQ(client.connection->resumed, 1);
-  EXPECT_THAT(agent->sessionList(), ElementsAre(client.session));
+TEST_F(AgentAcceptance, AFalseEntitlementIsNone) {
+  const auto connection = std::make_shared<FakeIpcConnection>();
+  connection->entitlements["com.orvane.private.tarneld"] = false;
+  EXPECT_FALSE(agent->shouldAcceptNewConnection(listener, connection));
+}
+
+TEST_F(AgentAcceptance, ConnectionIsBoundAndListedBeforeItIsResumed) {
+  const auto connection = entitledConnection();
+  connection->whenResumed = [this, watched = connection.get()] {
+    ASSERT_NE(watched->exportedObject, nullptr);
+    EXPECT_TRUE(watched->hasRemoteObjectInterface);
+    EXPECT_TRUE(watched->interruptionHandler);
+    EXPECT_TRUE(watched->invalidationHandler);
+    EXPECT_EQ(world.keepAlive.begun, 1);
+    EXPECT_THAT(agent->sessionList(),
+                ElementsAre(std::static_pointer_cast<TarneldSession>(watched->exportedObject)));
+  };
+  EXPECT_TRUE(agent->shouldAcceptNewConnection(listener, connection));
+  EXPECT_TRUE(connection->isResumed);
   EXPECT_TRUE(logged(LogLevel::debug,
                      "initWithSessionDelegate: TarneldSession initWithSessionDelegate:<TarneldAgent>"));
+  connection->invalidate();
 }
 
 TEST_F(AgentAcceptance, CountsAreTakenBeforeTheNewSessionIsAdded) {
@@ -122,6 +136,42 @@ TEST_F(AgentAcceptance, AcceptanceDoesNotWaitForTheAgentsLock) {
   const LockGuard guard(agent->agentLock());
   std::thread([this] { connect("<meanwhile>"); }).join();
   EXPECT_EQ(agent->sessionList().size(), 1U);
+}
+
+TEST_F(AgentAcceptance, InvalidationTakesTheTwoLocksOneAfterTheOther) {
+  Client client = start("A", 1, 0);
+  const auto connection = client.connection;
+  client = {};
+  std::thread invalidation;
+  {
+    const LockGuard guard(agent->agentLock());
+    invalidation = std::thread([&connection] { connection->invalidate(); });
+    // The session leaves the list while the agent's lock is ours; that the list can be read meanwhile, to
+    // the end of the wait, says that its lock is not kept for the other.
+    while (!agent->sessionList().empty()) std::this_thread::yield();
+    while (world.keepAlive.ended == 0) std::this_thread::yield();
+    EXPECT_EQ(agent->correlatedSessions().at("phone:call").size(), 1U);
+  }
+  invalidation.join();
+  EXPECT_THAT(agent->correlatedSessions().at("phone:call"), IsEmpty());
+}
+
+TEST_F(AgentAcceptance, TransactionFollowsTheListUnderItsLock) {
+  // Many come and go at once: the transaction is begun and ended in turns, never twice in a row.
+  std::vector<std::thread> threads;
+  for (int i = 0; i < 4; ++i) {
+    threads.emplace_back([this] {
+      for (int round = 0; round < 200; ++round) {
+        const auto connection = entitledConnection();
+        agent->shouldAcceptNewConnection(listener, connection);
+        connection->invalidate();
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  EXPECT_FALSE(world.keepAlive.turnedTwice);
+  EXPECT_GE(world.keepAlive.begun, 1);
+  EXPECT_EQ(world.keepAlive.begun, world.keepAlive.ended);
 }
 
 TEST_F(AgentAcceptance, NamesThatClientsInventAreBoundedOnceNobodyIsUnderThem) {

@@ -9,9 +9,10 @@
 
 #include "client/include/tarnel/keys.h"
 #include "daemon/tarneld_agent.h"
+#include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
+#include "platform/fake/lock_probe.h"
 #include "session/fake_backends.h"
-#include "session/fake_connection.h"
 
 namespace tarnel::fake {
 
@@ -19,7 +20,7 @@ namespace tarnel::fake {
 class AgentTest : public ::testing::Test {
  protected:
   struct Client {
-    std::shared_ptr<FakeConnection> connection;
+    std::shared_ptr<FakeIpcConnection> connection;
     std::shared_ptr<TarneldSession> session;
     // Lets the last references go, as at the end of a connection.
     void disconnect() {
@@ -39,12 +40,17 @@ class AgentTest : public ::testing::Test {
     }
   }
 
+  static std::shared_ptr<FakeIpcConnection> entitledConnection(const std::string& name = "<connection>") {
+    auto made = std::make_shared<FakeIpcConnection>(name);
+    made->entitlements["com.orvane.private.tarneld"] = true;
+    return made;
+  }
   // Connects, and gives the session an identifier if there is one.
   Client connect(const std::string& name = "<connection>", const std::string& sessionIDString = {}) {
-    auto connection = std::make_shared<FakeConnection>(name);
+    auto connection = entitledConnection(name);
     connections_.push_back(connection);
     EXPECT_TRUE(agent->shouldAcceptNewConnection(listener, connection));
-    auto session = std::static_pointer_cast<TarneldSession>(connection->exported);
+    auto session = std::static_pointer_cast<TarneldSession>(connection->exportedObject);
     if (!sessionIDString.empty()) session->setSessionIDString(sessionIDString);
     return {connection, session};
   }
@@ -86,7 +92,7 @@ class AgentTest : public ::testing::Test {
       });
 
  private:
-  std::vector<std::weak_ptr<FakeConnection>> connections_;
+  std::vector<std::weak_ptr<FakeIpcConnection>> connections_;
 };
 
 }  // namespace tarnel::fake

@@ -22,6 +22,18 @@ TEST_F(SessionBackends, CreateBackendsWantsAStorebagAndSessionInfo) {
   EXPECT_TRUE(logged(LogLevel::error, "createBackends: Attempted to create backends with nil session info"));
 }
 
+TEST_F(SessionBackends, StorebagWithoutSessionInfoGivesNoBackends) {
+  offer({"httppost"});
+  bool called = false;
+  session->startConfigWithCompletionHandler([&called](std::optional<std::vector<std::string>> names) {
+    called = true;
+    EXPECT_FALSE(names);
+  });
+  EXPECT_TRUE(called);
+  EXPECT_TRUE(logged(LogLevel::error, "createBackends: Attempted to create backends with nil session info"));
+  EXPECT_TRUE(session->backends().empty());
+}
+
 TEST_F(SessionBackends, CreateBackendsTellsEachWhoReports) {
   world.deviceInformation.answers["ReleaseType"] = "Internal";
   world.clock.set({1700000007, 500000});
@@ -183,7 +195,7 @@ class SessionSync : public SessionBackends {
     }
     parentDelegate->storebag = sectionOf(names);
     auto parent = TarneldSession::initWithSessionDelegate(
-        world.dependencies, parentDelegate, std::make_shared<FakeConnection>(), parentBackends.factory());
+        world.dependencies, parentDelegate, std::make_shared<FakeIpcConnection>(), parentBackends.factory());
     parent->setSessionInfo(info(1), user(), std::nullopt, false);
     parent->startConfigWithCompletionHandler(nullptr);
     world.log.clear();
@@ -262,10 +274,10 @@ TEST_F(SessionSync, AChildWithoutItsParentSaysSoForEachDeeperBackend) {
   EXPECT_EQ(stateOf("httppost"), ReportingState::enabled);
 }
 
-TEST_F(SessionSync, SyncTakesTheAgentsLock) {
-  const int locks = delegate->locksTaken;
+TEST_F(SessionSync, ParentIsAskedForUnderTheAgentsLock) {
   session->syncReportingStates();
-  EXPECT_EQ(delegate->locksTaken, locks + 1);
+  EXPECT_TRUE(delegate->isParentAskedLocked);
+  EXPECT_FALSE(delegate->isLocked());
 }
 
 TEST_F(SessionSync, CombinedIdentifierIsTheParentsAndOnesOwn) {

@@ -189,8 +189,8 @@ TEST_F(SessionDispatch, OwnAggregatorGetsTheMessageWithUserInfoOverIt) {
   configureAndStart(true);
   world.clock.set({1700000123, 500000});
   send(Dictionary{{"a", 1}, {kTarnelUserInfoClientName, "from payload"}});
-  ASSERT_EQ(connection->received().size(), 2U);  // the start message and this one
-  const auto message = connection->received().back();
+  ASSERT_EQ(connection->sentToClient().size(), 2U);  // the start message and this one
+  const auto message = connection->sentToClient().back();
   EXPECT_EQ(message.messageInfo, info());
   EXPECT_DOUBLE_EQ(message.timestamp, 1700000123.5);
   EXPECT_EQ(message.category, 3);
@@ -205,51 +205,80 @@ TEST_F(SessionDispatch, NoPayloadReachesTheAggregatorAsNone) {
   offer({"httppost"});
   configureAndStart(true);
   send(std::nullopt);
-  EXPECT_FALSE(connection->received().back().payload);
+  EXPECT_FALSE(connection->sentToClient().back().payload);
 }
 
 TEST_F(SessionDispatch, AncestorGetsTheMessageInsteadOfTheOwnClient) {
   offer({"httppost"});
   backends.scripts["httppost"].hierarchy = 1;
-  const auto ancestorConnection = std::make_shared<FakeConnection>();
+  const auto ancestorConnection = newConnection();
   delegate->ancestor = newSession(ancestorConnection);
   configureAndStart(true);
   send();
-  EXPECT_THAT(connection->received(), IsEmpty());
-  ASSERT_EQ(ancestorConnection->received().size(), 2U);
-  EXPECT_EQ(ancestorConnection->received().back().messageInfo, info());
-  EXPECT_EQ(ancestorConnection->received().back().payload->size(), 3U);
+  EXPECT_THAT(connection->sentToClient(), IsEmpty());
+  ASSERT_EQ(ancestorConnection->sentToClient().size(), 2U);
+  EXPECT_EQ(ancestorConnection->sentToClient().back().messageInfo, info());
+  EXPECT_EQ(ancestorConnection->sentToClient().back().payload->size(), 3U);
   delegate->ancestor.reset();
 }
 
 TEST_F(SessionDispatch, TopLevelSessionAsksWithoutTheLock) {
   offer({"httppost"});
   configureAndStart();
-  const int locks = delegate->locksTaken;
   const int lookups = delegate->ancestorLookups;
   send();
-  EXPECT_EQ(delegate->locksTaken, locks);
   EXPECT_EQ(delegate->ancestorLookups, lookups + 1);
+  EXPECT_FALSE(delegate->isAncestorAskedLocked);
 }
 
-TEST_F(SessionDispatch, DeeperSessionAsksUnderTheLock) {
+TEST_F(SessionDispatch, SessionWithoutUserInfoAsksWithoutTheLock) {
+  offer({"httppost"});
+  backends.scripts["httppost"].hierarchy = 1;
+  session->setSessionInfo(info(), std::nullopt, std::nullopt, false);
+  session->startConfigWithCompletionHandler(nullptr);
+  const int lookups = delegate->ancestorLookups;
+  send();
+  EXPECT_EQ(delegate->ancestorLookups, lookups + 1);
+  EXPECT_FALSE(delegate->isAncestorAskedLocked);
+}
+
+TEST_F(SessionDispatch, DeeperSessionAsksAndHandsOverUnderTheLock) {
   offer({"httppost"});
   backends.scripts["httppost"].hierarchy = 1;
   configureAndStart();
-  const int locks = delegate->locksTaken;
+  const auto ancestorConnection = newConnection();
+  delegate->ancestor = newSession(ancestorConnection);
+  std::optional<bool> isHandedOverLocked;
+  ancestorConnection->whenProxyIsAsked = [&] { isHandedOverLocked = delegate->isLocked(); };
   send();
-  EXPECT_EQ(delegate->locksTaken, locks + 1);
+  EXPECT_TRUE(delegate->isAncestorAskedLocked);
+  EXPECT_EQ(isHandedOverLocked, true);
+  EXPECT_FALSE(delegate->isLocked());
+  ancestorConnection->whenProxyIsAsked = nullptr;
+  delegate->ancestor.reset();
+}
+
+TEST_F(SessionDispatch, OwnClientGetsTheMessageAfterTheLockIsGivenBack) {
+  offer({"httppost"});
+  backends.scripts["httppost"].hierarchy = 1;
+  configureAndStart(true);
+  std::optional<bool> isSentLocked;
+  connection->whenProxyIsAsked = [&] { isSentLocked = delegate->isLocked(); };
+  send();
+  EXPECT_TRUE(delegate->isAncestorAskedLocked);
+  EXPECT_EQ(isSentLocked, false);
+  connection->whenProxyIsAsked = nullptr;
 }
 
 TEST_F(SessionDispatch, WithoutAggregatorNothingIsSentToTheClient) {
   offer({"httppost"});
   configureAndStart();
   send();
-  EXPECT_THAT(connection->received(), IsEmpty());
+  EXPECT_THAT(connection->sentToClient(), IsEmpty());
 }
 
 TEST_F(SessionDispatch, AProxyThatCannotBeHadIsLogged) {
-  connection->failProxies(Error("IPC", 5, "gone"));
+  connection->proxyError = Error("IPC", 5, "gone");
   session->sendToAggregator(std::nullopt, 0, 0, 0, std::nullopt);
   EXPECT_TRUE(
       logged(LogLevel::error, "sendMessageWithDictionary: Failed to get remote object proxy: IPC (5): gone"));
@@ -263,109 +292,13 @@ TEST_F(SessionDispatch, ShutdownSignalsTheClientOnceAndForgetsTheAggregator) {
                             "shutdownSessionAggregation: Disable aggregation module for session 7"),
             2U);
   EXPECT_FALSE(session->hasAggregator());
-  ASSERT_EQ(connection->received().size(), 1U);
-  const auto signal = connection->received().at(0);
+  ASSERT_EQ(connection->sentToClient().size(), 1U);
+  const auto signal = connection->sentToClient().at(0);
   EXPECT_FALSE(signal.messageInfo);
   EXPECT_EQ(signal.timestamp, 0.0);
   EXPECT_EQ(signal.category, 0);
   EXPECT_EQ(signal.type, 0);
   EXPECT_FALSE(signal.payload);
-}
-
-// Flush.
-
-class SessionFlush : public SessionDispatch {
- protected:
-  struct Answer {
-    int calls = 0;
-    MaybeString text;
-    MaybeError error;
-  };
-  FlushReply into(Answer& answer) {
-    return [&answer](MaybeString text, MaybeError error) {
-      ++answer.calls;
-      answer.text = std::move(text);
-      answer.error = std::move(error);
-    };
-  }
-};
-
-TEST_F(SessionFlush, WithoutBackendsAnswersAnError) {
-  Answer answer;
-  session->flushMessagesWithCompletion(into(answer));
-  EXPECT_EQ(answer.calls, 1);
-  EXPECT_FALSE(answer.text);
-  EXPECT_EQ(answer.error, Error(kTarnelErrorDomain, -1, "No backends available to send message"));
-  EXPECT_TRUE(logged(LogLevel::debug, "flushMessagesWithCompletion: Flushing messages for session 0"));
-  EXPECT_TRUE(
-      logged(LogLevel::debug, "internalFlushMessagesWithCompletion: No backends available to send message"));
-  session->flushMessagesWithCompletion(nullptr);
-}
-
-TEST_F(SessionFlush, ThreeBackendsWithoutErrorsAnswerOnceAfterTheThird) {
-  offer({"httppost", "dashboard", "vesmer"});
-  for (auto& [name, script] : backends.scripts) script.holdFlush = true;
-  configureAndStart();
-  Answer answer;
-  session->flushMessagesWithCompletion(into(answer));
-  backends.last("dashboard")->heldFlushes.at(0)(std::nullopt, std::nullopt);
-  backends.last("vesmer")->heldFlushes.at(0)("two", std::nullopt);
-  EXPECT_EQ(answer.calls, 0);
-  backends.last("httppost")->heldFlushes.at(0)("three", std::nullopt);
-  EXPECT_EQ(answer.calls, 1);
-  EXPECT_EQ(answer.text, "three");
-  EXPECT_FALSE(answer.error);
-}
-
-TEST_F(SessionFlush, FirstErrorAnswersAtOnceAndTheOthersNoMore) {
-  offer({"httppost", "dashboard", "vesmer"});
-  for (auto& [name, script] : backends.scripts) script.holdFlush = true;
-  configureAndStart();
-  Answer answer;
-  session->flushMessagesWithCompletion(into(answer));
-  const Error error(kTarnelErrorDomain, -1, "Nothing to flush");
-  backends.last("httppost")->heldFlushes.at(0)(std::nullopt, error);
-  EXPECT_EQ(answer.calls, 1);
-  EXPECT_EQ(answer.error, error);
-  backends.last("dashboard")->heldFlushes.at(0)(std::nullopt, Error("other", 1, "late"));
-  backends.last("vesmer")->heldFlushes.at(0)("late", std::nullopt);
-  EXPECT_EQ(answer.calls, 1);
-  EXPECT_EQ(answer.error, error);
-}
-
-TEST_F(SessionFlush, EachBackendIsLoggedAndItsTextWritten) {
-  offer({"httppost", "dashboard"});
-  backends.scripts["httppost"].flushText = "flushed events";
-  configureAndStart();
-  session->flushMessagesWithCompletion(nullptr);
-  EXPECT_TRUE(logged(LogLevel::debug, "internalFlushMessagesWithCompletion: httppost"));
-  EXPECT_TRUE(logged(LogLevel::debug, "internalFlushMessagesWithCompletion: dashboard"));
-  EXPECT_THAT(messageLog(), ElementsAre("[httppost -> flushMessages] flushed events"));
-}
-
-TEST_F(SessionFlush, AnswersThatComeAfterTheSessionIsGoneAreHarmless) {
-  offer({"httppost"});
-  backends.scripts["httppost"].holdFlush = true;
-  configureAndStart();
-  Answer answer;
-  session->flushMessagesWithCompletion(into(answer));
-  const auto backend = backends.last("httppost");
-  session.reset();
-  backend->heldFlushes.at(0)("late", std::nullopt);
-  EXPECT_EQ(answer.text, "late");
-}
-
-TEST_F(SessionFlush, AllSessionsShareOneLock) {
-  EXPECT_EQ(&TarneldSession::classLock(), &TarneldSession::classLock());
-  offer({"httppost"});
-  configureAndStart();
-  // The completion runs under the lock; taking it again on the same thread must not hang.
-  bool ran = false;
-  session->flushMessagesWithCompletion([&ran](MaybeString /*text*/, MaybeError /*error*/) {
-    const LockGuard guard(TarneldSession::classLock());
-    ran = true;
-  });
-  EXPECT_TRUE(ran);
 }
 
 }  // namespace

@@ -42,6 +42,11 @@ TEST_F(SessionLifecycle, DeviceIdentifierIsEmptyWithoutAnAnswer) {
   EXPECT_EQ(newSession(connection)->deviceid(), "");
 }
 
+TEST_F(SessionLifecycle, DeviceIdentifierIsCutToFortyCharacters) {
+  world.deviceInformation.answers["UniqueDeviceID"] = std::string(40, 'a') + "beyond";
+  EXPECT_EQ(newSession(connection)->deviceid(), std::string(40, 'a'));
+}
+
 TEST_F(SessionLifecycle, FieldsBeginEmpty) {
   EXPECT_EQ(session->sessionID(), 0U);
   EXPECT_FALSE(session->sessionInfo());
@@ -236,6 +241,16 @@ TEST_F(SessionLifecycle, FinishSendsTypeTwoAndAnswersWithItsResult) {
   EXPECT_EQ(answer, MaybeSentObject(SentObject(std::string("posted"))));
 }
 
+TEST_F(SessionLifecycle, MessagesAfterTheFinishAndASecondFinishAreStillSent) {
+  offer({kTarnelBackendHTTPPost});
+  configureAndStart();
+  session->finishSessionWithReply(nullptr);
+  session->sendMessageWithCategory(3, 4, std::nullopt, nullptr);
+  session->finishSessionWithReply(nullptr);
+  EXPECT_THAT(backends.journal.lines(),
+              ElementsAre("httppost send 0/2", "httppost send 3/4", "httppost send 0/2"));
+}
+
 TEST_F(SessionLifecycle, DeallocStopsFlushesShutsDownAndCleansUpInThatOrder) {
   offer({kTarnelBackendHTTPPost, kTarnelBackendDashboard});
   configureAndStart(true);
@@ -256,8 +271,8 @@ TEST_F(SessionLifecycle, DeallocStopsFlushesShutsDownAndCleansUpInThatOrder) {
   EXPECT_EQ(seen, expected);
   EXPECT_EQ(backends.last(kTarnelBackendHTTPPost)->sent.back().payload,
             (Dictionary{{"StorebagVersion", "5.1"}}));
-  ASSERT_EQ(connection->received().size(), 3U);  // start, stop, end of aggregation
-  EXPECT_FALSE(connection->received().back().messageInfo);
+  ASSERT_EQ(connection->sentToClient().size(), 3U);  // start, stop, end of aggregation
+  EXPECT_FALSE(connection->sentToClient().back().messageInfo);
   EXPECT_TRUE(session->backends().empty());
   EXPECT_FALSE(session->storebagVersion());
   EXPECT_FALSE(session->userInfo());

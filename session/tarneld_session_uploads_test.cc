@@ -120,7 +120,7 @@ TEST_F(SessionUploads, SingleMessageGoesThroughABackendSetOfItsOwn) {
   EXPECT_EQ(backend->sent.at(0).payload, (Dictionary{{"a", 1}}));
   EXPECT_EQ(backend->sent.at(0).flag, Flag::normal);
   EXPECT_TRUE(session->backends().empty());
-  EXPECT_THAT(connection->received(), IsEmpty());
+  EXPECT_THAT(connection->sentToClient(), IsEmpty());
 }
 
 TEST_F(SessionUploads, SingleMessageWarnsOfUserInfoThatIsNotRequired) {

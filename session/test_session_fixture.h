@@ -7,9 +7,10 @@
 #include <vector>
 
 #include "client/include/tarnel/keys.h"
+#include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
+#include "platform/fake/lock_probe.h"
 #include "session/fake_backends.h"
-#include "session/fake_connection.h"
 #include "session/tarneld_session.h"
 
 namespace tarnel::fake {
@@ -34,6 +35,7 @@ class FakeDelegate final : public TarneldSessionDelegate {
   }
   std::shared_ptr<TarneldSession> getAncestorWithAggregatorForSession(TarneldSession& /*session*/) override {
     ++ancestorLookups;
+    isAncestorAskedLocked = isLocked();
     return ancestor;
   }
   void updateDownstreamSessions(TarneldSession& session) override {
@@ -41,11 +43,11 @@ class FakeDelegate final : public TarneldSessionDelegate {
     session.updateCombinedSessionID();
     session.syncReportingStates();
   }
-  std::shared_ptr<TarneldSession> parentSessionForChild(TarneldSession& /*child*/) override { return parent; }
-  AgentLock& agentLock() override {
-    ++locksTaken;
-    return lock_;
+  std::shared_ptr<TarneldSession> parentSessionForChild(TarneldSession& /*child*/) override {
+    isParentAskedLocked = isLocked();
+    return parent;
   }
+  AgentLock& agentLock() override { return lock_; }
   std::string description() const override { return "<delegate>"; }
 
   std::optional<Dictionary> storebag;
@@ -55,7 +57,10 @@ class FakeDelegate final : public TarneldSessionDelegate {
   std::shared_ptr<TarneldSession> parent;
   bool throws = false;
   int ancestorLookups = 0;
-  int locksTaken = 0;
+  // Whether the lock was held at the last question of that kind.
+  bool isAncestorAskedLocked = false;
+  bool isParentAskedLocked = false;
+  bool isLocked() { return !isFree(lock_); }
 
  private:
   Journal& journal_;
@@ -67,7 +72,13 @@ class SessionTest : public ::testing::Test {
  protected:
   using Lines = std::vector<std::string>;
 
-  std::shared_ptr<TarneldSession> newSession(const std::shared_ptr<FakeConnection>& to) {
+  // A connection whose client can be called.
+  static std::shared_ptr<FakeIpcConnection> newConnection() {
+    auto made = std::make_shared<FakeIpcConnection>();
+    made->setRemoteObjectInterface();
+    return made;
+  }
+  std::shared_ptr<TarneldSession> newSession(const std::shared_ptr<FakeIpcConnection>& to) {
     return TarneldSession::initWithSessionDelegate(world.dependencies, delegate, to, backends.factory());
   }
   static Dictionary info(int64_t number = 7, bool requireUserInfo = true) {
@@ -108,7 +119,7 @@ class SessionTest : public ::testing::Test {
   FakeWorld world;
   FakeBackends backends;
   std::shared_ptr<FakeDelegate> delegate = std::make_shared<FakeDelegate>(backends.journal);
-  std::shared_ptr<FakeConnection> connection = std::make_shared<FakeConnection>();
+  std::shared_ptr<FakeIpcConnection> connection = newConnection();
   std::shared_ptr<TarneldSession> session = newSession(connection);
 };
 

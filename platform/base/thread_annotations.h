@@ -14,6 +14,7 @@
 #define TARNEL_GUARDED_BY(x) TARNEL_THREAD_ANNOTATION(guarded_by(x))
 #define TARNEL_REQUIRES(...) TARNEL_THREAD_ANNOTATION(requires_capability(__VA_ARGS__))
 #define TARNEL_ACQUIRE(...) TARNEL_THREAD_ANNOTATION(acquire_capability(__VA_ARGS__))
+#define TARNEL_TRY_ACQUIRE(...) TARNEL_THREAD_ANNOTATION(try_acquire_capability(__VA_ARGS__))
 #define TARNEL_RELEASE(...) TARNEL_THREAD_ANNOTATION(release_capability(__VA_ARGS__))
 #define TARNEL_EXCLUDES(...) TARNEL_THREAD_ANNOTATION(locks_excluded(__VA_ARGS__))
 #define TARNEL_NO_THREAD_SAFETY_ANALYSIS TARNEL_THREAD_ANNOTATION(no_thread_safety_analysis)
@@ -25,6 +26,7 @@ namespace tarnel {
 class TARNEL_CAPABILITY("recursive mutex") RecursiveLock {
  public:
   void lock() TARNEL_ACQUIRE() { mutex_.lock(); }
+  bool try_lock() TARNEL_TRY_ACQUIRE(true) { return mutex_.try_lock(); }
   void unlock() TARNEL_RELEASE() { mutex_.unlock(); }
 
  private:

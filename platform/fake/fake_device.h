@@ -65,8 +65,19 @@ class FakeKeepAlive final : public KeepAlive {
  public:
   std::atomic<int> begun{0};
   std::atomic<int> ended{0};
-  void beginTransaction() override { ++begun; }
-  void endTransaction() override { ++ended; }
+  // Begun while open, or ended while closed.
+  std::atomic<bool> turnedTwice{false};
+  void beginTransaction() override {
+    if (isOpen_.exchange(true)) turnedTwice = true;
+    ++begun;
+  }
+  void endTransaction() override {
+    if (!isOpen_.exchange(false)) turnedTwice = true;
+    ++ended;
+  }
+
+ private:
+  std::atomic<bool> isOpen_{false};
 };
 
 }  // namespace tarnel::fake

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <functional>
 #include <map>
 #include <memory>
@@ -28,11 +29,17 @@ struct SentToClient {
 // test's.
 class FakeIpcConnection final : public IpcConnection {
  public:
+  explicit FakeIpcConnection(std::string description = "pid 1, user 1000")
+      : describedAs(std::move(description)) {}
+
   // What the test decides.
-  std::string describedAs = "pid 1, user 1000";
+  std::string describedAs;
   std::map<std::string, bool, std::less<>> entitlements;
   // When set, there is no way to the client and proxies fail with this.
   MaybeError proxyError;
+  // Run when the daemon resumes the connection, and when it asks for the client's object.
+  Handler whenResumed;
+  Handler whenProxyIsAsked;
 
   // What the daemon did.
   std::shared_ptr<ClientSessionInterface> exportedObject;
@@ -40,7 +47,7 @@ class FakeIpcConnection final : public IpcConnection {
   Handler interruptionHandler;
   Handler invalidationHandler;
   bool isResumed = false;
-  bool isInvalidated = false;
+  std::atomic<bool> isInvalidated{false};
 
   std::vector<SentToClient> sentToClient() const {
     const std::lock_guard lock(sent_->mutex);
@@ -53,7 +60,7 @@ class FakeIpcConnection final : public IpcConnection {
   }
   // The client is gone. Runs the handler once and lets go of both handlers and the object.
   void invalidate() {
-    if (std::exchange(isInvalidated, true)) return;
+    if (isInvalidated.exchange(true)) return;
     interruptionHandler = nullptr;
     if (const Handler handler = std::exchange(invalidationHandler, nullptr)) handler();
     exportedObject.reset();
@@ -70,9 +77,13 @@ class FakeIpcConnection final : public IpcConnection {
   void setRemoteObjectInterface() override { hasRemoteObjectInterface = true; }
   void setInterruptionHandler(Handler handler) override { interruptionHandler = std::move(handler); }
   void setInvalidationHandler(Handler handler) override { invalidationHandler = std::move(handler); }
-  void resume() override { isResumed = true; }
+  void resume() override {
+    isResumed = true;
+    if (whenResumed) whenResumed();
+  }
   std::shared_ptr<ClientSessionReplyInterface> remoteObjectProxyWithErrorHandler(
       ProxyErrorHandler errorHandler) override {
+    if (whenProxyIsAsked) whenProxyIsAsked();
     if (!proxyError && hasRemoteObjectInterface && !isInvalidated) return std::make_shared<Proxy>(sent_);
     if (errorHandler) errorHandler(proxyError.value_or(Error("fake", -1, "no way to the client")));
     return nullptr;
