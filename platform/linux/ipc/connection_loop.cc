@@ -115,7 +115,7 @@ bool ConnectionLoop::wantsInput() {
 }
 
 bool ConnectionLoop::inputAtHand() const {
-  return isFed_ || admitted_ > 0 || mayHaveMore_;
+  return isFed_ || admitted_ > 0 || isNew_ || mayHaveMore_;
 }
 
 // False when the bus is closed.
@@ -123,7 +123,10 @@ bool ConnectionLoop::wait() {
   if (sd_bus_get_events(bus_.get()) < 0) return false;
   const bool isReading = wantsInput();
   const bool isBusy = isReading && inputAtHand();
-  if (!isBusy && inputBegin_ == inputEnd_) buffer_.reset();
+  if (!isBusy && inputBegin_ == inputEnd_) {
+    buffer_.reset();
+    capacity_ = 0;
+  }
   unsigned wanted = outputPending() ? POLLOUT : 0;
   if (isReading && !inputEnded_) wanted |= POLLIN;
   std::array<pollfd, 2> descriptors{pollfd{busFd_, static_cast<short>(wanted), 0},
@@ -165,6 +168,7 @@ bool ConnectionLoop::serve() {
 ConnectionLoop::Pump ConnectionLoop::pump() {
   if (isFed_) return processOnce();
   if (admitted_ > 0) return feed();
+  if (isNew_) return examine();
   return mayHaveMore_ ? receive() : Pump::idle;
 }
 
@@ -187,6 +191,8 @@ ConnectionLoop::Pump ConnectionLoop::processOnce() {
 }
 
 ConnectionLoop::Pump ConnectionLoop::feed() {
+  // A send that failed has closed it; nobody reads the pipe any more.
+  if (sd_bus_is_open(bus_.get()) <= 0) return Pump::over;
   const auto written = write(feed_.get(), buffer_.get() + inputBegin_, admitted_);
   // Parts of messages that the bus has not read yet may fill it.
   if (written < 0 && errno == EAGAIN) {
@@ -201,11 +207,8 @@ ConnectionLoop::Pump ConnectionLoop::feed() {
 }
 
 ConnectionLoop::Pump ConnectionLoop::receive() {
-  if (buffer_ == nullptr) buffer_ = std::make_unique_for_overwrite<char[]>(kBufferBytes);
-  // What is left is part of a fixed header.
-  std::memmove(buffer_.get(), buffer_.get() + inputBegin_, inputEnd_ - inputBegin_);
-  inputEnd_ -= std::exchange(inputBegin_, 0);
-  const size_t room = kBufferBytes - inputEnd_;
+  makeRoom(std::max(kBufferBytes, std::exchange(wanted_, 0)));
+  const size_t room = capacity_ - inputEnd_;
   const auto got = recv(busFd_, buffer_.get() + inputEnd_, room, MSG_DONTWAIT);
   if (got < 0 && errno == ECONNRESET && !peerGone_) {
     // It closed with answers unread. What it had sent comes with the next read.
@@ -216,9 +219,60 @@ ConnectionLoop::Pump ConnectionLoop::receive() {
   if (got == 0) inputEnded_ = true;
   if (got <= 0) return got == 0 || errno == EAGAIN || errno == EINTR ? Pump::idle : Pump::over;
   inputEnd_ += static_cast<size_t>(got);
-  const auto admitted = framer_.admit({buffer_.get(), inputEnd_});
+  isNew_ = true;
+  return Pump::progress;
+}
+
+// What is left in the buffer goes to its front: a part of a message that is to be looked at as a whole.
+void ConnectionLoop::makeRoom(size_t capacity) {
+  const size_t left = inputEnd_ - inputBegin_;
+  if (capacity_ >= capacity) {
+    std::memmove(buffer_.get(), buffer_.get() + inputBegin_, left);
+  } else {
+    auto larger = std::make_unique_for_overwrite<char[]>(capacity);
+    if (left > 0) std::memcpy(larger.get(), buffer_.get() + inputBegin_, left);
+    buffer_ = std::move(larger);
+    capacity_ = capacity;
+  }
+  inputBegin_ = 0;
+  inputEnd_ = left;
+}
+
+std::string_view ConnectionLoop::unadmitted() const {
+  return {buffer_.get() + inputBegin_, inputEnd_ - inputBegin_};
+}
+
+// Looks at what was received. The bus has read everything before it.
+ConnectionLoop::Pump ConnectionLoop::examine() {
+  isNew_ = false;
+  const auto input = unadmitted();
+  if (input.empty()) return Pump::progress;
+  if (!ready_) return admit(input.size());
+  if (!framer_.isBetweenMessages()) return admit(std::min(input.size(), framer_.restOfMessage()));
+  const auto size = framer_.sizeOfNext(input);
+  if (!size) return closing(framer_.refusal());
+  if (*size == 0 || input.size() < std::min(*size, kSendCallStart)) return Pump::progress;
+  const auto message = input.substr(0, *size);
+  if (!mayBeSendCall(message)) return admit(message.size());
+  if (message.size() < *size) {
+    wanted_ = *size;
+    return Pump::progress;
+  }
+  auto call = readSendCall(message);
+  if (!call) return admit(message.size());
+  framer_.passMessage();
+  ++messages_;
+  inputBegin_ += message.size();
+  isNew_ = true;
+  onSendCall(*std::move(call));
+  return Pump::progress;
+}
+
+ConnectionLoop::Pump ConnectionLoop::admit(size_t bytes) {
+  const auto admitted = framer_.admit(unadmitted().substr(0, bytes));
   if (!admitted) return closing(framer_.refusal());
   admitted_ = *admitted;
+  isNew_ = admitted_ > 0;
   return Pump::progress;
 }
 
@@ -271,18 +325,37 @@ int ConnectionLoop::onMessage(sd_bus_message* message) {
   const char* interface = sd_bus_message_get_interface(message);
   if (interface != nullptr && std::strcmp(interface, wire::kSessionInterface) == 0 &&
       std::strcmp(sd_bus_message_get_path(message), wire::kSessionPath) == 0) {
-    onCall(message);
+    carryOut(message, callSessionMethod);
     return 1;
   }
   if (isPeerGone()) return 1;
   return answerGenericTool(message) ? 1 : 0;
 }
 
-void ConnectionLoop::onCall(sd_bus_message* message) {
+// The library's way of answering needs a message; this one stands for what it has not read.
+void ConnectionLoop::onSendCall(SendCall call) {
+  sd_bus_message* made = nullptr;
+  int r = sd_bus_message_new_method_call(bus_.get(), &made, nullptr, wire::kSessionPath,
+                                         wire::kSessionInterface, call.member());
+  const BusMessage message(made);
+  if (r >= 0) r = sd_bus_message_set_expect_reply(made, call.wantsReply ? 1 : 0);
+  if (r >= 0) r = sd_bus_message_seal(made, call.serial, 0);
+  if (r < 0) {
+    setup_.link->stop(std::string("its call cannot be answered: ") + strerror(-r));
+    return;
+  }
+  carryOut(made, [&call](const SessionCall& sessionCall) -> MaybeError {
+    runSendCall(sessionCall, std::move(call));
+    return std::nullopt;
+  });
+}
+
+template <class Run>
+void ConnectionLoop::carryOut(sd_bus_message* message, Run run) {
   current_ = message;
   currentSerial_ = ++lastSerial_;
   currentAbandoned_ = false;
-  runCall(message);
+  runCall(message, run);
   // Answered later, from whichever thread.
   const bool owed = current_ != nullptr && sd_bus_message_get_expect_reply(message) > 0;
   current_ = nullptr;
@@ -294,10 +367,11 @@ void ConnectionLoop::onCall(sd_bus_message* message) {
   }
 }
 
-void ConnectionLoop::runCall(sd_bus_message* message) {
+template <class Run>
+void ConnectionLoop::runCall(sd_bus_message* message, Run run) {
   const SessionCall call{message, *setup_.object, setup_.link, currentSerial_, setup_.peer, setup_.log};
   try {
-    if (const MaybeError error = callSessionMethod(call)) {
+    if (const MaybeError error = run(call)) {
       current_ = nullptr;
       refuse(message, error->domain().c_str(), error->localizedDescription());
     }

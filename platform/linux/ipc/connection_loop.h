@@ -8,6 +8,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 
 #include "platform/base/error.h"
@@ -17,6 +18,7 @@
 #include "platform/linux/ipc/connection_link.h"
 #include "platform/linux/ipc/input_framer.h"
 #include "platform/linux/ipc/ipc_limits.h"
+#include "platform/linux/ipc/send_call.h"
 #include "platform/linux/unique_fd.h"
 
 namespace tarnel {
@@ -32,7 +34,8 @@ using BusMessage = std::unique_ptr<sd_bus_message, UnrefBusMessage>;
 // The inside of a connection's thread: reads the client's calls, runs them, writes the answers.
 //
 // The socket is read here and its bytes are fed to the bus object through a pipe: the library by itself
-// reads messages of up to 128 MiB, in one go for as long as the peer keeps sending. One call is carried out
+// reads messages of up to 128 MiB, in one go for as long as the peer keeps sending. The calls that send
+// messages pass it by, unless something about them is unusual; see send_call.h. One call is carried out
 // at a time, and none while an earlier answer still waits for the client to read, so that a client holds no
 // more of us than a message and an answer. Descriptors that come along are never taken out of the socket; the
 // kernel closes them.
@@ -98,6 +101,10 @@ class ConnectionLoop {
   Pump processOnce();
   Pump feed();
   Pump receive();
+  Pump examine();
+  Pump admit(size_t bytes);
+  std::string_view unadmitted() const;
+  void makeRoom(size_t capacity);
   bool inputAtHand() const;
   bool wantsInput();
   bool outputPending();
@@ -110,8 +117,11 @@ class ConnectionLoop {
   Pump closing(const std::string& why);
 
   int onMessage(sd_bus_message* message);
-  void onCall(sd_bus_message* message);
-  void runCall(sd_bus_message* message);
+  void onSendCall(SendCall call);
+  template <class Run>
+  void carryOut(sd_bus_message* message, Run run);
+  template <class Run>
+  void runCall(sd_bus_message* message, Run run);
   void callFailed(sd_bus_message* message, const char* what);
   BusMessage takeCall(uint64_t serial);
   MaybeError newClientCall(const char* member, BusMessage& message);
@@ -129,12 +139,15 @@ class ConnectionLoop {
   // admitted_ may be fed. There is no buffer while the connection is idle.
   InputFramer framer_{wire::kMaxMessageBytes};
   std::unique_ptr<char[]> buffer_;
+  size_t capacity_ = 0;
+  size_t wanted_ = 0;  // capacity that the message at hand needs
   size_t inputBegin_ = 0;
   size_t inputEnd_ = 0;
   size_t admitted_ = 0;
+  bool isNew_ = false;        // what is in the buffer and not admitted has not been looked at
   bool mayHaveMore_ = false;  // the socket, since the last read filled the buffer
   bool isFed_ = false;        // the bus may have something to read
-  uint64_t messages_ = 0;     // that the bus has read
+  uint64_t messages_ = 0;     // that were read, by the bus or past it
 
   // The call whose method runs now.
   sd_bus_message* current_ = nullptr;

@@ -23,9 +23,10 @@ std::optional<size_t> InputFramer::admit(std::string_view bytes) {
   size_t admitted = authenticating_ ? admitAuthentication(bytes) : 0;
   while (!authenticating_ && admitted < bytes.size()) {
     if (restOfMessage_ == 0) {
-      const auto header = bytes.substr(admitted);
-      if (header.size() < kFixedHeader) break;
-      if (!beginMessage(header)) return std::nullopt;
+      const auto size = sizeOfNext(bytes.substr(admitted));
+      if (!size) return std::nullopt;
+      if (*size == 0) break;
+      restOfMessage_ = *size;
     }
     const size_t step = std::min(restOfMessage_, bytes.size() - admitted);
     admitted += step;
@@ -50,11 +51,12 @@ size_t InputFramer::admitAuthentication(std::string_view bytes) {
   return bytes.size();
 }
 
-bool InputFramer::beginMessage(std::string_view header) {
+std::optional<size_t> InputFramer::sizeOfNext(std::string_view header) {
+  if (header.size() < kFixedHeader) return 0;
   const char order = header.front();
   if (order != 'l' && order != 'B') {
     refusal_ = "it broke the protocol: no message begins with this byte";
-    return false;
+    return std::nullopt;
   }
   const uint64_t body = numberAt(header, 4, order == 'l');
   const uint64_t fields = numberAt(header, 12, order == 'l');
@@ -62,10 +64,9 @@ bool InputFramer::beginMessage(std::string_view header) {
   if (size > maxMessageBytes_) {
     refusal_ = "a message of " + std::to_string(size) + " bytes exceeds the limit of " +
                std::to_string(maxMessageBytes_) + " bytes";
-    return false;
+    return std::nullopt;
   }
-  restOfMessage_ = size;
-  return true;
+  return size;
 }
 
 }  // namespace tarnel

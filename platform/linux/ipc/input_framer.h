@@ -21,13 +21,21 @@ class InputFramer {
   std::optional<size_t> admit(std::string_view bytes);
   const std::string& refusal() const noexcept { return refusal_; }
 
+  // True when the next byte begins a message.
+  bool isBetweenMessages() const noexcept { return !authenticating_ && restOfMessage_ == 0; }
+  // Bytes of the message begun that were not admitted yet.
+  size_t restOfMessage() const noexcept { return restOfMessage_; }
+  // Between messages: the size of the one that begins with these bytes, 0 while they are too few to tell.
+  // Nothing when it is refused.
+  std::optional<size_t> sizeOfNext(std::string_view bytes);
+  // Between messages: the next one is not handed on at all; it counts as admitted.
+  void passMessage() noexcept { ++completed_; }
+
   // Messages that were admitted to their last byte.
   uint64_t completed() const noexcept { return completed_; }
 
  private:
   size_t admitAuthentication(std::string_view bytes);
-  // False when refused.
-  bool beginMessage(std::string_view header);
 
   const size_t maxMessageBytes_;
   bool authenticating_ = true;

@@ -252,7 +252,8 @@ bool readHeader(Cursor& in, SendCall& call, Header& header, uint32_t& bodySize) 
   constexpr uint8_t kNoReply = 1;
   if (order != 'l' || type != kMethodCall || (flags & ~kNoReply) != 0 || version != 1) return false;
   size_t fieldsEnd = 0;
-  if (!in.number(bodySize) || !in.number(call.serial) || call.serial == 0 || !in.array(8, fieldsEnd)) return false;
+  if (!in.number(bodySize) || !in.number(call.serial) || call.serial == 0 || !in.array(8, fieldsEnd))
+    return false;
   while (in.at() < fieldsEnd) {
     if (!readField(in, header)) return false;
   }
@@ -279,6 +280,18 @@ bool readBody(Cursor& in, const Header& header, SendCall& call) {
 }
 
 }  // namespace
+
+const char* SendCall::member() const noexcept {
+  switch (kind) {
+    case Kind::message:
+      return wire::kSendMessage.name;
+    case Kind::dictionary:
+      return wire::kSendMessageDictionary.name;
+    case Kind::batch:
+      break;
+  }
+  return wire::kSendMessages.name;
+}
 
 bool mayBeSendCall(std::string_view start) {
   return std::endian::native == std::endian::little && start.size() > kFixedHeader && start[0] == 'l' &&

@@ -25,6 +25,8 @@ struct SendCall {
   bool wantsReply = true;
   std::vector<BatchedMessage> messages;  // one unless it is a batch
   Dictionary dictionary;                 // of a call that sends one
+
+  const char* member() const noexcept;
 };
 
 // Bytes of a message's start that tell whether readSendCall may take it.

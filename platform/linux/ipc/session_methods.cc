@@ -10,6 +10,7 @@
 #include "platform/ipc/wire.h"
 #include "platform/linux/ipc/connection_loop.h"
 #include "platform/linux/ipc/message_batch.h"
+#include "platform/linux/ipc/send_call.h"
 
 namespace tarnel {
 namespace {
@@ -214,6 +215,19 @@ MaybeError callSessionMethod(const SessionCall& call) {
   }
   return Error(SD_BUS_ERROR_UNKNOWN_METHOD, -1,
                "Unknown method " + std::string(member) + "; introspection lists the methods.");
+}
+
+void runSendCall(const SessionCall& call, SendCall sendCall) {
+  switch (sendCall.kind) {
+    case SendCall::Kind::batch:
+      return runBatch(call, std::move(sendCall.messages));
+    case SendCall::Kind::dictionary:
+      return call.session.sendMessageWithDictionary(std::move(sendCall.dictionary), sentReply(call));
+    case SendCall::Kind::message:
+      auto& message = sendCall.messages.front();
+      return call.session.sendMessageWithCategory(message.category, message.type, std::move(message.payload),
+                                                  sentReply(call));
+  }
 }
 
 std::string describeSessionInterface() {

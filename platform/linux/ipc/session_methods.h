@@ -13,6 +13,8 @@ struct sd_bus_message;
 
 namespace tarnel {
 
+struct SendCall;
+
 // One call of the session's interface, as it came.
 struct SessionCall {
   sd_bus_message* message;
@@ -27,6 +29,9 @@ struct SessionCall {
 // Returns what to answer at once instead: an unknown method, or arguments that are not right. Lets through
 // what the session throws. On the connection's thread.
 MaybeError callSessionMethod(const SessionCall& call);
+
+// The same for a call that was read already.
+void runSendCall(const SessionCall& call, SendCall sendCall);
 
 // The session's interface as introspection describes it.
 std::string describeSessionInterface();
