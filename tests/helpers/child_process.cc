@@ -67,11 +67,12 @@ struct Image {
 
   void writeListenPid(pid_t pid) {
     if (listenPid == 0) return;
-    char* end = texts[listenPid].data() + texts[listenPid].size();
-    for (char* digit = end; *--digit != '=';) {
-      *digit = static_cast<char>('0' + pid % 10);
-      pid /= 10;
-    }
+    std::array<char, 16> digits{};
+    size_t count = 0;
+    for (; pid > 0; pid /= 10) digits[count++] = static_cast<char>('0' + pid % 10);
+    char* at = texts[listenPid].data() + texts[listenPid].find('=') + 1;
+    while (count > 0) *at++ = digits[--count];
+    *at = '\0';
   }
 
   UniqueFd program;

@@ -7,8 +7,10 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
+#include <cstdlib>
 #include <stdexcept>
 
 #include "platform/document.h"
@@ -159,6 +161,12 @@ std::vector<Dictionary> LabProcess::waitForEvents(size_t count) const {
   waitUntil([count](const std::vector<Dictionary>& arrivals) { return arrivals.size() >= count; });
   auto arrivals = events();
   EXPECT_GE(arrivals.size(), count);
+  // Posts travel on several connections, where one may overtake another.
+  std::stable_sort(arrivals.begin(), arrivals.end(), [](const Dictionary& a, const Dictionary& b) {
+    const Value* first = findNumber(a, "postTime");
+    const Value* second = findNumber(b, "postTime");
+    return (first != nullptr ? first->doubleValue() : 0) < (second != nullptr ? second->doubleValue() : 0);
+  });
   return arrivals;
 }
 

@@ -49,11 +49,12 @@ class LabProcess {
 
   // Forgets what arrived so far and behaves well again.
   void reset();
-  // What arrived since then, in order: {"path", "headers", "clientId", "postTime", "event", ...}.
+  // What arrived since then, in the order of arrival: {"path", "headers", "clientId", "postTime", "event", ...}.
   std::vector<Dictionary> events() const;
   // Posts with "problems" and without "event".
   std::vector<Dictionary> posts() const;
-  // Waits until as many events have arrived; a failure of the test when they do not. What there is then.
+  // Waits until as many events have arrived; a failure of the test when they do not. What there is then, in
+  // the order in which it was posted.
   std::vector<Dictionary> waitForEvents(size_t count) const;
   // Waits for events of which the condition holds.
   bool waitUntil(const std::function<bool(const std::vector<Dictionary>&)>& holds) const;
