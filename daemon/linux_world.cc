@@ -133,6 +133,8 @@ struct LinuxWorld::Prepared {
                                   .files = files,
                                   .clientBundle = clientBundle,
                                   .keepAlive = keepAlive,
+                                  .codeBundles = codeBundles,
+                                  .powerLog = powerLog,
                                   .consentIdentifiers = consentIdentifiers,
                                   .process = process,
                                   .messageLogDirectory = directories.messageLogDirectory()};
@@ -162,6 +164,7 @@ void LinuxWorld::prepareForConfinement() {
   world.report(world.directories.problems());
   world.report(world.configuration.problems);
   world.report(world.directories.create());
+  world.report(world.clientBundle.problems());
   if (const auto failure = world.curl.prepare()) {
     TARNEL_LOG(*log_, warning, "main: %s", failure->localizedDescription().c_str());
   }

@@ -186,6 +186,12 @@ TEST_F(AgentHierarchy, OnlyTheFirstOfALevelCountsAndGapsDoNotMatter) {
   EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*deep.session), middle.session);
 }
 
+TEST_F(AgentHierarchy, AncestorsStandAtLevelZeroAndBelow) {
+  const Client odd = start("O", 1, -1, true);
+  const Client child = start("B", 2, 1);
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*child.session), nullptr);
+}
+
 TEST_F(AgentHierarchy, AncestorOfASessionWithoutUserInfoIsNone) {
   const Client a = connect();
   a.session->setSessionInfo(info(5, 8), std::nullopt, std::nullopt, false);
@@ -249,6 +255,17 @@ TEST_F(AgentHierarchy, LateParentLabelsAndSyncsTheDeeperSessions) {
   EXPECT_EQ(backendOf(grandchild).combinedSessionIDString(), "A.B.C");
   EXPECT_EQ(backendOf(child).samplingThreshold(), Value(0.25));
   EXPECT_EQ(backendOf(grandchild).samplingThreshold(), Value(0.25));
+}
+
+TEST_F(AgentHierarchy, AChildThatStartsUnderItsParentTakesItsState) {
+  backends.scripts[kTarnelBackendHTTPPost].decides = ReportingState::disabled;
+  backends.scripts[kTarnelBackendHTTPPost].threshold = Value(0.25);
+  start("A", 1, 0);
+  backends.scripts[kTarnelBackendHTTPPost].decides = ReportingState::enabled;
+  backends.scripts[kTarnelBackendHTTPPost].threshold = Value(0.75);
+  const Client child = start("B", 2, 1);
+  EXPECT_EQ(backendOf(child).state(), ReportingState::disabled);
+  EXPECT_EQ(backendOf(child).samplingThreshold(), Value(0.25));
 }
 
 TEST_F(AgentHierarchy, SessionsOfTheSameLevelAndAboveAreLeftAlone) {

@@ -112,6 +112,7 @@ TEST_F(SessionFlush, AllSessionsShareOneLock) {
   // The completion runs under the lock; taking it again on the same thread must not hang.
   bool ran = false;
   session->flushMessagesWithCompletion([&ran](MaybeString /*text*/, MaybeError /*error*/) {
+    EXPECT_FALSE(isFree(TarneldSession::classLock()));
     const LockGuard guard(TarneldSession::classLock());
     ran = true;
   });

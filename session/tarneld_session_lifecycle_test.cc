@@ -176,7 +176,11 @@ TEST_F(SessionLifecycle, FetchStatesTakesTheUserInfoFirst) {
   offer({kTarnelBackendHTTPPost, kTarnelBackendDashboard, kTarnelBackendDravik});
   backends.scripts[kTarnelBackendDashboard].decides = ReportingState::disabled;
   backends.scripts[kTarnelBackendDravik].decides = ReportingState::sampledOut;
+  backends.scripts[kTarnelBackendVesmer];
+  delegate->storebag->set(kTarnelBackendVesmer, Dictionary());
   configureAndStart();
+  // The new user info decides the states anew; the answer tells of these.
+  backends.scripts[kTarnelBackendVesmer].decides = ReportingState::disabled;
   std::optional<std::vector<std::string>> names;
   session->fetchStatesWithUserInfo(
       user("Other"), [&names](std::optional<std::vector<std::string>> given) { names = std::move(given); });
