@@ -218,9 +218,12 @@ TEST_F(StorebagTest, VersionIsHandedOut) {
 
 TEST_F(StorebagTest, MissingVersionIsAnInvalidArgument) {
   version_ = "old";
-  serve(storebagWithout("version"));
+  auto inner = storebagWithout("version");
+  inner.set("refresh_cycle", 600);
+  serve(inner);
   EXPECT_THROW(fetch(), InvalidArgument);
   EXPECT_EQ(version_, "old");
+  EXPECT_EQ(maxAge_, 86400) << "the version comes before the refresh cycle";
   EXPECT_TRUE(complaints().empty());
 }
 

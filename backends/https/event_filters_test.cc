@@ -84,6 +84,13 @@ TEST_F(EventFiltersTest, AbsentMethodAndStatusOfAnEventCountAsZero) {
   EXPECT_EQ(filtered({{"a", "v"}, {"b", "v"}}), (Dictionary{{"b", "v"}}));
 }
 
+TEST_F(EventFiltersTest, ZeroIsANumberLikeAnyOther) {
+  create({Dictionary{{"method", 0}, {"key", "a"}, {"action", "remove"}},
+          Dictionary{{"status", 0}, {"key", "b"}, {"action", "remove"}}});
+  const Dictionary other{{"a", "v"}, {"b", "v"}, {"_method", 5}, {"_status", 7}};
+  EXPECT_EQ(filtered(other), other);
+}
+
 TEST_F(EventFiltersTest, MethodAndStatusAreThoseBeforeTheFilter) {
   create({describe("_method", "remove"), describe("_status", "sha256"),
           Dictionary{{"method", 5}, {"status", 7}, {"key", "z"}, {"action", "remove"}}});

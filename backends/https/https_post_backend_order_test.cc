@@ -102,6 +102,15 @@ TEST_F(HTTPSPostBackendOrderTest, RealtimeStopMessageAfterABatch) {
              debug("HTTPSPostBackend(sendMessage): Sending 2, 1, 1")}));
 }
 
+TEST_F(HTTPSPostBackendOrderTest, RealtimeMessageIsPostedThoughTheServerRefusedTheBatchBeforeIt) {
+  const auto backend = makeUpdated();
+  send(*backend);
+  world.http.setAnswer(fake::FakeHttpClient::status(500));
+  send(*backend, 3, Flag::realtime);
+  EXPECT_EQ(world.http.requests().size(), 2U);
+  expectLog(LogLevel::debug, "HTTPSPostBackend(sendMessage): Sending 1, 1, 1");
+}
+
 TEST_F(HTTPSPostBackendOrderTest, BatchThatIsDiscardedOrKeptIsNotSaidToBeFlushed) {
   const auto backend = makeUpdated();
   send(*backend);
