@@ -55,12 +55,8 @@ TarneldSession::~TarneldSession() {
 void TarneldSession::dealloc() noexcept {
   if (std::exchange(ended_, true)) return;
   TARNEL_LOG(dependencies_.log, debug, "dealloc: TarneldSession dealloc: %u", sessionID());
-  try {
-    endSession();
-  } catch (const std::exception& failure) {
-    TARNEL_LOG(dependencies_.log, error, "dealloc: session %u did not end in order: %s", sessionID(),
-               failure.what());
-  }
+  attempt(&TarneldSession::sayFarewell);
+  attempt(&TarneldSession::cleanUp);
   reporting_.replaceBackends({});
   _backends = {};
   _periodicServices.reset();
@@ -69,12 +65,25 @@ void TarneldSession::dealloc() noexcept {
   _sessionDelegate.reset();
 }
 
-void TarneldSession::endSession() {
+// Whatever one step comes to, the next is done.
+void TarneldSession::attempt(void (TarneldSession::*step)()) noexcept {
+  try {
+    (this->*step)();
+  } catch (const std::exception& failure) {
+    TARNEL_LOG(dependencies_.log, error, "dealloc: session %u did not end in order: %s", sessionID(),
+               failure.what());
+  }
+}
+
+void TarneldSession::sayFarewell() {
   Dictionary payload;
   if (_storebagVersion) payload.set("StorebagVersion", *_storebagVersion);
   internalSendMessage(payload, dependencies_.clock.timeOfDay(), kInternalMethod, kStop);
   flushMessagesWithCompletion(nullptr);
   shutdownSessionAggregation();
+}
+
+void TarneldSession::cleanUp() {
   _sessionInfo.reset();
   setUserInfo(std::nullopt);
   _frameworks.reset();

@@ -155,7 +155,9 @@ class TarneldSession final : public ClientSessionInterface,
   MaybeDictionary withUserInfo(const MaybeDictionary& payload) const;
   // The backends as they are to be used now: with everything applied that other sessions noted.
   const BackendSet& currentBackends();
-  void endSession();
+  void attempt(void (TarneldSession::*step)()) noexcept;
+  void sayFarewell();
+  void cleanUp();
 
   const Dependencies& dependencies_;
   BackendFactory backendFactory_;

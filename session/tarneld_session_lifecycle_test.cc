@@ -1,6 +1,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <stdexcept>
+
 #include "session/test_session_fixture.h"
 
 namespace tarnel::fake {
@@ -281,6 +283,15 @@ TEST_F(SessionLifecycle, DeallocStopsFlushesShutsDownAndCleansUpInThatOrder) {
   EXPECT_FALSE(session->storebagVersion());
   EXPECT_FALSE(session->userInfo());
   EXPECT_FALSE(session->sessionInfo());
+}
+
+TEST_F(SessionLifecycle, AFarewellThatFailsIsLoggedAndTheBackendsAreCleanedUp) {
+  offer({kTarnelBackendHTTPPost});
+  configureAndStart(true);
+  connection->whenProxyIsAsked = [] { throw std::runtime_error("no memory"); };
+  session.reset();
+  EXPECT_TRUE(logged(LogLevel::error, "dealloc: session 7 did not end in order: no memory"));
+  EXPECT_THAT(backends.journal.lines(), ElementsAre("httppost cleanup"));
 }
 
 TEST_F(SessionLifecycle, DeallocHappensOnce) {
