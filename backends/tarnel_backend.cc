@@ -48,11 +48,11 @@ std::string TarnelBackend::convertIntoSHA256(std::string_view text) {
   static constexpr std::string_view kDigits = "0123456789abcdef";
   const auto covered = text.substr(0, std::min(text.size(), utf16Length(text)));
   const auto* bytes = reinterpret_cast<const uint8_t*>(covered.data());
-  std::string digits;
-  digits.reserve(64);
+  std::string digits(64, '0');
+  size_t at = 0;
   for (const uint8_t byte : sha256({bytes, covered.size()})) {
-    digits += kDigits[byte >> 4U];
-    digits += kDigits[byte & 15U];
+    digits[at++] = kDigits[byte >> 4U];
+    digits[at++] = kDigits[byte & 15U];
   }
   return digits;
 }

@@ -42,8 +42,8 @@ Dictionary HTTPSPostBackend::newEventDictfromPayload(const MaybeDictionary& payl
   // Only the offset into the session is sent, so that its exact start stays on the device.
   const double clientTS =
       finiteOrMinusOne(static_cast<double>(startTS) + (secondsFromTimeValue(timestamp) - startTimeStamp()));
-  Dictionary event = payload.value_or(Dictionary());
-  event.reserve(event.size() + kStandardFields + (userInfoDict() ? userInfoDict()->size() : 0));
+  const size_t more = kStandardFields + (userInfoDict() ? userInfoDict()->size() : 0);
+  Dictionary event = (payload ? *payload : Dictionary()).copyWithRoomFor(more);
   event.set("_startTS", startTS);
   event.set("_sender", senderName(compType()));
   event.set("_clientVersion", clientVersion());

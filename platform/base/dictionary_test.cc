@@ -174,5 +174,47 @@ TEST(DictionaryTest, lookupsByTypeGiveNothingForAnotherType) {
   EXPECT_EQ(findNumber(dictionary, "absent"), nullptr);
 }
 
+// Same length, same first, middle and last letter.
+TEST(DictionaryTest, tellsKeysApartThatLookAlike) {
+  Dictionary dictionary = {{"a1c2e", 1}};
+  EXPECT_EQ(dictionary.find("a2c1e"), nullptr);
+  dictionary.set("a2c1e", 2);
+  EXPECT_EQ(dictionary.size(), 2U);
+  EXPECT_TRUE(dictionary.remove("a1c2e"));
+  EXPECT_EQ(dictionary.find("a1c2e"), nullptr);
+  EXPECT_EQ(*dictionary.find("a2c1e"), Value(2));
+  dictionary.set("a1c2e", 3);
+  EXPECT_EQ(keysOf(dictionary), (std::vector<std::string>{"a2c1e", "a1c2e"}));
+}
+
+TEST(DictionaryTest, findsKeysOfEveryShapeAndLength) {
+  Dictionary dictionary;
+  std::vector<std::string> keys;
+  for (size_t length = 0; length < 60; ++length) keys.emplace_back(length, static_cast<char>(0xC8 - length));
+  for (const auto& key : keys) EXPECT_EQ(dictionary.find(key), nullptr);
+  for (const auto& key : keys) dictionary.set(key, key.size());
+  const Dictionary shared = dictionary;
+  dictionary.editEntries([](const std::string& key, Value&) { return key.size() % 2 == 0; });
+  for (const auto& key : keys) {
+    EXPECT_EQ(dictionary.contains(key), key.size() % 2 == 0);
+    EXPECT_EQ(*shared.find(key), Value(key.size()));
+  }
+}
+
+TEST(DictionaryTest, aCopyWithRoomIsIndependentAndWhole) {
+  for (const size_t count : {size_t{0}, size_t{3}, size_t{100}}) {
+    const Dictionary original = numbered(count);
+    Dictionary copy = original.copyWithRoomFor(10);
+    EXPECT_EQ(copy, original);
+    const auto* first = copy.begin();
+    for (int i = 0; i < 10; ++i) copy.set("more" + std::to_string(i), i);
+    EXPECT_EQ(copy.begin(), first);
+    copy.set("key0", "changed");
+    EXPECT_EQ(original.size(), count);
+    EXPECT_EQ(original, numbered(count));
+    EXPECT_EQ(*copy.find("more9"), Value(9));
+  }
+}
+
 }  // namespace
 }  // namespace tarnel

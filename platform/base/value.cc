@@ -176,7 +176,16 @@ const Dictionary::Entry* Dictionary::end() const noexcept {
   return storage_.get() == nullptr ? nullptr : begin() + storage_.get()->entries.size();
 }
 
+unsigned Dictionary::KeySieve::bitOf(std::string_view key) noexcept {
+  if (key.empty()) return 0;
+  const auto letter = [key](size_t at) { return uint32_t{static_cast<uint8_t>(key[at])}; };
+  const uint32_t mixed = letter(0) | letter(key.size() / 2) << 8U | letter(key.size() - 1) << 16U |
+                         static_cast<uint32_t>(key.size() << 24U);
+  return mixed * 0x9E3779B1U >> 24U;
+}
+
 const Dictionary::Entry* Dictionary::findIn(const Storage& storage, std::string_view key) {
+  if (!storage.sieve.mayHold(key)) return nullptr;
   if (!storage.index.empty()) {
     const auto found = storage.index.find(std::string(key));
     return found == storage.index.end() ? nullptr : &storage.entries[found->second];
@@ -207,6 +216,7 @@ void Dictionary::set(std::string_view key, Value value) {
     return;
   }
   storage.entries.emplace_back(key, std::move(value));
+  storage.sieve.add(storage.entries.back().first);
   if (!storage.index.empty()) {
     storage.index.emplace(storage.entries.back().first, storage.entries.size() - 1);
   } else if (storage.entries.size() > kIndexThreshold) {
@@ -244,6 +254,18 @@ void Dictionary::editEntries(const std::function<bool(const std::string& key, Va
 
 void Dictionary::reserve(size_t count) {
   storage_.write().entries.reserve(count);
+}
+
+Dictionary Dictionary::copyWithRoomFor(size_t count) const {
+  Dictionary copy;
+  auto& storage = copy.storage_.write();
+  storage.entries.reserve(size() + count);
+  if (const Storage* own = storage_.get()) {
+    storage.entries.insert(storage.entries.end(), own->entries.begin(), own->entries.end());
+    storage.sieve = own->sieve;
+    storage.index = own->index;
+  }
+  return copy;
 }
 
 bool operator==(const Dictionary& a, const Dictionary& b) {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <array>
 #include <compare>
 #include <concepts>
 #include <cstddef>
@@ -86,13 +87,33 @@ class Dictionary {
   // Changes all entries in one pass. `visit` may write the value; entries for which it returns false go.
   void editEntries(const std::function<bool(const std::string& key, Value& value)>& visit);
   void reserve(size_t count);
+  // A copy that takes `count` more entries without moving its own.
+  Dictionary copyWithRoomFor(size_t count) const;
 
   // Equal when both hold equal values under the same keys; the order does not matter.
   friend bool operator==(const Dictionary& a, const Dictionary& b);
 
  private:
+  // Which keys may be there: a key whose bit is not set is not. Removing a key leaves its bit.
+  class KeySieve {
+   public:
+    bool mayHold(std::string_view key) const noexcept {
+      const unsigned bit = bitOf(key);
+      return (bits_[bit / 64] >> (bit % 64) & 1U) != 0;
+    }
+    void add(std::string_view key) noexcept {
+      const unsigned bit = bitOf(key);
+      bits_[bit / 64] |= uint64_t{1} << (bit % 64);
+    }
+
+   private:
+    // Of 256, from the length and three of the letters.
+    static unsigned bitOf(std::string_view key) noexcept;
+    std::array<uint64_t, 4> bits_{};
+  };
   struct Storage {
     std::vector<Entry> entries;
+    KeySieve sieve;
     std::unordered_map<std::string, size_t> index;  // key to position; empty while not needed
   };
   static const Entry* findIn(const Storage& storage, std::string_view key);
