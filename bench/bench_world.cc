@@ -1,6 +1,7 @@
 #include "bench/bench_world.h"
 
 #include <sys/socket.h>
+#include <unistd.h>
 
 #include <array>
 #include <stdexcept>
@@ -54,36 +55,16 @@ class OneStorebag final : public TarneldSessionDelegate {
   AgentLock lock_;
 };
 
-Dependencies withHttp(const Dependencies& from, HttpClient& http) {
-  return {.log = from.log,
-          .clock = from.clock,
-          .random = from.random,
-          .http = http,
-          .deviceInformation = from.deviceInformation,
-          .settings = from.settings,
-          .consent = from.consent,
-          .locale = from.locale,
-          .files = from.files,
-          .clientBundle = from.clientBundle,
-          .keepAlive = from.keepAlive,
-          .consentIdentifiers = from.consentIdentifiers,
-          .process = from.process,
-          .messageLogDirectory = from.messageLogDirectory};
-}
-
 void check(int result, const char* what) {
   if (result < 0) throw std::runtime_error(what);
 }
 
 }  // namespace
 
-BenchWorld::BenchWorld() : dependencies(withHttp(fakes.dependencies, http)) {
-  fakes.log.setActiveLevel(LogLevel::information);
-}
-
 void BenchWorld::forget() {
   fakes.log.clear();
   fakes.files.files.clear();
+  fakes.http.clear();
 }
 
 std::shared_ptr<HTTPSPostBackend> makeBackend(BenchWorld& world, MessageLog messageLog) {
@@ -128,7 +109,8 @@ SealedMessages::SealedMessages() {
   sd_bus* bus = nullptr;
   check(sd_bus_new(&bus), "sd_bus_new");
   bus_.reset(bus);
-  check(sd_bus_set_fd(bus, ends[0], ends[1]), "sd_bus_set_fd");
+  check(sd_bus_set_fd(bus, ends[0], ends[0]), "sd_bus_set_fd");
+  peer_.reset(ends[1]);
   check(sd_bus_start(bus), "sd_bus_start");
 }
 
@@ -149,19 +131,47 @@ SealedMessages::Message SealedMessages::single(size_t index) {
   return message;
 }
 
-SealedMessages::Message SealedMessages::batch(size_t count) {
+SealedMessages::Message SealedMessages::unsealedBatch(size_t first) {
   auto message = newCall(wire::kSendMessages.name);
   check(sd_bus_message_open_container(message.get(), 'a', "(qquaa{sv})"), "open batch");
-  for (size_t i = 0; i < count; ++i) {
+  for (size_t i = 0; i < kBatch; ++i) {
     check(sd_bus_message_open_container(message.get(), 'r', "qquaa{sv}"), "open message");
     check(sd_bus_message_append(message.get(), "qqu", 13, 10, 0), "append");
-    if (wire::appendMaybeDictionary(message.get(), callPayload(i)))
+    if (wire::appendMaybeDictionary(message.get(), callPayload(first + i)))
       throw std::runtime_error("append payload");
     check(sd_bus_message_close_container(message.get()), "close message");
   }
   check(sd_bus_message_close_container(message.get()), "close batch");
+  return message;
+}
+
+SealedMessages::Message SealedMessages::batch(size_t first) {
+  auto message = unsealedBatch(first);
   check(sd_bus_message_seal(message.get(), 1, 0), "seal");
   return message;
+}
+
+// The library shows a message's bytes to nobody but a peer.
+std::string SealedMessages::batchBytes(size_t first) {
+  SealedMessages bus;
+  constexpr std::string_view kHandshake = "DATA\r\nOK 0123456789abcdef0123456789abcdef\r\nAGREE_UNIX_FD\r\n";
+  check(static_cast<int>(::write(bus.peer_.get(), kHandshake.data(), kHandshake.size())), "handshake");
+  while (sd_bus_is_ready(bus.bus_.get()) <= 0) check(sd_bus_process(bus.bus_.get(), nullptr), "handshake");
+  std::string bytes;
+  const auto readSome = [&] {
+    std::array<char, 65536> some{};
+    const auto got = ::read(bus.peer_.get(), some.data(), some.size());
+    if (got > 0) bytes.append(some.data(), static_cast<size_t>(got));
+    return got > 0;
+  };
+  while (readSome()) {
+  }
+  bytes.clear();
+  const auto message = bus.unsealedBatch(first);
+  check(sd_bus_send(bus.bus_.get(), message.get(), nullptr), "send");
+  while (readSome() || sd_bus_process(bus.bus_.get(), nullptr) > 0) {
+  }
+  return bytes;
 }
 
 }  // namespace tarnel::bench

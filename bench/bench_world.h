@@ -12,6 +12,7 @@
 #include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
 #include "platform/ipc/dbus_codec.h"
+#include "platform/linux/unique_fd.h"
 #include "session/tarneld_session.h"
 
 namespace tarnel::bench {
@@ -26,21 +27,14 @@ inline void reportPerMessage(benchmark::State& state, size_t messagesPerIteratio
       benchmark::Counter(messages, benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
 }
 
-// Takes every post and answers it at once.
-class AcceptingHttpClient final : public HttpClient {
- public:
-  void startDataTask(HttpRequest request, Completion completion) override {
-    bytes_ += request.body == nullptr ? 0 : request.body->size();
-    ++posts_;
-    completion(HttpResult{std::string(), HttpResponse{200, {}}, std::nullopt});
-  }
-  size_t posts() const noexcept { return posts_; }
-  size_t bytes() const noexcept { return bytes_; }
-
- private:
-  size_t posts_ = 0;
-  size_t bytes_ = 0;
-};
+// Calls `each` for the payloads of the next batch: a kRing of them goes round, so that neither the
+// compression nor the processor's guesses get used to the same few.
+inline constexpr size_t kRing = 20 * kBatch;
+template <class T, class Each>
+void forNextBatch(const std::vector<T>& ring, size_t& at, Each each) {
+  for (size_t i = 0; i < kBatch; ++i) each(ring[at + i]);
+  at = (at + kBatch) % ring.size();
+}
 
 // Whether a readable copy of every post goes to the message log, as it does when the user has consented and
 // the client entry honours consent.
@@ -49,14 +43,13 @@ enum class MessageLog { off, on };
 // The fakes' world as a quiet daemon sees it: diagnostics up to level 6, posts accepted at once.
 class BenchWorld {
  public:
-  BenchWorld();
+  BenchWorld() { fakes.log.setActiveLevel(LogLevel::information); }
 
   // Called between measurements: the fakes remember what a real log or disk would take away.
   void forget();
 
   fake::FakeWorld fakes;
-  AcceptingHttpClient http;
-  Dependencies dependencies;
+  const Dependencies& dependencies = fakes.dependencies;
 };
 
 // One enabled HTTPS backend, set up as a session does it.
@@ -77,15 +70,19 @@ class SealedMessages {
 
   // SendMessage of callPayload(index).
   Message single(size_t index);
-  // SendMessages of the first `count` payloads.
-  Message batch(size_t count);
+  // SendMessages of kBatch payloads from this one on.
+  Message batch(size_t first);
+  // The same as it goes over the socket.
+  static std::string batchBytes(size_t first);
 
  private:
   struct Close {
     void operator()(sd_bus* bus) const noexcept { sd_bus_close_unref(bus); }
   };
   Message newCall(const char* member);
+  Message unsealedBatch(size_t first);
 
+  UniqueFd peer_;
   std::unique_ptr<sd_bus, Close> bus_;
 };
 

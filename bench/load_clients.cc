@@ -7,7 +7,8 @@
 namespace tarnel::bench {
 namespace {
 
-constexpr size_t kRing = 256;
+// As many as in the benchmarks inside a process.
+constexpr size_t kRing = 1000;
 constexpr uint16_t kCategory = 13;
 constexpr uint16_t kType = 10;
 

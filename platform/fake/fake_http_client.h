@@ -64,6 +64,11 @@ class FakeHttpClient final : public HttpClient {
     const std::lock_guard guard(mutex_);
     return requests_;
   }
+  // Forgets the requests so far; those that wait for an answer stay.
+  void clear() {
+    const std::lock_guard guard(mutex_);
+    requests_.clear();
+  }
 
   static HttpResult status(int code, std::string body = {}, std::vector<HttpHeader> headers = {}) {
     return {std::move(body), HttpResponse{code, std::move(headers)}, std::nullopt};
