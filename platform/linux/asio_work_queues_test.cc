@@ -1,0 +1,329 @@
+#include "platform/linux/asio_work_queues.h"
+
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/resource.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <array>
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <future>
+#include <mutex>
+#include <stdexcept>
+#include <thread>
+#include <vector>
+
+#include "platform/fake/fake_log.h"
+#include "platform/linux/unique_fd.h"
+#include "tests/helpers/waiting.h"
+
+namespace tarnel {
+namespace {
+
+using namespace std::chrono_literals;
+using Clock = std::chrono::steady_clock;
+
+size_t descriptors() {
+  return static_cast<size_t>(std::distance(std::filesystem::directory_iterator("/proc/self/fd"),
+                                           std::filesystem::directory_iterator()));
+}
+
+std::pair<UniqueFd, UniqueFd> socketPair() {
+  std::array<int, 2> ends{};
+  EXPECT_EQ(::socketpair(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0, ends.data()), 0);
+  return {UniqueFd(ends[0]), UniqueFd(ends[1])};
+}
+
+class AsioWorkQueuesTest : public ::testing::Test {
+ protected:
+  // Returns once everything that was handed over before has run.
+  static void settle(WorkQueue& queue) {
+    std::promise<void> done;
+    queue.async([&done] { done.set_value(); });
+    ASSERT_EQ(done.get_future().wait_for(test::kDeadline), std::future_status::ready);
+  }
+  static void expectSoon(const std::future<void>& future) {
+    EXPECT_EQ(future.wait_for(test::kDeadline), std::future_status::ready);
+  }
+
+  fake::FakeLog log;
+  std::optional<AsioWorkQueues> queues{std::in_place, log};
+};
+
+TEST_F(AsioWorkQueuesTest, TasksRunInOrderOnOneOtherThread) {
+  const auto queue = queues->makeQueue("com.example.one");
+  std::vector<int> order;
+  std::vector<std::thread::id> threads;
+  for (int i = 0; i < 1000; ++i) {
+    queue->async([&order, &threads, i] {
+      order.push_back(i);
+      threads.push_back(std::this_thread::get_id());
+    });
+  }
+  settle(*queue);
+  ASSERT_EQ(order.size(), 1000U);
+  for (int i = 0; i < 1000; ++i) EXPECT_EQ(order[static_cast<size_t>(i)], i);
+  EXPECT_NE(threads.front(), std::this_thread::get_id());
+  EXPECT_EQ(std::count(threads.begin(), threads.end(), threads.front()), 1000);
+}
+
+TEST_F(AsioWorkQueuesTest, NeverRunsTwoTasksOfAQueueAtOnceWhoeverHandsThemOver) {
+  const auto queue = queues->makeQueue("com.example.one");
+  std::atomic<int> inside{0};
+  std::atomic<int> ran{0};
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([&queue, &inside, &ran] {
+      for (int i = 0; i < 500; ++i) {
+        queue->async([&inside, &ran] {
+          EXPECT_EQ(inside.fetch_add(1), 0);
+          ++ran;
+          inside.fetch_sub(1);
+        });
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  settle(*queue);
+  EXPECT_EQ(ran.load(), 2000);
+}
+
+TEST_F(AsioWorkQueuesTest, DelayedTaskRunsAfterItsDelay) {
+  const auto queue = queues->makeQueue("com.example.one");
+  std::promise<Clock::time_point> ran;
+  const auto before = Clock::now();
+  queue->after(20ms, [&ran] { ran.set_value(Clock::now()); });
+  auto at = ran.get_future();
+  ASSERT_EQ(at.wait_for(test::kDeadline), std::future_status::ready);
+  EXPECT_GE(at.get() - before, 20ms);
+}
+
+TEST_F(AsioWorkQueuesTest, TimerTicksFromOnePeriodOnUntilItIsCancelledByItsOwnHandler) {
+  const auto queue = queues->makeQueue("com.example.one");
+  auto timer = queue->makeTimer(10ms, 2ms);
+  ASSERT_NE(timer, nullptr);
+  std::vector<Clock::time_point> ticks;
+  std::promise<void> cancelled;
+  const auto start = Clock::now();
+  timer->start(
+      [&ticks, &timer] {
+        ticks.push_back(Clock::now());
+        if (ticks.size() == 4) timer->cancel();
+      },
+      [&cancelled] { cancelled.set_value(); });
+  expectSoon(cancelled.get_future());
+  settle(*queue);
+  ASSERT_EQ(ticks.size(), 4U);
+  EXPECT_GE(ticks[0] - start, 10ms);
+  EXPECT_GE(ticks[3] - start, 40ms);
+  EXPECT_EQ(queues->sourcesUnderWay(), 0U);
+}
+
+TEST_F(AsioWorkQueuesTest, TicksThatWereMissedAreOne) {
+  const auto queue = queues->makeQueue("com.example.one");
+  auto timer = queue->makeTimer(1ms, 0ms);
+  std::atomic<int> ticks{0};
+  std::promise<void> over;
+  timer->start(
+      [&ticks, &timer] {
+        // Holds the queue for many periods.
+        const test::Deadline deadline(100ms);
+        while (ticks.load() == 0 && !deadline.passed()) std::this_thread::yield();
+        if (++ticks == 2) timer->cancel();
+      },
+      [&over] { over.set_value(); });
+  const auto start = Clock::now();
+  expectSoon(over.get_future());
+  EXPECT_GE(Clock::now() - start, 100ms);
+  EXPECT_EQ(ticks.load(), 2);
+}
+
+TEST_F(AsioWorkQueuesTest, LeewayIsHeldToHalfAPeriod) {
+  const auto queue = queues->makeQueue("com.example.one");
+  auto timer = queue->makeTimer(4ms, 10min);  // would be due in minutes
+  std::promise<void> ticked;
+  timer->start(
+      [&ticked, &timer] {
+        timer->cancel();
+        ticked.set_value();
+      },
+      nullptr);
+  expectSoon(ticked.get_future());
+  settle(*queue);
+}
+
+TEST_F(AsioWorkQueuesTest, TimerWithoutAPeriodIsRefused) {
+  EXPECT_EQ(queues->makeQueue("com.example.one")->makeTimer(0ms, 0ms), nullptr);
+}
+
+TEST_F(AsioWorkQueuesTest, ReadSourceFiresForWhatWasThereBeforeAndForWhatComes) {
+  const auto queue = queues->makeQueue("com.example.one");
+  const auto [here, there] = socketPair();
+  ASSERT_EQ(::send(there.get(), "a", 1, 0), 1);
+  ASSERT_EQ(::send(there.get(), "b", 1, 0), 1);
+  auto source = queue->makeReadSource(here.get());
+  ASSERT_NE(source, nullptr);
+  std::string got;
+  std::promise<void> two;
+  std::promise<void> three;
+  source->start(
+      [&got, &two, &three, fd = here.get()] {
+        char c = 0;
+        if (::recv(fd, &c, 1, MSG_DONTWAIT) == 1) got += c;  // one for each event
+        if (got.size() == 2) two.set_value();
+        if (got.size() == 3) three.set_value();
+      },
+      nullptr);
+  expectSoon(two.get_future());
+  ASSERT_EQ(::send(there.get(), "c", 1, 0), 1);
+  expectSoon(three.get_future());
+  source.reset();
+  settle(*queue);
+  EXPECT_EQ(got, "abc");
+}
+
+TEST_F(AsioWorkQueuesTest, CancelHandlerMayCloseTheDescriptorAndRunsOnce) {
+  const auto queue = queues->makeQueue("com.example.one");
+  auto [here, there] = socketPair();
+  auto source = queue->makeReadSource(here.get());
+  std::atomic<int> events{0};
+  std::atomic<int> cancels{0};
+  source->start([&events] { ++events; },
+                [&cancels, fd = &here] {
+                  ++cancels;
+                  fd->reset();
+                });
+  settle(*queue);
+  source->cancel();
+  source->cancel();
+  source.reset();
+  settle(*queue);
+  settle(*queue);  // the wait's own end comes after the cancellation
+  EXPECT_EQ(cancels.load(), 1);
+  EXPECT_EQ(events.load(), 0);
+  EXPECT_FALSE(static_cast<bool>(here));
+  EXPECT_EQ(queues->sourcesUnderWay(), 0U);
+}
+
+TEST_F(AsioWorkQueuesTest, SourceThatIsLetGoLetsGoOfWhatItsHandlersHold) {
+  const auto queue = queues->makeQueue("com.example.one");
+  const auto held = std::make_shared<int>(1);
+  std::promise<void> cancelled;
+  auto timer = queue->makeTimer(1h, 0ms);
+  timer->start([held] {}, [held, &cancelled] { cancelled.set_value(); });
+  EXPECT_EQ(held.use_count(), 3);
+  EXPECT_EQ(queues->sourcesUnderWay(), 1U);
+  timer.reset();
+  expectSoon(cancelled.get_future());
+  settle(*queue);
+  EXPECT_EQ(held.use_count(), 1);
+  EXPECT_EQ(queues->sourcesUnderWay(), 0U);
+}
+
+TEST_F(AsioWorkQueuesTest, SourceThatNeverStartedGoesSilently) {
+  const auto queue = queues->makeQueue("com.example.one");
+  const auto [here, there] = socketPair();
+  queue->makeReadSource(here.get());
+  queue->makeTimer(1ms, 0ms);
+  settle(*queue);
+  EXPECT_EQ(::send(there.get(), "a", 1, 0), 1);  // the descriptor stayed open
+}
+
+TEST_F(AsioWorkQueuesTest, DescriptorThatCannotBeWaitedForIsRefused) {
+  EXPECT_EQ(queues->makeQueue("com.example.one")->makeReadSource(-1), nullptr);
+}
+
+TEST_F(AsioWorkQueuesTest, TaskThatThrowsIsLoggedWithItsLabelAndTheQueueGoesOn) {
+  const auto queue = queues->makeQueue("com.example.one");
+  queue->async([] { throw std::runtime_error("no such luck"); });
+  settle(*queue);
+  EXPECT_TRUE(log.contains(LogLevel::error, "com.example.one: a task failed: no such luck"));
+}
+
+TEST_F(AsioWorkQueuesTest, TimerWhoseHandlerThrowsTicksOn) {
+  const auto queue = queues->makeQueue("com.example.one");
+  auto timer = queue->makeTimer(1ms, 0ms);
+  std::promise<void> over;
+  int ticks = 0;
+  timer->start(
+      [&ticks, &timer] {
+        if (++ticks == 2) timer->cancel();
+        throw std::runtime_error("again");
+      },
+      [&over] { over.set_value(); });
+  expectSoon(over.get_future());
+  EXPECT_EQ(log.count(LogLevel::error, "com.example.one: a task failed: again"), 2U);
+}
+
+TEST_F(AsioWorkQueuesTest, NothingIsTakenBeforeTheFirstQueueAndAllGivenBackAtTheEnd) {
+  queues.reset();
+  const size_t before = descriptors();
+  queues.emplace(log);
+  EXPECT_EQ(descriptors(), before);
+  auto queue = queues->makeQueue("com.example.one");
+  EXPECT_GT(descriptors(), before);
+  queue.reset();
+  queues.reset();
+  EXPECT_EQ(descriptors(), before);
+}
+
+TEST_F(AsioWorkQueuesTest, WhatStillWaitsAtTheEndIsDroppedUnrun) {
+  auto queue = queues->makeQueue("com.example.one");
+  const auto held = std::make_shared<int>(1);
+  std::atomic<int> ran{0};
+  // As a backend does: what a handler holds owns the source.
+  struct Owner {
+    std::shared_ptr<WorkQueue> queue;
+    std::unique_ptr<EventSource> source;
+    std::shared_ptr<int> held;
+  };
+  const auto [here, there] = socketPair();
+  auto timed = std::make_shared<Owner>(Owner{queue, queue->makeTimer(1h, 0ms), held});
+  auto reading = std::make_shared<Owner>(Owner{queue, queue->makeReadSource(here.get()), held});
+  for (const auto& owner : {timed, reading}) {
+    owner->source->start([owner, &ran] { ++ran; }, [owner, &ran] { ++ran; });
+  }
+  queue->after(1h, [held, &ran] { ++ran; });
+  settle(*queue);
+  queue.reset();
+  timed.reset();
+  reading.reset();
+  EXPECT_GT(held.use_count(), 1);
+  queues.reset();
+  EXPECT_EQ(held.use_count(), 1);
+  EXPECT_EQ(ran.load(), 0);
+  EXPECT_EQ(::send(there.get(), "a", 1, 0), 1);  // the descriptor stayed open
+}
+
+TEST_F(AsioWorkQueuesTest, WithoutDescriptorsThereIsNoQueueAndALineSaysSo) {
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+  const rlimit none{3, before.rlim_max};  // only the standard streams
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &none), 0);
+  const auto queue = queues->makeQueue("com.example.one");
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
+  EXPECT_EQ(queue, nullptr);
+  EXPECT_EQ(log.startingWith("com.example.one: can't start the thread of the work queues: ").size(), 1U);
+  EXPECT_NE(queues->makeQueue("com.example.one"), nullptr);  // as soon as there are some
+}
+
+TEST_F(AsioWorkQueuesTest, ThreadLeavesSignalsToOthers) {
+  const auto queue = queues->makeQueue("com.example.one");
+  sigset_t blocked;
+  queue->async([&blocked] { pthread_sigmask(SIG_SETMASK, nullptr, &blocked); });
+  settle(*queue);
+  EXPECT_EQ(sigismember(&blocked, SIGTERM), 1);
+  sigset_t here;
+  pthread_sigmask(SIG_SETMASK, nullptr, &here);
+  EXPECT_EQ(sigismember(&here, SIGTERM), 0);
+}
+
+TEST(WorkQueuesTest, BaseHasNoQueues) {
+  EXPECT_EQ(WorkQueues().makeQueue("com.example.one"), nullptr);
+}
+
+}  // namespace
+}  // namespace tarnel
