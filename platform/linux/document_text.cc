@@ -137,7 +137,11 @@ Result<Value> parseTextDocument(std::string_view bytes, const DocumentLimits& li
   constexpr unsigned kFlags = rapidjson::kParseIterativeFlag | rapidjson::kParseFullPrecisionFlag;
   const auto result = reader.Parse<kFlags>(stream, handler);
   if (result.IsError()) {
-    if (!builder.failed()) builder.fail(kDocumentMalformed, rapidjson::GetParseError_En(result.Code()));
+    if (!builder.failed()) {
+      std::string_view reason = rapidjson::GetParseError_En(result.Code());
+      if (reason.ends_with('.')) reason.remove_suffix(1);  // the place follows
+      builder.fail(kDocumentMalformed, std::string(reason));
+    }
     return builder.error(skipped + result.Offset());
   }
   // The reader takes a NUL for the end of the text.

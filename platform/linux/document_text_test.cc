@@ -26,6 +26,16 @@ std::string refusal(std::string_view text, const DocumentLimits& limits = {}) {
   return result.error().localizedDescription();
 }
 
+TEST(TextDocumentTest, refusesControlCharactersInTexts) {
+  for (int control = 0; control < 0x20; ++control) {
+    for (size_t place = 0; place < 50; ++place) {
+      std::string text = '"' + std::string(50, 'x') + '"';
+      text[place + 1] = static_cast<char>(control);
+      EXPECT_FALSE(parseDocument(text)) << "character " << control << " at " << place;
+    }
+  }
+}
+
 TEST(TextDocumentTest, readsEveryKindOfValue) {
   const Value value =
       parsed(R"( {"text": "a\u00e9\n", "yes": true, "no": false, "none": null, "list": [1, -2, 0.5],

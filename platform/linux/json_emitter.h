@@ -4,18 +4,49 @@
 #include <charconv>
 #include <cmath>
 #include <cstdint>
+#include <cstring>
 #include <limits>
 #include <string_view>
 
-// Whole blocks of plain characters are copied at once.
 #if defined(__SSE2__)
-#define RAPIDJSON_SSE2
+#include <emmintrin.h>
 #endif
 #include <rapidjson/prettywriter.h>
 #include <rapidjson/stringbuffer.h>
 #include <rapidjson/writer.h>
 
 #include "platform/base/value.h"
+
+#if defined(__SSE2__)
+#if defined(RAPIDJSON_SIMD)
+#error "RapidJSON's own block-wise code leaves the characters 0x1A to 0x1F unescaped; do without it"
+#endif
+namespace rapidjson {
+
+// Copies blocks of characters that need no escape at once; what is left is told to the caller one by one.
+template <>
+inline bool Writer<StringBuffer>::ScanWriteUnescapedString(StringStream& is, size_t length) {
+  constexpr size_t kBlock = 16;
+  const char* const end = is.head_ + length;
+  const __m128i quote = _mm_set1_epi8('"');
+  const __m128i backslash = _mm_set1_epi8('\\');
+  const __m128i lastControl = _mm_set1_epi8(0x1F);
+  while (static_cast<size_t>(end - is.src_) >= kBlock) {
+    const __m128i block = _mm_loadu_si128(reinterpret_cast<const __m128i*>(is.src_));
+    const __m128i control = _mm_cmpeq_epi8(_mm_max_epu8(block, lastControl), lastControl);
+    const __m128i special =
+        _mm_or_si128(_mm_or_si128(_mm_cmpeq_epi8(block, quote), _mm_cmpeq_epi8(block, backslash)), control);
+    const auto mask = static_cast<unsigned>(_mm_movemask_epi8(special));
+    const size_t plain = mask == 0 ? kBlock : static_cast<size_t>(__builtin_ctz(mask));
+    std::memcpy(os_->PushUnsafe(plain), is.src_, plain);
+    is.src_ += plain;
+    if (mask != 0) break;
+  }
+  return is.Tell() < length;
+}
+
+}  // namespace rapidjson
+#endif
 
 namespace tarnel::detail {
 

@@ -1,10 +1,13 @@
 #include "platform/json_writer.h"
 
+#include <algorithm>
 #include <cmath>
 #include <limits>
 #include <string>
 
 #include <gtest/gtest.h>
+
+#include "platform/document.h"
 
 namespace tarnel {
 namespace {
@@ -53,6 +56,24 @@ TEST(JsonWriterTest, writesDoublesInTheShortestTextThatReadsBack) {
                {1.7976931348623157e308, "1.7976931348623157e+308"},
                {2.0 / 3, "0.6666666666666666"}};
   for (const auto& one : cases) EXPECT_EQ(compact(one.number), one.text);
+}
+
+// Long texts are copied block by block, which must leave no control character as it is.
+TEST(JsonWriterTest, escapesEveryControlCharacterAtEveryPlace) {
+  for (int control = 0; control < 0x20; ++control) {
+    for (size_t place = 0; place < 50; ++place) {
+      std::string text(50, 'x');
+      text[place] = static_cast<char>(control);
+      const std::string written = compact(text);
+      EXPECT_EQ(std::count_if(written.begin(), written.end(),
+                              [](char c) { return static_cast<unsigned char>(c) < 0x20; }),
+                0)
+          << "character " << control << " at " << place;
+      const auto read = parseDocument(written);
+      ASSERT_TRUE(read) << "character " << control << " at " << place;
+      EXPECT_EQ(*read, Value(text));
+    }
+  }
 }
 
 TEST(JsonWriterTest, escapesWhatMustBeEscaped) {
