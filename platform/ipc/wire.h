@@ -38,12 +38,18 @@ inline constexpr Method kSendMessages{"SendMessages", "a(qquaa{sv})", "aav"};
 inline constexpr Method kFlushMessages{"FlushMessages", "", "asa(sxs)"};
 inline constexpr Method kFinishSession{"FinishSession", "", "av"};
 inline constexpr Method kUploadLogData{"UploadLogData", "av", "ba(sxs)"};
+// The file by its file URL (or absolute path) and a descriptor of it, open for reading; answered with whether
+// it was uploaded. Needs a connection that negotiated the passing of descriptors.
+inline constexpr Method kUploadFile{"UploadFile", "sh", "b"};
 inline constexpr Method kSendSingleMessage{"SendSingleMessage", "aa{sv}aa{sv}qqaa{sv}", "as"};
 
 // The client's object.
 inline constexpr char kReplyPath[] = "/com/orvane/tarneld/client";
 inline constexpr char kReplyInterface[] = "com.orvane.tarneld.ClientSessionReply";
 inline constexpr Method kSendMessageToClient{"SendMessageToClient", "aa{sv}dqqaa{sv}", ""};
+// The file that an UploadFile named so, and that is not answered yet, was uploaded and should go. The client
+// deletes it only if what stands at its path is still what it handed over.
+inline constexpr Method kDeleteFile{"DeleteFile", "s", ""};
 
 // Names of the errors that a call can be answered with.
 inline constexpr char kErrorInvalidArguments[] = "com.orvane.tarneld.Error.InvalidArguments";

@@ -12,6 +12,7 @@
 #include <utility>
 
 #include "platform/ipc/wire.h"
+#include "platform/linux/ipc/descriptor_passing.h"
 #include "platform/linux/ipc/generic_tools.h"
 #include "platform/linux/ipc/session_methods.h"
 
@@ -21,8 +22,8 @@ namespace {
 // Steps of input before the descriptors and tasks are looked at again.
 constexpr int kStepsPerWakeup = 64;
 constexpr size_t kBufferBytes = size_t{16} << 10U;
-// Room of the pipe to the bus. The default, times all connections, would use up what a user may have.
-constexpr int kPipeBytes = 16 << 10;
+// Room of the way to the bus: what it has not read yet is held by the kernel.
+constexpr int kFeedBytes = 16 << 10;
 
 sd_id128_t randomId() {
   sd_id128_t id{};
@@ -54,10 +55,10 @@ void ConnectionLoop::run() {
 // decided before, from what the kernel says.
 bool ConnectionLoop::open() {
   std::array<int, 2> ends{-1, -1};
-  int r = pipe2(ends.data(), O_CLOEXEC | O_NONBLOCK) == 0 ? 0 : -errno;
+  int r = socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends.data()) == 0 ? 0 : -errno;
   UniqueFd readEnd(ends[0]);
   feed_.reset(ends[1]);
-  if (r >= 0) fcntl(feed_.get(), F_SETPIPE_SZ, kPipeBytes);
+  if (r >= 0) setsockopt(feed_.get(), SOL_SOCKET, SO_SNDBUF, &kFeedBytes, sizeof(kFeedBytes));
   sd_bus* made = nullptr;
   if (r >= 0) r = sd_bus_new(&made);
   bus_.reset(made);
@@ -68,7 +69,7 @@ bool ConnectionLoop::open() {
   }
   if (r >= 0) r = sd_bus_set_server(made, 1, randomId());
   if (r >= 0) r = sd_bus_set_anonymous(made, 1);
-  if (r >= 0) r = sd_bus_negotiate_fds(made, 0);
+  if (r >= 0) r = sd_bus_negotiate_fds(made, 1);
   const auto filter = [](sd_bus_message* message, void* self, sd_bus_error*) {
     return static_cast<ConnectionLoop*>(self)->onMessage(message);
   };
@@ -185,6 +186,7 @@ ConnectionLoop::Pump ConnectionLoop::processOnce() {
   }
   if (!ready_ && sd_bus_is_ready(bus_.get()) > 0) {
     ready_ = true;
+    mayPassDescriptors_ = sd_bus_can_send(bus_.get(), SD_BUS_TYPE_UNIX_FD) > 0;
     deadline_.reset();
   }
   return Pump::progress;
@@ -193,13 +195,15 @@ ConnectionLoop::Pump ConnectionLoop::processOnce() {
 ConnectionLoop::Pump ConnectionLoop::feed() {
   // A send that failed has closed it; nobody reads the pipe any more.
   if (sd_bus_is_open(bus_.get()) <= 0) return Pump::over;
-  const auto written = write(feed_.get(), buffer_.get() + inputBegin_, admitted_);
+  const auto written =
+      sendWithDescriptors(feed_.get(), unadmitted().substr(0, admitted_), descriptorsToFeed_);
   // Parts of messages that the bus has not read yet may fill it.
   if (written < 0 && errno == EAGAIN) {
     isFed_ = true;
     return Pump::progress;
   }
   if (written <= 0) return closing(std::string("its input cannot be passed on: ") + strerror(errno));
+  descriptorsToFeed_.clear();
   inputBegin_ += static_cast<size_t>(written);
   admitted_ -= static_cast<size_t>(written);
   isFed_ = true;
@@ -209,7 +213,7 @@ ConnectionLoop::Pump ConnectionLoop::feed() {
 ConnectionLoop::Pump ConnectionLoop::receive() {
   makeRoom(std::max(kBufferBytes, std::exchange(wanted_, 0)));
   const size_t room = capacity_ - inputEnd_;
-  const auto got = recv(busFd_, buffer_.get() + inputEnd_, room, MSG_DONTWAIT);
+  const auto got = receiveWithDescriptors(busFd_, buffer_.get() + inputEnd_, room, descriptors_);
   if (got < 0 && errno == ECONNRESET && !peerGone_) {
     // It closed with answers unread. What it had sent comes with the next read.
     peerIsGone();
@@ -218,6 +222,10 @@ ConnectionLoop::Pump ConnectionLoop::receive() {
   mayHaveMore_ = got == static_cast<ssize_t>(room);
   if (got == 0) inputEnded_ = true;
   if (got <= 0) return got == 0 || errno == EAGAIN || errno == EINTR ? Pump::idle : Pump::over;
+  if (descriptors_.size() > wire::kMaxDescriptors) {
+    return closing("more than " + std::to_string(wire::kMaxDescriptors) +
+                   " descriptors came with part of a message");
+  }
   inputEnd_ += static_cast<size_t>(got);
   isNew_ = true;
   return Pump::progress;
@@ -246,11 +254,22 @@ std::string_view ConnectionLoop::unadmitted() const {
 ConnectionLoop::Pump ConnectionLoop::examine() {
   isNew_ = false;
   const auto input = unadmitted();
-  if (input.empty()) return Pump::progress;
+  if (input.empty()) {
+    dropDescriptors();
+    return Pump::progress;
+  }
+  if (framer_.isAuthenticating()) {
+    admitted_ = framer_.admitAuthentication(input);
+    isNew_ = true;
+    return Pump::progress;
+  }
   if (!ready_) return admit(input.size());
   if (!framer_.isBetweenMessages()) return admit(std::min(input.size(), framer_.restOfMessage()));
   const auto size = framer_.sizeOfNext(input);
   if (!size) return closing(framer_.refusal());
+  if (*size != 0 && !descriptors_.empty()) {
+    if (const auto claimed = claimDescriptors(*size)) return *claimed;
+  }
   if (*size == 0 || input.size() < std::min(*size, kSendCallStart)) return Pump::progress;
   const auto message = input.substr(0, *size);
   if (!mayBeSendCall(message)) return admit(message.size());
@@ -274,6 +293,41 @@ ConnectionLoop::Pump ConnectionLoop::admit(size_t bytes) {
   admitted_ = *admitted;
   isNew_ = admitted_ > 0;
   return Pump::progress;
+}
+
+// Gives the next message the descriptors that it announces. Nothing when it announces none.
+std::optional<ConnectionLoop::Pump> ConnectionLoop::claimDescriptors(size_t sizeOfMessage) {
+  const auto input = unadmitted();
+  const size_t header = headerSize(input);
+  if (header > kMaxHeaderWithDescriptors)
+    return closing("the header of a message with descriptors is too long");
+  if (input.size() < header) return Pump::progress;
+  const auto announced = announcedDescriptors(input);
+  if (!announced) return closing("it broke the protocol: a malformed message");
+  if (*announced == 0 || !mayPassDescriptors_) {
+    // They can only belong to a message whose first byte has come.
+    if (!mayPassDescriptors_ || input.size() <= sizeOfMessage) dropDescriptors();
+    return std::nullopt;
+  }
+  if (*announced > descriptors_.size()) {
+    return closing("a message announces " + std::to_string(*announced) + " descriptors, and " +
+                   std::to_string(descriptors_.size()) + " came; at most " +
+                   std::to_string(wire::kMaxDescriptors) + " may");
+  }
+  announced_ = *announced;
+  const auto end = descriptors_.begin() + static_cast<std::ptrdiff_t>(announced_);
+  descriptorsToFeed_.assign(std::make_move_iterator(descriptors_.begin()), std::make_move_iterator(end));
+  descriptors_.erase(descriptors_.begin(), end);
+  return admit(std::min(sizeOfMessage, input.size()));
+}
+
+void ConnectionLoop::dropDescriptors() {
+  if (descriptors_.empty()) return;
+  if (!std::exchange(toldOfDescriptors_, true)) {
+    setup_.log.log(LogLevel::warning, "IpcConnection: Descriptors of %s that no message announces are closed",
+                   setup_.peer.c_str());
+  }
+  descriptors_.clear();
 }
 
 ConnectionLoop::Pump ConnectionLoop::closing(const std::string& why) {
@@ -320,11 +374,17 @@ void ConnectionLoop::runTasks() {
 
 int ConnectionLoop::onMessage(sd_bus_message* message) {
   ++messages_;
+  const bool hasDescriptors = std::exchange(announced_, 0) > 0;
   uint8_t type = 0;
   if (sd_bus_message_get_type(message, &type) < 0 || type != SD_BUS_MESSAGE_METHOD_CALL) return 1;
   const char* interface = sd_bus_message_get_interface(message);
   if (interface != nullptr && std::strcmp(interface, wire::kSessionInterface) == 0 &&
       std::strcmp(sd_bus_message_get_path(message), wire::kSessionPath) == 0) {
+    // A call that waits for its answer must not hold descriptors meanwhile.
+    if (hasDescriptors && std::strcmp(sd_bus_message_get_member(message), wire::kUploadFile.name) != 0) {
+      refuse(message, wire::kErrorInvalidArguments, "only UploadFile takes a descriptor");
+      return 1;
+    }
     carryOut(message, callSessionMethod);
     return 1;
   }
@@ -369,7 +429,8 @@ void ConnectionLoop::carryOut(sd_bus_message* message, Run run) {
 
 template <class Run>
 void ConnectionLoop::runCall(sd_bus_message* message, Run run) {
-  const SessionCall call{message, *setup_.object, setup_.link, currentSerial_, setup_.peer, setup_.log};
+  const SessionCall call{message,     *setup_.object, setup_.link,       currentSerial_,
+                         setup_.peer, setup_.log,     setup_.clientFiles};
   try {
     if (const MaybeError error = run(call)) {
       current_ = nullptr;

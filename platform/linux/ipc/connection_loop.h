@@ -10,11 +10,13 @@
 #include <string>
 #include <string_view>
 #include <unordered_map>
+#include <vector>
 
 #include "platform/base/error.h"
 #include "platform/base/log.h"
 #include "platform/ipc/client_session_interface.h"
 #include "platform/ipc/wire.h"
+#include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/connection_link.h"
 #include "platform/linux/ipc/input_framer.h"
 #include "platform/linux/ipc/ipc_limits.h"
@@ -33,12 +35,12 @@ using BusMessage = std::unique_ptr<sd_bus_message, UnrefBusMessage>;
 
 // The inside of a connection's thread: reads the client's calls, runs them, writes the answers.
 //
-// The socket is read here and its bytes are fed to the bus object through a pipe: the library by itself
+// The socket is read here and its bytes are fed to the bus object through another: the library by itself
 // reads messages of up to 128 MiB, in one go for as long as the peer keeps sending. The calls that send
 // messages pass it by, unless something about them is unusual; see send_call.h. One call is carried out
 // at a time, and none while an earlier answer still waits for the client to read, so that a client holds no
-// more of us than a message and an answer. Descriptors that come along are never taken out of the socket; the
-// kernel closes them.
+// more of us than a message and an answer. Descriptors that come along go to the message that announces them,
+// at most wire::kMaxDescriptors; only UploadFile takes any, and all others are closed at once.
 //
 // Threads: made, run and destroyed on one.
 class ConnectionLoop {
@@ -50,6 +52,7 @@ class ConnectionLoop {
     std::string peer;  // for logs
     IpcLimits limits;
     Log& log;
+    ClientFileRegistry* clientFiles = nullptr;  // null: this service takes no files
   };
 
   ConnectionLoop(Setup setup, UniqueFd socket);
@@ -103,6 +106,8 @@ class ConnectionLoop {
   Pump receive();
   Pump examine();
   Pump admit(size_t bytes);
+  std::optional<Pump> claimDescriptors(size_t sizeOfMessage);
+  void dropDescriptors();
   std::string_view unadmitted() const;
   void makeRoom(size_t capacity);
   bool inputAtHand() const;
@@ -144,10 +149,15 @@ class ConnectionLoop {
   size_t inputBegin_ = 0;
   size_t inputEnd_ = 0;
   size_t admitted_ = 0;
-  bool isNew_ = false;        // what is in the buffer and not admitted has not been looked at
-  bool mayHaveMore_ = false;  // the socket, since the last read filled the buffer
-  bool isFed_ = false;        // the bus may have something to read
-  uint64_t messages_ = 0;     // that were read, by the bus or past it
+  bool isNew_ = false;                       // what is in the buffer and not admitted has not been looked at
+  bool mayHaveMore_ = false;                 // the socket, since the last read filled the buffer
+  bool isFed_ = false;                       // the bus may have something to read
+  bool mayPassDescriptors_ = false;          // negotiated
+  bool toldOfDescriptors_ = false;           // that nobody asked for
+  std::vector<UniqueFd> descriptors_;        // came with bytes that have not been looked at
+  std::vector<UniqueFd> descriptorsToFeed_;  // with the next bytes
+  size_t announced_ = 0;                     // by the message that the bus reads now
+  uint64_t messages_ = 0;                    // that were read, by the bus or past it
 
   // The call whose method runs now.
   sd_bus_message* current_ = nullptr;

@@ -21,6 +21,10 @@ class InputFramer {
   std::optional<size_t> admit(std::string_view bytes);
   const std::string& refusal() const noexcept { return refusal_; }
 
+  // Until the peer's line that ends the authentication.
+  bool isAuthenticating() const noexcept { return authenticating_; }
+  // While authenticating: how many of these bytes belong to the authentication.
+  size_t admitAuthentication(std::string_view bytes);
   // True when the next byte begins a message.
   bool isBetweenMessages() const noexcept { return !authenticating_ && restOfMessage_ == 0; }
   // Bytes of the message begun that were not admitted yet.
@@ -35,8 +39,6 @@ class InputFramer {
   uint64_t completed() const noexcept { return completed_; }
 
  private:
-  size_t admitAuthentication(std::string_view bytes);
-
   const size_t maxMessageBytes_;
   bool authenticating_ = true;
   std::string line_;          // of the authentication, as far as it matters

@@ -203,22 +203,7 @@ TEST_F(IpcHostileTest, DescriptorsThatNobodyAskedForAreClosed) {
   EXPECT_TRUE(client.write(rawCall("StartConfig")));
   EXPECT_TRUE(eventually([&] { return service.accepted() == 1 && service.session()->count() == 1; }));
   const size_t before = openDescriptors();
-  const std::string call = rawCall("FlushMessages");
-  iovec bytes{const_cast<char*>(call.data()), call.size()};
-  constexpr size_t kCount = 100;
-  std::vector<char> control(CMSG_SPACE(kCount * sizeof(int)));
-  msghdr message{};
-  message.msg_iov = &bytes;
-  message.msg_iovlen = 1;
-  message.msg_control = control.data();
-  message.msg_controllen = control.size();
-  auto* header = CMSG_FIRSTHDR(&message);
-  header->cmsg_level = SOL_SOCKET;
-  header->cmsg_type = SCM_RIGHTS;
-  header->cmsg_len = CMSG_LEN(kCount * sizeof(int));
-  const std::vector<int> descriptors(kCount, client.fd().get());
-  std::memcpy(CMSG_DATA(header), descriptors.data(), kCount * sizeof(int));
-  EXPECT_GT(sendmsg(client.fd().get(), &message, 0), 0);
+  EXPECT_TRUE(client.writeWith(rawCall("FlushMessages"), client.fd().get(), 100));
   EXPECT_TRUE(eventually([&] { return service.session()->count() == 2; }));
   EXPECT_EQ(openDescriptors(), before);
 }

@@ -13,6 +13,7 @@
 #include <string>
 #include <string_view>
 #include <utility>
+#include <vector>
 
 #include "platform/ipc/wire.h"
 #include "platform/linux/ipc/connection_loop.h"
@@ -60,10 +61,36 @@ class RawClient {
   }
   void authenticate() const {
     EXPECT_TRUE(write(std::string("\0AUTH ANONYMOUS 74\r\nBEGIN\r\n", 27)));
+    EXPECT_TRUE(readLine().starts_with("OK "));
+  }
+  // The same, and descriptors may be passed.
+  void authenticateForDescriptors() const {
+    EXPECT_TRUE(write(std::string("\0AUTH ANONYMOUS 74\r\nNEGOTIATE_UNIX_FD\r\nBEGIN\r\n", 46)));
+    EXPECT_TRUE(readLine().starts_with("OK "));
+    EXPECT_EQ(readLine(), "AGREE_UNIX_FD\r\n");
+  }
+  // Sends the bytes in one piece with so many copies of the descriptor.
+  bool writeWith(std::string_view bytes, int descriptor, size_t copies = 1) const {
+    iovec piece{const_cast<char*>(bytes.data()), bytes.size()};
+    std::vector<char> control(CMSG_SPACE(copies * sizeof(int)));
+    msghdr message{};
+    message.msg_iov = &piece;
+    message.msg_iovlen = 1;
+    message.msg_control = control.data();
+    message.msg_controllen = control.size();
+    auto* header = CMSG_FIRSTHDR(&message);
+    header->cmsg_level = SOL_SOCKET;
+    header->cmsg_type = SCM_RIGHTS;
+    header->cmsg_len = CMSG_LEN(copies * sizeof(int));
+    const std::vector<int> descriptors(copies, descriptor);
+    std::memcpy(CMSG_DATA(header), descriptors.data(), copies * sizeof(int));
+    return sendmsg(fd_.get(), &message, MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
+  }
+  std::string readLine() const {
     std::string answer;
     char c = 0;
     while (!answer.ends_with("\r\n") && recv(fd_.get(), &c, 1, 0) == 1) answer += c;
-    EXPECT_TRUE(answer.starts_with("OK ")) << answer;
+    return answer;
   }
   const UniqueFd& fd() const { return fd_; }
   void close() { fd_.reset(); }
@@ -75,7 +102,7 @@ class RawClient {
 // A method call's bytes, little endian, written by hand; bodySize may lie.
 inline std::string rawCall(std::string_view member, std::string_view body = {},
                            std::string_view signature = {}, uint32_t bodySize = UINT32_MAX,
-                           uint32_t serial = 1) {
+                           uint32_t serial = 1, uint32_t descriptors = 0) {
   std::string fields;
   const auto field = [&fields](char code, char type, std::string_view text) {
     while (fields.size() % 8 != 0) fields += '\0';
@@ -94,6 +121,10 @@ inline std::string rawCall(std::string_view member, std::string_view body = {},
   field(2, 's', wire::kSessionInterface);
   field(3, 's', member);
   if (!signature.empty()) field(8, 'g', signature);
+  if (descriptors > 0) {
+    while (fields.size() % 8 != 0) fields += '\0';
+    fields += std::string("\x09\1u\0", 4).append(reinterpret_cast<const char*>(&descriptors), 4);
+  }
   std::string message("l\1\0\1", 4);
   const uint32_t claimed = bodySize == UINT32_MAX ? static_cast<uint32_t>(body.size()) : bodySize;
   const auto fieldBytes = static_cast<uint32_t>(fields.size());

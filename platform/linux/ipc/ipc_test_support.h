@@ -70,6 +70,8 @@ class RecordingSession final : public ClientSessionInterface {
   std::function<void(const std::string&)> onCall = [](const std::string&) {};
   // What answers a send; left in place, it gives the number of sends so far as a text.
   std::function<void(SentReply)> answerSend;
+  // What answers an upload; without it, false.
+  std::function<bool(const std::string& token)> uploadFile;
 
   std::vector<std::string> calls() const {
     const std::lock_guard lock(mutex_);
@@ -116,7 +118,10 @@ class RecordingSession final : public ClientSessionInterface {
     note("finish");
     reply(SentObject(Error("domain", 503, "off")));
   }
-  void uploadFileAtPath(std::string, std::string, SuccessReply) override {}
+  void uploadFileAtPath(std::string fileURL, std::string extensionToken, SuccessReply reply) override {
+    note("uploadFile " + fileURL);
+    reply(uploadFile && uploadFile(extensionToken));
+  }
   void uploadLogData(Array logData, UploadReply completionHandler) override {
     note("uploadLogData " + description(logData));
     completionHandler(true, std::nullopt);
@@ -200,6 +205,7 @@ class Service final : public IpcListenerDelegate {
   std::string path() const { return folder_.socket(); }
   const TemporaryFolder& folder() const { return folder_; }
   fake::FakeLog& log() { return *log_; }
+  ClientFileRegistry& clientFiles() { return *clientFiles_; }
   FakeEntitlements& entitlements() { return *entitlements_; }
   SdBusListener& listener() { return *listener_; }
   size_t accepted() const {
@@ -261,6 +267,7 @@ class Service final : public IpcListenerDelegate {
     options.runtimeDirectory = folder_.path();
     options.limits = limits_;
     options.readCredentials = readCredentials_;
+    options.clientFiles = clientFiles_;
     listener_ = std::make_unique<SdBusListener>(event, std::move(options), entitlements_, log_);
     listener_->setDelegate(this);
     resumed.set_value(listener_->resume());
@@ -275,6 +282,7 @@ class Service final : public IpcListenerDelegate {
   std::function<PeerCredentials(int)> readCredentials_;
   const UniqueFd quit_{eventfd(0, EFD_CLOEXEC)};
   const std::shared_ptr<fake::FakeLog> log_ = std::make_shared<fake::FakeLog>();
+  const std::shared_ptr<ClientFileRegistry> clientFiles_ = std::make_shared<ClientFileRegistry>(*log_);
   const std::shared_ptr<FakeEntitlements> entitlements_ = std::make_shared<FakeEntitlements>();
   std::unique_ptr<SdBusListener> listener_;
 

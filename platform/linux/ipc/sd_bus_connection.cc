@@ -73,6 +73,7 @@ SdBusConnection::SdBusConnection(UniqueFd socket, Setup setup)
       entitlements_(std::move(setup.entitlements)),
       log_(std::move(setup.log)),
       limits_(setup.limits),
+      clientFiles_(std::move(setup.clientFiles)),
       link_(std::make_shared<ConnectionLink>(limits_.queuedBytes)),
       place_(std::move(setup.place)),
       socket_(std::move(socket)) {}
@@ -110,7 +111,8 @@ void SdBusConnection::resume() {
 }
 
 void SdBusConnection::serve() {
-  ConnectionLoop::Setup setup{link_, object_, std::move(interruptionHandler_), description_, limits_, *log_};
+  ConnectionLoop::Setup setup{
+      link_, object_, std::move(interruptionHandler_), description_, limits_, *log_, clientFiles_.get()};
   interruptionHandler_ = nullptr;
   {
     ConnectionLoop loop(std::move(setup), std::move(socket_));

@@ -8,6 +8,7 @@
 #include "platform/base/log.h"
 #include "platform/entitlements.h"
 #include "platform/ipc/ipc.h"
+#include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/connection_link.h"
 #include "platform/linux/ipc/connection_registry.h"
 #include "platform/linux/ipc/ipc_limits.h"
@@ -25,6 +26,7 @@ class SdBusConnection final : public IpcConnection, public std::enable_shared_fr
     std::shared_ptr<Entitlements> entitlements;
     std::shared_ptr<Log> log;
     IpcLimits limits;
+    std::shared_ptr<ClientFileRegistry> clientFiles;  // may be null
   };
   SdBusConnection(UniqueFd socket, Setup setup);
 
@@ -52,6 +54,7 @@ class SdBusConnection final : public IpcConnection, public std::enable_shared_fr
   const std::shared_ptr<Entitlements> entitlements_;
   const std::shared_ptr<Log> log_;
   const IpcLimits limits_;
+  const std::shared_ptr<ClientFileRegistry> clientFiles_;
   const std::shared_ptr<ConnectionLink> link_;
 
   // Written before resume(), then by the connection's thread.

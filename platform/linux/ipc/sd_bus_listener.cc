@@ -132,7 +132,7 @@ void SdBusListener::take(UniqueFd socket) {
   const auto connection = std::make_shared<SdBusConnection>(
       std::move(socket),
       SdBusConnection::Setup{std::move(peer), std::get<ConnectionRegistry::Place>(std::move(place)),
-                             registry_, entitlements_, log_, options_.limits});
+                             registry_, entitlements_, log_, options_.limits, options_.clientFiles});
   bool accepted = false;
   try {
     accepted = delegate_ != nullptr && delegate_->shouldAcceptNewConnection(*this, connection);

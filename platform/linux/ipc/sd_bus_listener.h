@@ -10,6 +10,7 @@
 #include "platform/base/log.h"
 #include "platform/entitlements.h"
 #include "platform/ipc/ipc.h"
+#include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/connection_registry.h"
 #include "platform/linux/ipc/ipc_limits.h"
 #include "platform/linux/ipc/listening_socket.h"
@@ -29,6 +30,8 @@ class SdBusListener final : public IpcListener {
     IpcLimits limits;
     // Who is at the other end of an accepted socket; readPeerCredentials but for tests.
     std::function<PeerCredentials(int socket)> readCredentials;
+    // Where files that clients hand over can be found; null: none are taken.
+    std::shared_ptr<ClientFileRegistry> clientFiles;
   };
 
   // The event loop's reference is held.

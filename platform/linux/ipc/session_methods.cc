@@ -1,8 +1,10 @@
 #include "platform/linux/ipc/session_methods.h"
 
+#include <fcntl.h>
 #include <systemd/sd-bus.h>
 
 #include <array>
+#include <cerrno>
 #include <cstring>
 #include <utility>
 
@@ -72,6 +74,16 @@ UploadReply uploadReply(const SessionCall& call) {
         return Error(wire::kErrorFailed, -1, "no memory");
       }
       return wire::appendMaybeError(m, error);
+    });
+  };
+}
+
+SuccessReply successReply(const SessionCall& call) {
+  if (!wantsReply(call)) return nullptr;
+  return [token = tokenOf(call)](bool success) mutable {
+    token.answer(kSmallAnswer, [success](sd_bus_message* m) -> MaybeError {
+      if (sd_bus_message_append(m, "b", success ? 1 : 0) >= 0) return std::nullopt;
+      return Error(wire::kErrorFailed, -1, "no memory");
     });
   };
 }
@@ -152,6 +164,25 @@ MaybeError uploadLogData(const SessionCall& call) {
   return std::nullopt;
 }
 
+// The token that the session gets in the place of the descriptor is good for as long as this call runs.
+MaybeError uploadFile(const SessionCall& call) {
+  const char* fileURL = nullptr;
+  int descriptor = -1;
+  if (sd_bus_message_read(call.message, "sh", &fileURL, &descriptor) < 0) {
+    return Error(
+        wire::kErrorInvalidArguments, -1,
+        "the file's descriptor is missing: it must come with the message, whose header announces it");
+  }
+  if (call.clientFiles == nullptr) return Error(wire::kErrorFailed, -1, "this service takes no files");
+  UniqueFd file(fcntl(descriptor, F_DUPFD_CLOEXEC, 3));
+  if (!file) {
+    return Error(wire::kErrorFailed, -1, std::string("the file cannot be taken: ") + std::strerror(errno));
+  }
+  const auto offer = call.clientFiles->offer(std::move(file), fileURL, call.link);
+  call.session.uploadFileAtPath(fileURL, offer.token(), successReply(call));
+  return std::nullopt;
+}
+
 MaybeError sendSingleMessage(const SessionCall& call) {
   auto sessionInfo = wire::readMaybeDictionary(call.message);
   if (!sessionInfo) return sessionInfo.error();
@@ -185,6 +216,7 @@ constexpr std::array kMethods{
     SessionMethod{wire::kFlushMessages, flushMessages},
     SessionMethod{wire::kFinishSession, finishSession},
     SessionMethod{wire::kUploadLogData, uploadLogData},
+    SessionMethod{wire::kUploadFile, uploadFile},
     SessionMethod{wire::kSendSingleMessage, sendSingleMessage},
 };
 

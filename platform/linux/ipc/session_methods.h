@@ -7,6 +7,7 @@
 #include "platform/base/error.h"
 #include "platform/base/log.h"
 #include "platform/ipc/client_session_interface.h"
+#include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/connection_link.h"
 
 struct sd_bus_message;
@@ -23,6 +24,7 @@ struct SessionCall {
   uint64_t serial;
   const std::string& peer;
   Log& log;
+  ClientFileRegistry* clientFiles;  // null: none are taken
 };
 
 // Decodes the arguments and calls the session's operation; its reply answers the call, from any thread.

@@ -1,0 +1,32 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstddef>
+#include <optional>
+#include <string_view>
+#include <vector>
+
+#include "platform/linux/unique_fd.h"
+
+// File descriptors that travel beside a connection's bytes. A D-Bus message announces in its header how many
+// belong to it, and they come with its first byte.
+
+namespace tarnel {
+
+// recv() without waiting, at most wire::kMaxDescriptors descriptors at once; they are appended to `into`. The
+// kernel closes further ones.
+ssize_t receiveWithDescriptors(int socket, char* room, size_t size, std::vector<UniqueFd>& into);
+
+// send() without waiting. Once anything was sent, the descriptors were, too.
+ssize_t sendWithDescriptors(int socket, std::string_view bytes, const std::vector<UniqueFd>& descriptors);
+
+// Longest header of a message with descriptors that is looked at, bytes.
+inline constexpr size_t kMaxHeaderWithDescriptors = 4096;
+
+// How many descriptors the message announces that begins with these bytes; nothing when its header cannot be
+// understood. The bytes must hold the whole header, which headerSize() tells from the first 16.
+std::optional<unsigned> announcedDescriptors(std::string_view message);
+size_t headerSize(std::string_view message);
+
+}  // namespace tarnel
