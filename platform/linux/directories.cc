@@ -1,6 +1,8 @@
 #include "platform/linux/directories.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstdlib>
@@ -8,6 +10,7 @@
 
 #include "platform/file_system.h"
 #include "platform/linux/file_access.h"
+#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 
@@ -46,13 +49,27 @@ std::string parentOf(const std::string& path) {
   return path.substr(0, path.rfind('/'));
 }
 
+// What root makes below somebody's directory is theirs: a daemon must not be locked out of its own state.
+MaybeError giveToParentsOwner(const std::string& path) {
+  if (::geteuid() != 0) return std::nullopt;
+  struct stat status {};
+  const UniqueFd made(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!made || ::fstatat(made.get(), "..", &status, 0) != 0 ||
+      ::fchown(made.get(), status.st_uid, status.st_gid) != 0) {
+    return systemError(path, "cannot be given to its directory's owner");
+  }
+  return std::nullopt;
+}
+
 }  // namespace
 
 MaybeError makeDirectories(const std::string& path, unsigned mode) {
   for (size_t slash = path.find('/', 1);; slash = path.find('/', slash + 1)) {
     const std::string part = path.substr(0, slash);
     // Only the first attempt to make it counts: somebody else may be making the same one.
-    if (::mkdir(part.c_str(), mode) != 0 && errno != EEXIST) {
+    if (::mkdir(part.c_str(), mode) == 0) {
+      if (auto error = giveToParentsOwner(part)) return error;
+    } else if (errno != EEXIST) {
       struct stat status {};
       const int reason = errno;
       const bool exists = ::stat(part.c_str(), &status) == 0;
@@ -90,9 +107,18 @@ std::vector<std::string> Directories::create() const {
   const auto make = [&failures](const std::string& path, unsigned mode) {
     if (const auto error = makeDirectories(path, mode)) failures.push_back(error->localizedDescription());
   };
-  make(runtime_, private_ ? 0700 : 0755);
-  make(state_, 0700);
-  make(logs_, 0700);
+  const auto makeWritable = [&failures, &make](const std::string& path, unsigned mode) {
+    const size_t before = failures.size();
+    make(path, mode);
+    if (failures.size() != before) return;
+    if (::faccessat(AT_FDCWD, path.c_str(), W_OK | X_OK, AT_EACCESS) == 0) return;
+    const std::string user = std::to_string(::geteuid());
+    failures.push_back(systemError(path, ("cannot be written by user " + user).c_str()).localizedDescription() +
+                       "; change that with: chown " + user + " " + path);
+  };
+  makeWritable(runtime_, private_ ? 0700 : 0755);
+  makeWritable(state_, 0700);
+  makeWritable(logs_, 0700);
   if (private_) make(configuration_, 0700);
   make(parentOf(messageLog_), 0700);
   return failures;

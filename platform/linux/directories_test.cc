@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <map>
 
@@ -81,6 +82,45 @@ TEST(Directories, MissingOnesAreMadeForTheOwnerAlone) {
   }
   // The message log makes its own when it writes.
   EXPECT_FALSE(folder.exists("logs/var/mobile/Library/Logs/Faultkeep/Retired"));
+}
+
+TEST(Directories, WhatRootMakesBelowAUsersDirectoryIsThatUsers) {
+  if (::geteuid() != 0) GTEST_SKIP() << "only root can give directories away";
+  const TemporaryFolder folder;
+  folder.makeDirectory("state");
+  ASSERT_EQ(::chown(folder.path("state").c_str(), 65534, 65533), 0);
+  EXPECT_FALSE(makeDirectories(folder.path("state/a/b"), 0700));
+  for (const char* name : {"state/a", "state/a/b"}) {
+    struct stat status {};
+    ASSERT_EQ(::stat(folder.path(name).c_str(), &status), 0) << name;
+    EXPECT_EQ(status.st_uid, 65534U) << name;
+    EXPECT_EQ(status.st_gid, 65533U) << name;
+  }
+}
+
+TEST(Directories, WhatCannotBeWrittenIsNamedWithTheRemedy) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs a directory of another user";
+  const TemporaryFolder folder;
+  ::chmod(folder.path().c_str(), 0755);
+  for (const char* name : {"run", "state", "logs", "etc", "logs/var/mobile/Library/Logs/Faultkeep"}) {
+    folder.makeDirectory(name);
+  }
+  const std::string said = runInChild([&folder] {
+    if (::setresuid(65534, 65534, 65534) != 0) return std::string("no other user");
+    const Directories directories = withEnvironment({{"RUNTIME_DIRECTORY", folder.path("run")},
+                                                     {"STATE_DIRECTORY", folder.path("state")},
+                                                     {"LOGS_DIRECTORY", folder.path("logs")},
+                                                     {"CONFIGURATION_DIRECTORY", folder.path("etc")}});
+    std::string lines;
+    for (const std::string& line : directories.create()) lines += line + "\n";
+    return lines;
+  });
+  std::string expected;
+  for (const char* name : {"run", "state", "logs"}) {
+    expected += folder.path(name) + ": cannot be written by user 65534: Permission denied; change that with: " +
+                "chown 65534 " + folder.path(name) + "\n";
+  }
+  EXPECT_EQ(said, expected);
 }
 
 TEST(Directories, WhatCannotBeMadeIsNamed) {

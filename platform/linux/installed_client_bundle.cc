@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "platform/cryptography.h"
 #include "platform/linux/file_access.h"
 
 namespace tarnel {
@@ -23,6 +24,23 @@ std::optional<Data> InstalledClientBundle::resource(std::string_view name, std::
   const auto contents = readFile(folder_ + "/" + file);
   if (!contents) return std::nullopt;
   return Data(contents->text.begin(), contents->text.end());
+}
+
+std::vector<std::string> InstalledClientBundle::problems() {
+  const std::string remedy = "; install libtarnel, or name the folder of another bundle with TARNEL_BUNDLE";
+  std::vector<std::string> problems;
+  const std::string key = folder_ + "/publicKey.der";
+  const auto contents = readFile(key);
+  const auto der = resource("publicKey", "der");
+  if (!contents) {
+    problems.push_back(contents.error().localizedDescription() + ", so no storebag can be verified" + remedy);
+  } else if (!der || RsaPublicKey::fromDer(*der) == nullptr) {
+    problems.push_back(key + ": holds no RSA public key in DER form, so no storebag can be verified" + remedy);
+  }
+  if (!version()) {
+    problems.push_back(folder_ + "/version: holds no version, so storebags are asked for as by 8.0" + remedy);
+  }
+  return problems;
 }
 
 }  // namespace tarnel

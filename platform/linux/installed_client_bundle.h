@@ -1,6 +1,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 #include "platform/client_bundle.h"
 
@@ -18,6 +19,9 @@ class InstalledClientBundle final : public ClientBundle {
   std::optional<std::string> version() override;
   // A name or type with a slash is no resource of the bundle. At most 1 MiB.
   std::optional<Data> resource(std::string_view name, std::string_view type) override;
+
+  // What keeps the service from using it, each with the remedy; empty when all is well.
+  std::vector<std::string> problems();
 
  private:
   const std::string folder_;

@@ -1,11 +1,24 @@
 #include "platform/linux/installed_client_bundle.h"
 
 #include <gtest/gtest.h>
+#include <openssl/rsa.h>
+#include <openssl/x509.h>
+
+#include <memory>
 
 #include "platform/linux/linux_test_support.h"
 
 namespace tarnel {
 namespace {
+
+std::string publicKeyDer() {
+  const std::unique_ptr<EVP_PKEY, decltype(&EVP_PKEY_free)> key(EVP_RSA_gen(2048), EVP_PKEY_free);
+  unsigned char* bytes = nullptr;
+  const int size = i2d_PUBKEY(key.get(), &bytes);
+  const std::string der(reinterpret_cast<const char*>(bytes), static_cast<size_t>(size));
+  OPENSSL_free(bytes);
+  return der;
+}
 
 TEST(InstalledClientBundle, HasAVersionAndResources) {
   const TemporaryFolder folder;
@@ -30,6 +43,26 @@ TEST(InstalledClientBundle, AVersionThatIsNoTextIsAbsent) {
     folder.write("version", text);
     EXPECT_FALSE(bundle.version());
   }
+}
+
+TEST(InstalledClientBundle, ItsProblemsAreNamedWithTheRemedy) {
+  const TemporaryFolder folder;
+  const std::string remedy = "; install libtarnel, or name the folder of another bundle with TARNEL_BUNDLE";
+  InstalledClientBundle bundle(folder.path("bundle"));
+  EXPECT_EQ(bundle.problems(),
+            (std::vector<std::string>{
+                folder.path("bundle/publicKey.der") +
+                    ": cannot be opened: No such file or directory, so no storebag can be verified" + remedy,
+                folder.path("bundle/version") + ": holds no version, so storebags are asked for as by 8.0" +
+                    remedy}));
+  folder.write("bundle/version", "8.2");
+  folder.write("bundle/publicKey.der", "no key");
+  EXPECT_EQ(bundle.problems(),
+            (std::vector<std::string>{folder.path("bundle/publicKey.der") +
+                                      ": holds no RSA public key in DER form, so no storebag can be verified" +
+                                      remedy}));
+  folder.write("bundle/publicKey.der", publicKeyDer());
+  EXPECT_TRUE(bundle.problems().empty());
 }
 
 TEST(InstalledClientBundle, NothingOutsideOfItIsAResource) {

@@ -88,7 +88,8 @@ void TomlSettingsStore::refresh(SettingsLayer layer, std::string_view domain, La
   const std::string file = path(layer, domain);
   const auto identity = fileIdentity(file);
   if (identity && identity == target.identity) return;
-  target = identity ? read(layer, file) : Layer();
+  // Without an identity there is mostly no file; one behind a closed directory must not look the same.
+  target = identity || errno != ENOENT ? read(layer, file) : Layer();
   if (!target.problem) return;
   const char* consequence = "; it is ignored until it is mended";
   if (layer == SettingsLayer::own) {

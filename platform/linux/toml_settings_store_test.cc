@@ -182,6 +182,21 @@ TEST_F(TomlSettingsStoreTest, AFileThatCannotBeReadIsLeftAlone) {
                                 ": is not a regular file; nothing can be stored until that is mended"}));
 }
 
+TEST_F(TomlSettingsStoreTest, AFileBehindAClosedDirectoryIsNotTakenForNone) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs a directory that another user may not enter";
+  folder_.write(kOwn, "a = 1\n");
+  ::chmod(folder_.path().c_str(), 0755);
+  ::chmod(folder_.path("state/settings").c_str(), 0700);
+  const std::string said = runInChild([this] {
+    if (::setresuid(65534, 65534, 65534) != 0) return std::string("no other user");
+    auto store = open();
+    if (store.objectForKey(kDomain, "a")) return std::string("it was read");
+    return logged().empty() ? std::string("nothing was said") : logged().front();
+  });
+  EXPECT_EQ(said, "TomlSettingsStore(read): " + folder_.path(kOwn) +
+                      ": cannot be opened: Permission denied; nothing can be stored until that is mended");
+}
+
 TEST_F(TomlSettingsStoreTest, WhatCannotBeStoredChangesNothing) {
   auto store = open();
   ASSERT_FALSE(store.setObject(kDomain, "a", Value(1)));
