@@ -1,5 +1,6 @@
 #include <array>
 
+#include "backends/dashboard/dashboard_backend.h"
 #include "backends/https/https_post_backend.h"
 #include "backends/tarnel_backend.h"
 #include "client/include/tarnel/keys.h"
@@ -28,6 +29,7 @@ struct Row {
 
 // A name that is missing here is an unknown one.
 constexpr std::array kRows{
+    Row{kTarnelBackendDashboard, make<DashboardBackend>},
     Row{kTarnelBackendHTTPPost, make<HTTPSPostBackend>},
     Row{kTarnelBackendHTTPPost2, make<HTTPSPostBackend>},
 };

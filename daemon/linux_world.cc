@@ -13,6 +13,7 @@
 #include "client/shared/tarnel_logging.h"
 #include "daemon/counted_http_client.h"
 #include "daemon/event_loop.h"
+#include "platform/linux/asio_work_queues.h"
 #include "platform/linux/configuration.h"
 #include "platform/linux/curl_http_client.h"
 #include "platform/linux/directories.h"
@@ -30,6 +31,7 @@
 #include "platform/linux/system_random.h"
 #include "platform/linux/toml_settings_store.h"
 #include "platform/linux/transaction_keep_alive.h"
+#include "platform/linux/udp_sockets.h"
 
 namespace tarnel {
 namespace {
@@ -86,10 +88,11 @@ struct LinuxWorld::Prepared {
         keepAlive({.idleExit = configuration.limits.idleExit,
                    .arm = [this](std::chrono::seconds delay,
                                  uint64_t generation) { loop.armTimer(delay, generation); },
-                   .isOtherWorkUnderWay = [this] { return http.underWay() != 0; },
+                   .isOtherWorkUnderWay = [this] { return http.underWay() != 0 || workQueues.sourcesUnderWay() != 0; },
                    .idle = [this] { loop.exit(); }}),
         consentIdentifiers(settings, consent, random),
-        process(*log, deviceInformation, settings) {
+        process(*log, deviceInformation, settings),
+        workQueues(*log) {
     loop.setTimerHandler([this](uint64_t generation) { keepAlive.idleTimeElapsed(generation); });
   }
 
@@ -120,6 +123,8 @@ struct LinuxWorld::Prepared {
   TransactionKeepAlive keepAlive;
   ConsentIdentifiers consentIdentifiers;
   ProcessValues process;
+  AsioWorkQueues workQueues;
+  UdpSockets datagramSockets;
   std::unique_ptr<ProcessWitness> witness;
   std::shared_ptr<EntitlementRules> entitlements;
   const Dependencies dependencies{.log = *log,
@@ -137,7 +142,9 @@ struct LinuxWorld::Prepared {
                                   .powerLog = powerLog,
                                   .consentIdentifiers = consentIdentifiers,
                                   .process = process,
-                                  .messageLogDirectory = directories.messageLogDirectory()};
+                                  .messageLogDirectory = directories.messageLogDirectory(),
+                                  .workQueues = workQueues,
+                                  .datagramSockets = datagramSockets};
 };
 
 LinuxWorld::LinuxWorld() = default;

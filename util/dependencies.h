@@ -7,6 +7,7 @@
 #include "platform/client_bundle.h"
 #include "platform/clock.h"
 #include "platform/consent.h"
+#include "platform/datagram_socket.h"
 #include "platform/device_information.h"
 #include "platform/file_system.h"
 #include "platform/http_client.h"
@@ -14,9 +15,14 @@
 #include "platform/locale_information.h"
 #include "platform/random.h"
 #include "platform/settings_store.h"
+#include "platform/work_queue.h"
 #include "util/process_values.h"
 
 namespace tarnel {
+
+// For worlds in which no datagrams are sent: they have neither queues nor sockets.
+inline WorkQueues noWorkQueues;
+inline DatagramSockets noDatagramSockets;
 
 // Everything through which the agent, its sessions and their backends reach the world. Built once, in main
 // or in a test fixture; outlives all of them.
@@ -35,6 +41,8 @@ struct Dependencies {
   ConsentIdentifiers& consentIdentifiers;
   ProcessValues& process;
   std::string messageLogDirectory;
+  WorkQueues& workQueues = noWorkQueues;
+  DatagramSockets& datagramSockets = noDatagramSockets;
 };
 
 }  // namespace tarnel

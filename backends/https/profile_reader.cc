@@ -4,8 +4,8 @@
 
 namespace tarnel {
 
-ProfileReader::ProfileReader(Log& log, std::string backendName, const char* operation)
-    : log_(log), backendName_(std::move(backendName)), operation_(operation) {}
+ProfileReader::ProfileReader(Log& log, std::string backendName, const char* operation, const char* className)
+    : log_(log), backendName_(std::move(backendName)), operation_(operation), className_(className) {}
 
 ProfileSection ProfileReader::section(const Dictionary& profile) {
   return {*this, profile, {}, {}};
@@ -13,7 +13,7 @@ ProfileSection ProfileReader::section(const Dictionary& profile) {
 
 void ProfileReader::warn(const std::string& shape, const std::string& place, const char* expected) {
   if (!warned_.insert(shape).second) return;
-  TARNEL_LOG(log_, warning, "HTTPSPostBackend(%s): %s: %s is not %s and counts as absent", operation_,
+  TARNEL_LOG(log_, warning, "%s(%s): %s: %s is not %s and counts as absent", className_, operation_,
              backendName_.c_str(), place.c_str(), expected);
 }
 

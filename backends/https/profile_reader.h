@@ -20,9 +20,10 @@ class ProfileSection;
 // Threads: one at a time.
 class ProfileReader {
  public:
-  // `operation` and `backendName` stand in the warnings. Log and profile must outlive this object and
-  // everything that it hands out.
-  ProfileReader(Log& log, std::string backendName, const char* operation);
+  // `className`, `operation` and `backendName` stand in the warnings. Log and profile must outlive this object
+  // and everything that it hands out.
+  ProfileReader(Log& log, std::string backendName, const char* operation,
+                const char* className = "HTTPSPostBackend");
 
   ProfileSection section(const Dictionary& profile);
 
@@ -33,6 +34,7 @@ class ProfileReader {
   Log& log_;
   std::string backendName_;
   const char* operation_;
+  const char* className_;
   std::set<std::string> warned_;  // shapes, so that their number is that of the keys we know
 };
 

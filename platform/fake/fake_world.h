@@ -2,12 +2,14 @@
 
 #include "client/shared/consent_identifiers.h"
 #include "platform/fake/fake_clock.h"
+#include "platform/fake/fake_datagram_sockets.h"
 #include "platform/fake/fake_device.h"
 #include "platform/fake/fake_file_system.h"
 #include "platform/fake/fake_http_client.h"
 #include "platform/fake/fake_log.h"
 #include "platform/fake/fake_random.h"
 #include "platform/fake/fake_settings_store.h"
+#include "platform/fake/fake_work_queues.h"
 #include "util/dependencies.h"
 
 namespace tarnel::fake {
@@ -28,6 +30,8 @@ struct FakeWorld {
   FakeKeepAlive keepAlive;
   ConsentIdentifiers consentIdentifiers{settings, consent, random};
   ProcessValues process{log, deviceInformation, settings};
+  FakeWorkQueues workQueues;
+  FakeDatagramSockets datagramSockets;
   Dependencies dependencies{.log = log,
                             .clock = clock,
                             .random = random,
@@ -41,7 +45,9 @@ struct FakeWorld {
                             .keepAlive = keepAlive,
                             .consentIdentifiers = consentIdentifiers,
                             .process = process,
-                            .messageLogDirectory = "/log/Retired"};
+                            .messageLogDirectory = "/log/Retired",
+                            .workQueues = workQueues,
+                            .datagramSockets = datagramSockets};
 };
 
 }  // namespace tarnel::fake

@@ -1,0 +1,58 @@
+#include <utility>
+
+#include "backends/dashboard/dashboard_backend.h"
+#include "platform/archive.h"
+
+// The upload of a client's log records.
+
+namespace tarnel {
+namespace {
+
+// Of a server's answer; a location is an address.
+constexpr size_t kMaxLoggedLocation = 4096;
+
+MaybeString logText(const MaybeString& location) {
+  if (!location || location->size() <= kMaxLoggedLocation) return location;
+  size_t end = kMaxLoggedLocation;
+  while (end > 0 && (static_cast<uint8_t>((*location)[end]) & 0xC0U) == 0x80U) --end;
+  return location->substr(0, end);
+}
+
+}  // namespace
+
+bool DashboardBackend::uploadLogData(const Array& logData) {
+  auto& log = dependencies().log;
+  if (!postURL) {
+    TARNEL_LOG(log, error, "DashboardBackend(uploadLogData): Post URL for log data array is nil");
+    return false;
+  }
+  auto archive = archiveObject(logData);
+  if (!archive) {
+    TARNEL_LOG(log, error, "DashboardBackend(uploadLogData): Failed to serialize log data array for upload");
+    TARNEL_LOG(log, warning, "DashboardBackend(uploadLogData): %s: %s", name().c_str(),
+               archive.error().description().c_str());
+    return false;
+  }
+  HttpRequest request;
+  request.method = "POST";
+  request.url = *postURL;
+  request.headers = {{"Content-Type", "application/octet-stream"}};
+  request.body = std::make_shared<const std::string>(std::move(*archive));
+  const HttpResult result = performAndWait(dependencies().http, std::move(request));
+  if (result.error || !result.data) {
+    TARNEL_LOG(log, error, "DashboardBackend(uploadLogData): Error uploading log data array (%s)",
+               result.error ? result.error->description().c_str() : "(null)");
+    return false;
+  }
+  // An answer that is no text names no location; the records have arrived all the same.
+  const MaybeString location = isValidUtf8(*result.data) ? MaybeString(*result.data) : std::nullopt;
+  TARNEL_LOG(log, debug, "DashboardBackend(uploadLogData): Log data uploaded to %s",
+             printable(logText(location)));
+  Dictionary payload;
+  if (location) payload.set("LogDataUploadLocation", *location);
+  // Through the flagged send, which for this backend ends in the base's default: no datagram is made.
+  sendMessage(payload, dependencies().clock.timeOfDay(), Method{0}, RespCode{2}, Flag::normal);
+  return true;
+}
+
+}  // namespace tarnel
