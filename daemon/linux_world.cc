@@ -27,6 +27,7 @@
 #include "platform/linux/linux_sandbox.h"
 #include "platform/linux/peer_credentials.h"
 #include "platform/linux/process_witness.h"
+#include "platform/linux/start_up_pages.h"
 #include "platform/linux/system_clock.h"
 #include "platform/linux/system_random.h"
 #include "platform/linux/toml_settings_store.h"
@@ -215,6 +216,7 @@ void LinuxWorld::notifyReady() {
 }
 
 int LinuxWorld::runEventLoop() {
+  releaseStartUpPages();
   const int status = prepared_->loop.run();
   if (status != 0) TARNEL_LOG(*log_, error, "main: the event loop failed; the daemon ends");
   ::sd_notify(0, "STOPPING=1");

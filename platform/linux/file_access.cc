@@ -69,7 +69,8 @@ std::optional<std::string> distrustDirectories(const std::string& path, int fd) 
 }
 
 MaybeError readAll(const std::string& path, int fd, size_t maxBytes, std::string& text) {
-  std::array<char, 16384> buffer;  // filled by read
+  // Small: a connection's thread keeps what its stack once touched. Filled by read.
+  std::array<char, 1024> buffer;
   for (;;) {
     const ssize_t count = ::read(fd, buffer.data(), buffer.size());
     if (count < 0 && errno == EINTR) continue;
