@@ -3,6 +3,7 @@
 #include "backends/dashboard/dashboard_backend.h"
 #include "backends/https/https_post_backend.h"
 #include "backends/tarnel_backend.h"
+#include "backends/upload/upload_backend.h"
 #include "client/include/tarnel/keys.h"
 
 namespace tarnel {
@@ -30,6 +31,7 @@ struct Row {
 // A name that is missing here is an unknown one.
 constexpr std::array kRows{
     Row{kTarnelBackendDashboard, make<DashboardBackend>},
+    Row{kTarnelBackendUploadServer, make<UploadBackend>},
     Row{kTarnelBackendHTTPPost, make<HTTPSPostBackend>},
     Row{kTarnelBackendHTTPPost2, make<HTTPSPostBackend>},
 };

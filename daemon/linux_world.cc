@@ -20,6 +20,7 @@
 #include "platform/linux/entitlement_rules.h"
 #include "platform/linux/file_consent.h"
 #include "platform/linux/installed_client_bundle.h"
+#include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/sd_bus_listener.h"
 #include "platform/linux/linux_device_information.h"
 #include "platform/linux/linux_file_system.h"
@@ -61,6 +62,14 @@ HttpClientOptions httpOptions(const Configuration& configuration) {
   options.connectionsPerHost = configuration.http.connectionsPerHost;
   options.connections = configuration.http.connections;
   return options;
+}
+
+UploadLimits uploadLimits(const Configuration& configuration) {
+  UploadLimits limits;
+  limits.fileBytes = configuration.limits.maxUploadBytes;
+  // The other half of what may wait in memory to be sent is for everything else.
+  limits.bytesUnderWay = configuration.http.maxQueuedBytes / 2;
+  return limits;
 }
 
 IpcLimits ipcLimits(const Configuration& configuration) {
@@ -124,6 +133,8 @@ struct LinuxWorld::Prepared {
   TransactionKeepAlive keepAlive;
   ConsentIdentifiers consentIdentifiers;
   ProcessValues process;
+  const std::shared_ptr<ClientFileRegistry> clientFiles = std::make_shared<ClientFileRegistry>(*log);
+  Uploads uploads{*clientFiles, uploadLimits(configuration)};
   AsioWorkQueues workQueues;
   UdpSockets datagramSockets;
   std::unique_ptr<ProcessWitness> witness;
@@ -143,6 +154,7 @@ struct LinuxWorld::Prepared {
                                   .powerLog = powerLog,
                                   .consentIdentifiers = consentIdentifiers,
                                   .process = process,
+                                  .uploads = uploads,
                                   .messageLogDirectory = directories.messageLogDirectory(),
                                   .workQueues = workQueues,
                                   .datagramSockets = datagramSockets};
@@ -206,7 +218,8 @@ std::unique_ptr<IpcListener> LinuxWorld::createListener(const char* /*serviceNam
       prepared_->loop.handle(),
       SdBusListener::Options{.runtimeDirectory = prepared_->directories.runtime(),
                              .limits = ipcLimits(prepared_->configuration),
-                             .readCredentials = readPeerCredentials},
+                             .readCredentials = readPeerCredentials,
+                             .clientFiles = prepared_->clientFiles},
       prepared_->entitlements, log_);
 }
 
@@ -218,6 +231,7 @@ void LinuxWorld::notifyReady() {
 int LinuxWorld::runEventLoop() {
   releaseStartUpPages();
   const int status = prepared_->loop.run();
+  prepared_->uploads.stop();  // the connections cannot end before their calls
   if (status != 0) TARNEL_LOG(*log_, error, "main: the event loop failed; the daemon ends");
   ::sd_notify(0, "STOPPING=1");
   return status;

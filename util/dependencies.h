@@ -17,6 +17,7 @@
 #include "platform/settings_store.h"
 #include "platform/work_queue.h"
 #include "util/process_values.h"
+#include "util/uploads.h"
 
 namespace tarnel {
 
@@ -40,6 +41,7 @@ struct Dependencies {
   KeepAlive& keepAlive;
   ConsentIdentifiers& consentIdentifiers;
   ProcessValues& process;
+  Uploads& uploads;
   std::string messageLogDirectory;
   WorkQueues& workQueues = noWorkQueues;
   DatagramSockets& datagramSockets = noDatagramSockets;

@@ -55,6 +55,7 @@ class MessageLogFilesTest : public testing::Test {
                              .keepAlive = world_.keepAlive,
                              .consentIdentifiers = world_.consentIdentifiers,
                              .process = world_.process,
+                             .uploads = world_.uploads,
                              .messageLogDirectory = {}};
 };
 

@@ -237,6 +237,7 @@ TEST_F(MessageLogTest, FileThatCannotBeDeletedIsReportedAndTheMessageStillWritte
                             .keepAlive = world_.keepAlive,
                             .consentIdentifiers = world_.consentIdentifiers,
                             .process = world_.process,
+                            .uploads = world_.uploads,
                             .messageLogDirectory = kDirectory};
   const auto old = addFile("tarneld_1_messageLog.diag", 90000);
   writeToLogFile(dependencies, "message");

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "client/shared/consent_identifiers.h"
+#include "platform/fake/fake_client_files.h"
 #include "platform/fake/fake_clock.h"
 #include "platform/fake/fake_datagram_sockets.h"
 #include "platform/fake/fake_device.h"
@@ -30,6 +31,8 @@ struct FakeWorld {
   FakeKeepAlive keepAlive;
   ConsentIdentifiers consentIdentifiers{settings, consent, random};
   ProcessValues process{log, deviceInformation, settings};
+  FakeClientFiles clientFiles;
+  Uploads uploads{clientFiles};
   FakeWorkQueues workQueues;
   FakeDatagramSockets datagramSockets;
   Dependencies dependencies{.log = log,
@@ -45,6 +48,7 @@ struct FakeWorld {
                             .keepAlive = keepAlive,
                             .consentIdentifiers = consentIdentifiers,
                             .process = process,
+                            .uploads = uploads,
                             .messageLogDirectory = "/log/Retired",
                             .workQueues = workQueues,
                             .datagramSockets = datagramSockets};

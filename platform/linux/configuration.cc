@@ -134,6 +134,19 @@ void applyFile(const std::string& path, Configuration& configuration) {
   }
 }
 
+// A file is compressed and sent from memory, where other uploads and posts need room as well.
+void fitUploads(const std::string& configurationDirectory, Configuration& configuration) {
+  auto& allowed = configuration.limits.maxUploadBytes;
+  const uint64_t most = configuration.http.maxQueuedBytes / 2;
+  if (allowed <= most) return;
+  configuration.problems.push_back(
+      {LogLevel::warning,
+       configurationDirectory + ": limits.max_upload_bytes is " + std::to_string(allowed) +
+           ", but must not be more than half of http.max_queued_bytes: " + std::to_string(most) +
+           " is used; raise http.max_queued_bytes to " + std::to_string(allowed * 2)});
+  allowed = most;
+}
+
 void listTrustFiles(const std::string& directory, Configuration& configuration) {
   for (const std::string& name : sortedEntries(directory, ".pem")) {
     const std::string path = directory + "/" + name;
@@ -160,6 +173,7 @@ Configuration loadConfiguration(const std::string& configurationDirectory) {
   for (const std::string& name : sortedEntries(dropIns, ".toml")) {
     applyFile(dropIns + "/" + name, configuration);
   }
+  fitUploads(configurationDirectory, configuration);
   listTrustFiles(configurationDirectory + "/trust.d", configuration);
   return configuration;
 }

@@ -31,7 +31,7 @@ TEST(Configuration, WithoutFilesTheDefaultsHold) {
   EXPECT_EQ(configuration.limits.connections, 1024U);
   EXPECT_EQ(configuration.limits.connectionsPerUser, 64U);
   EXPECT_EQ(configuration.limits.idleExit.count(), 0);
-  EXPECT_EQ(configuration.limits.maxUploadBytes, 268435456U);
+  EXPECT_EQ(configuration.limits.maxUploadBytes, 33554432U);
   EXPECT_EQ(configuration.http.connectTimeout.count(), 30);
   EXPECT_EQ(configuration.http.noProgress.count(), 60);
   EXPECT_EQ(configuration.http.maxAnswerBytes, 8388608U);
@@ -83,6 +83,19 @@ TEST(Configuration, LaterFilesWinKeyByKey) {
   const Configuration configuration = loadConfiguration(folder.path());
   EXPECT_EQ(configuration.limits.connections, 20U);
   EXPECT_EQ(configuration.limits.connectionsPerUser, 10U);
+}
+
+TEST(Configuration, AnUploadFitsIntoHalfOfWhatMayBeQueued) {
+  const TemporaryFolder folder;
+  folder.write("tarneld.toml", "[limits]\nmax_upload_bytes = 3000\n[http]\nmax_queued_bytes = 6000\n");
+  EXPECT_THAT(texts(loadConfiguration(folder.path())), ElementsAre());
+  folder.write("tarneld.toml", "[limits]\nmax_upload_bytes = 3001\n[http]\nmax_queued_bytes = 6000\n");
+  const Configuration configuration = loadConfiguration(folder.path());
+  EXPECT_EQ(configuration.limits.maxUploadBytes, 3000U);
+  EXPECT_THAT(texts(configuration),
+              ElementsAre(folder.path() +
+                          ": limits.max_upload_bytes is 3001, but must not be more than half of "
+                          "http.max_queued_bytes: 3000 is used; raise http.max_queued_bytes to 6002"));
 }
 
 TEST(Configuration, UnknownKeysAreNamedWithFileAndLine) {
