@@ -1,10 +1,13 @@
 #include <array>
 
 #include "backends/dashboard/dashboard_backend.h"
+#include "backends/dravik/dravik_backend.h"
 #include "backends/https/https_post_backend.h"
 #include "backends/tarnel_backend.h"
+#include "backends/vesmer/vesmer_backend.h"
 #include "backends/upload/upload_backend.h"
 #include "client/include/tarnel/keys.h"
+#include "util/device_facts.h"
 
 namespace tarnel {
 namespace {
@@ -23,9 +26,17 @@ std::shared_ptr<TarnelBackend> make(const Blueprint& blueprint) {
                                blueprint.productFamily);
 }
 
+std::shared_ptr<TarnelBackend> makeDravik(const Blueprint& blueprint) {
+  return DravikBackend::initWithName(blueprint.dependencies, blueprint.name, blueprint.profile,
+                                     blueprint.productFamily, blueprint.clientType);
+}
+
+enum class Machines { all, notDesktop };
+
 struct Row {
   const char* name;
   std::shared_ptr<TarnelBackend> (*make)(const Blueprint&);
+  Machines machines = Machines::all;
 };
 
 // A name that is missing here is an unknown one.
@@ -34,7 +45,14 @@ constexpr std::array kRows{
     Row{kTarnelBackendUploadServer, make<UploadBackend>},
     Row{kTarnelBackendHTTPPost, make<HTTPSPostBackend>},
     Row{kTarnelBackendHTTPPost2, make<HTTPSPostBackend>},
+    Row{kTarnelBackendVesmer, make<VesmerBackend>},
+    Row{kTarnelBackendDravik, makeDravik, Machines::notDesktop},
 };
+
+// Where a backend is not made, its name is unknown.
+bool isMadeHere(const Row& row, const Dependencies& dependencies) {
+  return row.machines == Machines::all || productType(dependencies.deviceInformation) != "Deskbox";
+}
 
 MaybeDictionary profileFrom(const Dependencies& dependencies, const std::string& name, const Value& section) {
   if (const auto* profile = section.dictionary()) return *profile;
@@ -52,7 +70,7 @@ std::shared_ptr<TarnelBackend> TarnelBackend::newBackendWithName(const Dependenc
                                                                  const MaybeString& productFamily,
                                                                  int32_t clientType) {
   for (const auto& row : kRows) {
-    if (name != row.name) continue;
+    if (name != row.name || !isMadeHere(row, dependencies)) continue;
     const auto section = profileFrom(dependencies, name, profile);
     return row.make({dependencies, name, section, productFamily, clientType});
   }

@@ -3,7 +3,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include "backends/dravik/dravik_backend.h"
 #include "backends/https/https_post_backend.h"
+#include "backends/vesmer/vesmer_backend.h"
 #include "client/include/tarnel/keys.h"
 #include "platform/fake/fake_world.h"
 
@@ -193,6 +195,36 @@ TEST_F(TarnelBackendTest, FactoryComparesNamesExactly) {
     EXPECT_TRUE(
         world.log.contains(LogLevel::error, std::string("TarnelBackend(newBackendWithName): ") + name));
   }
+}
+
+TEST_F(TarnelBackendTest, FactoryMakesTheForwardingBackends) {
+  EXPECT_NE(std::dynamic_pointer_cast<VesmerBackend>(fromFactory(kTarnelBackendVesmer, profile)), nullptr);
+  EXPECT_NE(std::dynamic_pointer_cast<DravikBackend>(fromFactory(kTarnelBackendDravik, profile)), nullptr);
+  EXPECT_TRUE(world.log.startingWith("TarnelBackend").empty());
+}
+
+TEST_F(TarnelBackendTest, FactoryHandsTheClientTypeToTheDravikBackendAlone) {
+  for (const int32_t refused : {6, 8, 12, 14}) {
+    const auto make = [this, refused](const char* name) {
+      return TarnelBackend::newBackendWithName(world.dependencies, name, profile, "family", refused);
+    };
+    EXPECT_EQ(make(kTarnelBackendDravik), nullptr);
+    EXPECT_NE(make(kTarnelBackendVesmer), nullptr);
+    EXPECT_NE(make(kTarnelBackendHTTPPost), nullptr);
+  }
+  EXPECT_TRUE(world.log.startingWith("TarnelBackend").empty()) << "the name is known";
+}
+
+TEST_F(TarnelBackendTest, FactoryTakesOnlyTheWholeNameOfTheDesktopMachine) {
+  for (const char* type : {"", "Deskbox1,1", "deskbox", "Deskbox "}) {
+    world.deviceInformation.answers["ProductType"] = type;
+    EXPECT_NE(fromFactory(kTarnelBackendDravik, profile), nullptr) << type;
+  }
+  world.deviceInformation.answers.erase("ProductType");
+  EXPECT_NE(fromFactory(kTarnelBackendDravik, profile), nullptr) << "no answer";
+  world.deviceInformation.answers["ProductType"] = "Deskbox";
+  EXPECT_NE(fromFactory(kTarnelBackendVesmer, profile), nullptr);
+  EXPECT_NE(fromFactory(kTarnelBackendHTTPPost, profile), nullptr);
 }
 
 TEST_F(TarnelBackendTest, FactoryMakesNoDravikBackendOnADesktopMachine) {

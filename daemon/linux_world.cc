@@ -17,6 +17,7 @@
 #include "platform/linux/configuration.h"
 #include "platform/linux/curl_http_client.h"
 #include "platform/linux/directories.h"
+#include "platform/linux/dl_code_bundle.h"
 #include "platform/linux/entitlement_rules.h"
 #include "platform/linux/file_consent.h"
 #include "platform/linux/installed_client_bundle.h"
@@ -25,6 +26,7 @@
 #include "platform/linux/linux_device_information.h"
 #include "platform/linux/linux_file_system.h"
 #include "platform/linux/linux_locale_information.h"
+#include "platform/linux/linux_power_log.h"
 #include "platform/linux/linux_sandbox.h"
 #include "platform/linux/peer_credentials.h"
 #include "platform/linux/process_witness.h"
@@ -100,6 +102,8 @@ struct LinuxWorld::Prepared {
                                  uint64_t generation) { loop.armTimer(delay, generation); },
                    .isOtherWorkUnderWay = [this] { return http.underWay() != 0 || workQueues.sourcesUnderWay() != 0; },
                    .idle = [this] { loop.exit(); }}),
+        codeBundles(configuration.bundleRoot, *log),
+        powerLog({.file = powerLogFile(directories, kJournalSocket)}, clock, *log),
         consentIdentifiers(settings, consent, random),
         process(*log, deviceInformation, settings),
         workQueues(*log) {
@@ -131,6 +135,8 @@ struct LinuxWorld::Prepared {
   CurlHttpClient curl;
   CountedHttpClient http;
   TransactionKeepAlive keepAlive;
+  DlCodeBundles codeBundles;
+  LinuxPowerLog powerLog;
   ConsentIdentifiers consentIdentifiers;
   ProcessValues process;
   const std::shared_ptr<ClientFileRegistry> clientFiles = std::make_shared<ClientFileRegistry>(*log);
@@ -204,8 +210,9 @@ void LinuxWorld::prepareForConfinement() {
 }
 
 std::optional<std::string> LinuxWorld::enterSandbox(const char* profileName) {
-  LinuxSandbox sandbox(prepared_->directories.configuration(),
-                       sandboxVariables(prepared_->directories, prepared_->bundleFolder));
+  LinuxSandbox sandbox(
+      prepared_->directories.configuration(),
+      sandboxVariables(prepared_->directories, prepared_->bundleFolder, prepared_->configuration.bundleRoot));
   return sandbox.enter(profileName);
 }
 

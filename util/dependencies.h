@@ -6,6 +6,7 @@
 #include "platform/base/log.h"
 #include "platform/client_bundle.h"
 #include "platform/clock.h"
+#include "platform/code_bundle.h"
 #include "platform/consent.h"
 #include "platform/datagram_socket.h"
 #include "platform/device_information.h"
@@ -13,6 +14,7 @@
 #include "platform/http_client.h"
 #include "platform/keep_alive.h"
 #include "platform/locale_information.h"
+#include "platform/power_log.h"
 #include "platform/random.h"
 #include "platform/settings_store.h"
 #include "platform/work_queue.h"
@@ -39,6 +41,8 @@ struct Dependencies {
   FileSystem& files;
   ClientBundle& clientBundle;
   KeepAlive& keepAlive;
+  CodeBundles& codeBundles;
+  PowerLog& powerLog;
   ConsentIdentifiers& consentIdentifiers;
   ProcessValues& process;
   Uploads& uploads;

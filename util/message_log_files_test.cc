@@ -53,6 +53,8 @@ class MessageLogFilesTest : public testing::Test {
                              .files = files_,
                              .clientBundle = world_.clientBundle,
                              .keepAlive = world_.keepAlive,
+                             .codeBundles = world_.codeBundles,
+                             .powerLog = world_.powerLog,
                              .consentIdentifiers = world_.consentIdentifiers,
                              .process = world_.process,
                              .uploads = world_.uploads,

@@ -235,6 +235,8 @@ TEST_F(MessageLogTest, FileThatCannotBeDeletedIsReportedAndTheMessageStillWritte
                             .files = files,
                             .clientBundle = world_.clientBundle,
                             .keepAlive = world_.keepAlive,
+                            .codeBundles = world_.codeBundles,
+                            .powerLog = world_.powerLog,
                             .consentIdentifiers = world_.consentIdentifiers,
                             .process = world_.process,
                             .uploads = world_.uploads,

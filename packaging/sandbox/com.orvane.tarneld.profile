@@ -13,6 +13,7 @@ read = [
   "/dev/urandom",
   "${CONFIGURATION}",
   "${BUNDLE}",
+  "${BUNDLE_ROOT}/System/Library/PrivateFrameworks/PlexorServices.framework",  # the diagnostics adaptor
 ]
 read_write = [
   "${RUNTIME}",                   # the service's socket

@@ -4,10 +4,12 @@
 #include "platform/fake/fake_client_files.h"
 #include "platform/fake/fake_clock.h"
 #include "platform/fake/fake_datagram_sockets.h"
+#include "platform/fake/fake_code_bundles.h"
 #include "platform/fake/fake_device.h"
 #include "platform/fake/fake_file_system.h"
 #include "platform/fake/fake_http_client.h"
 #include "platform/fake/fake_log.h"
+#include "platform/fake/fake_power_log.h"
 #include "platform/fake/fake_random.h"
 #include "platform/fake/fake_settings_store.h"
 #include "platform/fake/fake_work_queues.h"
@@ -29,6 +31,8 @@ struct FakeWorld {
   FakeFileSystem files{clock};
   FakeClientBundle clientBundle;
   FakeKeepAlive keepAlive;
+  FakeCodeBundles codeBundles;
+  FakePowerLog powerLog;
   ConsentIdentifiers consentIdentifiers{settings, consent, random};
   ProcessValues process{log, deviceInformation, settings};
   FakeClientFiles clientFiles;
@@ -46,6 +50,8 @@ struct FakeWorld {
                             .files = files,
                             .clientBundle = clientBundle,
                             .keepAlive = keepAlive,
+                            .codeBundles = codeBundles,
+                            .powerLog = powerLog,
                             .consentIdentifiers = consentIdentifiers,
                             .process = process,
                             .uploads = uploads,

@@ -71,10 +71,33 @@ const char* takeCountry(const TomlNode& node, Configuration& configuration) {
   return nullptr;
 }
 
+// The root of the file system is written as the empty text.
+bool isPlainPath(std::string_view path) {
+  if (path.empty()) return true;
+  if (path.front() != '/' || path.find('\0') != std::string_view::npos) return false;
+  for (size_t start = 1; start <= path.size();) {
+    const size_t end = std::min(path.find('/', start), path.size());
+    const std::string_view part = path.substr(start, end - start);
+    if (part.empty() || part == "." || part == "..") return false;
+    start = end + 1;
+  }
+  return true;
+}
+
+const char* takeBundleRoot(const TomlNode& node, Configuration& configuration) {
+  const std::string* path = node.scalar.string();
+  if (path == nullptr || !isPlainPath(*path)) {
+    return "an absolute path without \".\", \"..\" and superfluous slashes, or the empty text";
+  }
+  configuration.bundleRoot = *path;
+  return nullptr;
+}
+
 using C = Configuration;
 constexpr std::array kRules{
     KeyRule{"log", "level", takeLogLevel},
     KeyRule{"locale", "country", takeCountry},
+    KeyRule{"bundles", "root", takeBundleRoot},
     KeyRule{"limits", "idle_exit_seconds", takeIdleExit},
     KeyRule{"limits", "connections",
             [](const TomlNode& node, C& c) { return takeCount(node, c.limits.connections); }},

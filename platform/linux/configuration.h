@@ -45,6 +45,7 @@ struct Configuration {
   std::optional<std::string> country;  // ISO 3166, upper case; nothing: from the locale
   Limits limits;
   Http http;
+  std::string bundleRoot;  // before the paths of code bundles: absolute, without a slash at the end; or empty
   std::vector<std::string> trustFiles;  // PEM files beside the system's certificates
   std::vector<ConfigurationProblem> problems;
 };

@@ -36,20 +36,6 @@ FileIdentity identityOf(const struct stat& status) {
                       .changedNanoseconds = nanoseconds(status.st_ctim)};
 }
 
-// Why it cannot be trusted, with the remedy; nothing when it can.
-std::optional<std::string> distrust(const std::string& path, const struct stat& status, const char* kind) {
-  if (status.st_uid != 0 && status.st_uid != ::geteuid()) {
-    return std::string(kind) + " belongs to user " + std::to_string(status.st_uid) +
-           ", who is neither root nor the user this runs as (" + std::to_string(::geteuid()) +
-           "); change that with: chown root " + path;
-  }
-  if ((status.st_mode & (S_IWGRP | S_IWOTH)) != 0) {
-    return std::string(kind) + " can be written by its group or by others; change that with: chmod go-w " +
-           path;
-  }
-  return std::nullopt;
-}
-
 // The directories that decide what the name stands for: the one that was named, and behind a symbolic link
 // the one in which the file really lies.
 std::optional<std::string> distrustDirectories(const std::string& path, int fd) {
@@ -109,6 +95,19 @@ MaybeError syncDirectory(const std::string& directory) {
 }
 
 }  // namespace
+
+std::optional<std::string> distrust(const std::string& path, const struct stat& status, const char* kind) {
+  if (status.st_uid != 0 && status.st_uid != ::geteuid()) {
+    return std::string(kind) + " belongs to user " + std::to_string(status.st_uid) +
+           ", who is neither root nor the user this runs as (" + std::to_string(::geteuid()) +
+           "); change that with: chown root " + path;
+  }
+  if ((status.st_mode & (S_IWGRP | S_IWOTH)) != 0) {
+    return std::string(kind) + " can be written by its group or by others; change that with: chmod go-w " +
+           path;
+  }
+  return std::nullopt;
+}
 
 Error systemError(const std::string& path, const char* action) {
   const int code = errno;

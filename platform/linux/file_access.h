@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/stat.h>
+
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -37,6 +39,10 @@ enum class FileTrust {
   trusted,  // owned by root or by this process's user, and neither the file nor its directory may be
             // written by anybody else
 };
+
+// Why a file or directory of that status is not `trusted`, with the remedy; nothing when it is. `kind` begins
+// the text ("it", "its directory").
+std::optional<std::string> distrust(const std::string& path, const struct stat& status, const char* kind);
 
 // A configuration, settings or profile file is never larger.
 inline constexpr size_t kMaxFileBytes = 1U << 20U;

@@ -107,14 +107,16 @@ std::optional<std::string> LinuxSandbox::probe() const {
   return std::nullopt;
 }
 
-SandboxVariables sandboxVariables(const Directories& directories, const std::string& bundleFolder) {
+SandboxVariables sandboxVariables(const Directories& directories, const std::string& bundleFolder,
+                                  const std::string& bundleRoot) {
   const std::string& messages = directories.messageLogDirectory();
   return {{"RUNTIME", directories.runtime()},
           {"STATE", directories.state()},
           {"LOGS", directories.logs()},
           {"CONFIGURATION", directories.configuration()},
           {"MESSAGE_LOGS", messages.substr(0, messages.rfind('/'))},
-          {"BUNDLE", bundleFolder}};
+          {"BUNDLE", bundleFolder},
+          {"BUNDLE_ROOT", bundleRoot}};
 }
 
 void preloadLazyFacilities() {

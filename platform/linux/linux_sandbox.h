@@ -27,8 +27,10 @@ class LinuxSandbox final : public Sandbox {
   const SandboxVariables variables_;
 };
 
-// RUNTIME, STATE, LOGS, CONFIGURATION, MESSAGE_LOGS (the parent of the message log's directory) and BUNDLE.
-SandboxVariables sandboxVariables(const Directories& directories, const std::string& bundleFolder);
+// RUNTIME, STATE, LOGS, CONFIGURATION, MESSAGE_LOGS (the parent of the message log's directory), BUNDLE (the
+// client library's) and BUNDLE_ROOT (what stands before the paths of code bundles).
+SandboxVariables sandboxVariables(const Directories& directories, const std::string& bundleFolder,
+                                  const std::string& bundleRoot);
 
 // Loads what the C library would otherwise load at first use, when files may be out of reach: the name
 // service, user data and the time zone. To be called before enter().

@@ -53,7 +53,8 @@ class LinuxSandboxTest : public testing::Test {
                                       {"LOGS", path("logs")},
                                       {"CONFIGURATION", path("etc")},
                                       {"MESSAGE_LOGS", path("logs/messages")},
-                                      {"BUNDLE", path("bundle")}});
+                                      {"BUNDLE", path("bundle")},
+                                      {"BUNDLE_ROOT", path("root")}});
   }
 
   // What entering says, in a process of its own.
@@ -299,8 +300,8 @@ TEST_F(LinuxSandboxTest, EveryMistakeOfAProfileIsRefusedWithItsLine) {
       {"[network]\nbind_tcp = [\"443\"]\n", "a port must be an integer from 0 to 65535"},
       {"[calls]\ndeny = [1]\n", "calls.deny must hold names of system calls"},
       {"[files]\nread = [\"${HOME}/x\"]\n",
-       "unknown variable at the start of \"${HOME}/x\", known are ${BUNDLE}, ${CONFIGURATION}, ${LOGS}, "
-       "${MESSAGE_LOGS}, ${RUNTIME}, ${STATE}"},
+       "unknown variable at the start of \"${HOME}/x\", known are ${BUNDLE}, ${BUNDLE_ROOT}, "
+       "${CONFIGURATION}, ${LOGS}, ${MESSAGE_LOGS}, ${RUNTIME}, ${STATE}"},
   };
   for (const auto& one : cases) {
     writeProfile(one.text);
