@@ -25,6 +25,7 @@ std::map<std::string, std::string> identifiersOf(const PrivateInstance& instance
   options.program = kTarnelctl;
   options.arguments = {"settings", "list", "com.orvane.tarnel", "--json"};
   options.environment = instance.environment();
+  options.account = unprivilegedAccount();
   const auto listed = runProcess(options);
   EXPECT_EQ(listed.end.status, 0) << listed.errors;
   EXPECT_EQ(listed.errors, "");

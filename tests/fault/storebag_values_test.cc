@@ -9,8 +9,8 @@
 #include "tests/helpers/storebags.h"
 #include "tests/helpers/test_session.h"
 
-// Verified storebags whose values are of every wrong kind. Such a value counts as absent, one warning names it,
-// and the daemon goes on.
+// Verified storebags whose values are of every wrong kind. Such a value counts as absent, one warning names
+// it, and the daemon goes on.
 
 namespace tarnel::test {
 namespace {
@@ -38,7 +38,8 @@ std::vector<Kind> kinds() {
 const std::set<std::string> kNumbers{"boolean", "integer", "huge", "real"};
 const std::set<std::string> kTexts{"text"};
 const std::set<std::string> kArrays{"array"};
-const std::set<std::string> kAny{"boolean", "integer", "huge", "real", "text", "data", "date", "array", "dictionary"};
+const std::set<std::string> kAny{"boolean", "integer", "huge",  "real",      "text",
+                                 "data",    "date",    "array", "dictionary"};
 
 struct Key {
   const char* name;
@@ -124,8 +125,11 @@ TEST_F(StorebagValuesTest, EveryKeyOfASection) {
     warningsOf({{"httppost", kind.value}, {"httppost2", profile({entry})}});
     for (const char* backend : {"dashboard", "uploadserver", "dravik", "vesmer"}) {
       warningsOf({{backend, kind.value}});
-      warningsOf({{backend, Dictionary{{"post_url", kind.value}, {"display_url", kind.value}, {"port", kind.value},
-                                       {"reliable", kind.value}, {"active", kind.value}}}});
+      warningsOf({{backend, Dictionary{{"post_url", kind.value},
+                                       {"display_url", kind.value},
+                                       {"port", kind.value},
+                                       {"reliable", kind.value},
+                                       {"active", kind.value}}}});
     }
     ASSERT_FALSE(HasFailure());
   }

@@ -29,9 +29,9 @@ struct ProcessOptions {
   std::vector<std::string> arguments;
   // "NAME=VALUE". Of this process's own environment a program gets what it needs to run, nothing else.
   std::vector<std::string> environment;
-  std::optional<Account> account;           // none: this process's own
-  std::vector<gid_t> supplementaryGroups;   // with an account
-  std::vector<int> descriptors;             // become 3, 4, ...
+  std::optional<Account> account;                // none: this process's own
+  std::vector<gid_t> supplementaryGroups;        // with an account
+  std::vector<int> descriptors;                  // become 3, 4, ...
   bool descriptorsAreForServiceManager = false;  // adds LISTEN_FDS and LISTEN_PID
 };
 

@@ -54,8 +54,11 @@ class FileWatch {
 LabProcess::LabProcess() {
   ProcessOptions options;
   options.program = kTarnelLab;
-  options.arguments = {"--directory", folder_.path(), "--port", "0", "--control-port", "0",
-                       "--ready-file", folder_.path("ready.json"), "--json"};
+  options.arguments = {"--directory",    folder_.path(),
+                       "--port",         "0",
+                       "--control-port", "0",
+                       "--ready-file",   folder_.path("ready.json"),
+                       "--json"};
   options.account = unprivilegedAccount();
   process_ = std::make_unique<ChildProcess>(options);
   // Keys are made on the first start.

@@ -49,7 +49,8 @@ class LabProcess {
 
   // Forgets what arrived so far and behaves well again.
   void reset();
-  // What arrived since then, in the order of arrival: {"path", "headers", "clientId", "postTime", "event", ...}.
+  // What arrived since then, in the order of arrival: {"path", "headers", "clientId", "postTime", "event",
+  // ...}.
   std::vector<Dictionary> events() const;
   // Posts with "problems" and without "event".
   std::vector<Dictionary> posts() const;

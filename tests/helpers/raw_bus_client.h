@@ -32,8 +32,8 @@ class RawBusClient {
   UniqueFd socket_;
 };
 
-// A method call of the session interface as it goes over the wire. bodySize may lie; a call without `wantsReply`
-// is not answered.
+// A method call of the session interface as it goes over the wire. bodySize may lie; a call without
+// `wantsReply` is not answered.
 struct RawCall {
   std::string_view member;
   std::string_view signature = {};

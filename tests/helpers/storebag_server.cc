@@ -71,10 +71,8 @@ void StorebagServer::say(const std::string& name, const std::string& bytes) {
 
 void StorebagServer::answer(const std::string& name, const std::string& body,
                             const std::string& headerLines) {
-  behave(name, [answer = httpAnswer("200 OK", body, headerLines)](RawConnection& connection,
-                                                                   const std::string&) {
-    return connection.write(answer);
-  });
+  behave(name, [answer = httpAnswer("200 OK", body, headerLines)](
+                   RawConnection& connection, const std::string&) { return connection.write(answer); });
 }
 
 void StorebagServer::serve(const std::string& name, const Dictionary& inner) {

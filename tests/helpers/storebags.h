@@ -37,7 +37,8 @@ inline Dictionary profile(Array clients) {
   return {{"display_url", "https://display.example/"}, {"clients", std::move(clients)}};
 }
 
-// A whole storebag: the sections of its backends under every environment that is served without one of its own.
+// A whole storebag: the sections of its backends under every environment that is served without one of its
+// own.
 inline Dictionary storebag(const std::string& version, Dictionary backends) {
   return {{"version", version}, {"refresh_cycle", 3600}, {"release", std::move(backends)}};
 }

@@ -45,7 +45,9 @@ class Aggregate {
     };
     return options;
   }
-  bool waitForEnd() { return wait([this] { return ends_ > 0; }); }
+  bool waitForEnd() {
+    return wait([this] { return ends_ > 0; });
+  }
   bool waitFor(const std::string& text) {
     return wait([this, &text] { return std::find(seen_.begin(), seen_.end(), text) != seen_.end(); });
   }
@@ -158,7 +160,8 @@ TEST_F(HierarchyTest, ChildrenTakeTheirParentsState) {
   TestSession top(instance, {.clientType = kTop});
   EXPECT_THAT(top.backends(), IsEmpty());
   TestSession child(instance, {.clientType = kChild});
-  EXPECT_THAT(child.backends(), IsEmpty()) << "one is off with the parent's, the other has none at the parent";
+  EXPECT_THAT(child.backends(), IsEmpty())
+      << "one is off with the parent's, the other has none at the parent";
 }
 
 TEST_F(HierarchyTest, NewUserInfoMovesASessionToOtherParents) {

@@ -11,8 +11,8 @@
 #include "tests/helpers/storebags.h"
 #include "tests/helpers/test_session.h"
 
-// From a client's message to the event that arrives at a reporting server, through real processes, sockets and
-// TLS.
+// From a client's message to the event that arrives at a reporting server, through real processes, sockets
+// and TLS.
 
 namespace tarnel::test {
 namespace {
@@ -153,8 +153,9 @@ TEST_F(MainRoadTest, TwoBackendsGetEveryMessageAndAFlushIsAnsweredOnce) {
   auto second = entry();
   second.set("post_url", lab.url() + "/second");
   second.set("realtime_post_url", lab.url() + "/second");
-  lab.serve("brevan",
-            storebag("2", {{"httppost", profile({entry()})}, {"httppost2", profile({second})}, {"nonsense", 1}}));
+  lab.serve(
+      "brevan",
+      storebag("2", {{"httppost", profile({entry()})}, {"httppost2", profile({second})}, {"nonsense", 1}}));
   ASSERT_TRUE(instance.start());
   TestSession session(instance, {.batch = true});
   EXPECT_THAT(session.backends(), UnorderedElementsAre("httppost", "httppost2"));
@@ -170,7 +171,8 @@ TEST_F(MainRoadTest, TwoBackendsGetEveryMessageAndAFlushIsAnsweredOnce) {
   ASSERT_TRUE(session.session.drain(kDeadline));
   EXPECT_EQ(answers, 1);
   std::multiset<std::string> seen;
-  for (const auto& arrival : lab.waitForEvents(4)) seen.insert(textIn(arrival, "path") + " " + kindOf(arrival));
+  for (const auto& arrival : lab.waitForEvents(4))
+    seen.insert(textIn(arrival, "path") + " " + kindOf(arrival));
   EXPECT_THAT(seen, UnorderedElementsAre("/v1/events 0/0", "/v1/events 3/4", "/second 0/0", "/second 3/4"));
   // Nothing is left: the first backend says so, the second does not answer again.
   const auto empty = session.session.flushAndWait(kDeadline);

@@ -75,7 +75,8 @@ TEST_F(StartupTest, WithAProfileThatOthersMayWriteItDoesNotStart) {
 }
 
 TEST_F(StartupTest, WithAProfileThatConfinesNothingItDoesNotStart) {
-  instance.folder().write(kProfile, "[files]\nread_write = [\"/\"]\n[network]\nfamilies = [\"unix\", \"inet\"]\n");
+  instance.folder().write(kProfile,
+                          "[files]\nread_write = [\"/\"]\n[network]\nfamilies = [\"unix\", \"inet\"]\n");
   expectRefusal(":2: \"/\" opens the whole file system; correct the profile");
 }
 

@@ -28,8 +28,8 @@ class StorebagCacheTest : public ::testing::Test {
 
   void serve(const std::string& version, int64_t refreshCycle = 3600) const {
     const Dictionary entry = clientEntry(lab.eventsURL(), lab.realtimeURL());
-    lab.serve("brevan", with(storebag(version, {{"httppost", profile({entry})}}), "refresh_cycle",
-                             refreshCycle));
+    lab.serve("brevan",
+              with(storebag(version, {{"httppost", profile({entry})}}), "refresh_cycle", refreshCycle));
   }
   // Since the start of the test.
   int64_t requests() const { return lab.storebagRequests() - requests_; }
@@ -149,7 +149,9 @@ TEST_F(StorebagCacheTest, OneClientTypeGoesOnWithTheBuiltInDocumentWhenNoServerA
   ASSERT_TRUE(instance.start());
   TestSession session(instance, {.clientType = 7});
   ASSERT_TRUE(session.started.ok()) << session.started.status.message;
-  instance.waitForLog("fetchStorebagWithName: Error resolving with lookup server https://127.0.0.1:1/storebags/calvisto?version=");
+  instance.waitForLog(
+      "fetchStorebagWithName: Error resolving with lookup server "
+      "https://127.0.0.1:1/storebags/calvisto?version=");
   instance.waitForLog("fetchStorebagWithName: Loading default storebag 'calvisto'");
   instance.waitForLog("fetchStorebagForEnvironmentAndClientType: Seed section is missing in the storebag.");
   instance.waitForLog("fetchStorebagForEnvironmentAndClientType: Store bag override MaxAge=3600");

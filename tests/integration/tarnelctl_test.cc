@@ -37,8 +37,9 @@ class TarnelctlTest : public ::testing::Test {
     return runProcess(options, input);
   }
   static std::vector<std::string> message(std::vector<std::string> more = {}) {
-    std::vector<std::string> all{"--client-type", "8",          "--client-name", "Meetwell", "--service-name",
-                                 "video-call",    "--category", "5",             "--type",   "6"};
+    std::vector<std::string> all{"--client-type",  "8",          "--client-name", "Meetwell",
+                                 "--service-name", "video-call", "--category",    "5",
+                                 "--type",         "6"};
     std::move(more.begin(), more.end(), std::back_inserter(all));
     return all;
   }
@@ -113,7 +114,8 @@ TEST_F(TarnelctlTest, SingleSendsOneMessage) {
 TEST_F(TarnelctlTest, ExitStatusSaysWhetherADaemonServesUs) {
   const auto none = send();
   EXPECT_EQ(none.end.status, 3);
-  EXPECT_THAT(none.errors, HasSubstr("no daemon is listening at " + instance.socketPath() + ": start it with"));
+  EXPECT_THAT(none.errors,
+              HasSubstr("no daemon is listening at " + instance.socketPath() + ": start it with"));
   instance.setEntitlements("# nobody\n");
   ASSERT_TRUE(instance.start());
   const auto refused = send();
@@ -170,7 +172,8 @@ TEST_F(TarnelctlTest, ReplayReadsStandardInputAndNamesItsMistakes) {
       "\n";
   const auto replayed = run({"replay", "--fast", "-"}, recording);
   EXPECT_EQ(replayed.end.status, 0) << replayed.errors;
-  EXPECT_THAT(replayed.output, HasSubstr("a (httppost): 1 sent, 1 answered, 0 refused by a backend, 0 failed"));
+  EXPECT_THAT(replayed.output,
+              HasSubstr("a (httppost): 1 sent, 1 answered, 0 refused by a backend, 0 failed"));
   lab.waitForEvents(3);
   const auto broken = run({"replay", "--fast", "-"}, recording + "{\"session\":\"b\",\"category\":1}\n");
   EXPECT_EQ(broken.end.status, 1);
@@ -193,13 +196,15 @@ TEST_F(TarnelctlTest, LogShowsWhatWasSent) {
 
 TEST_F(TarnelctlTest, ConsentAndSettingsTakeEffectOnARunningDaemon) {
   ASSERT_TRUE(instance.start());
+  // Also as root: what it makes there must stay the daemon's.
   EXPECT_EQ(run({"consent", "off"}).end.status, 0);
   EXPECT_THAT(run({"consent", "status"}).output, HasSubstr("off"));
   EXPECT_THAT(send().output, HasSubstr("start: no live backend"));
   EXPECT_EQ(run({"consent", "on"}).end.status, 0);
   EXPECT_THAT(send().output, HasSubstr("start: httppost"));
   lab.waitForEvents(4);
-  EXPECT_EQ(run({"settings", "set", "com.orvane.tarnel", "httpsPostURL", lab.url() + "/moved"}).end.status, 0);
+  EXPECT_EQ(run({"settings", "set", "com.orvane.tarnel", "httpsPostURL", lab.url() + "/moved"}).end.status,
+            0);
   EXPECT_THAT(run({"settings", "get", "com.orvane.tarnel", "httpsPostURL"}).output, HasSubstr("/moved"));
   lab.reset();
   ASSERT_EQ(send().end.status, 0);
