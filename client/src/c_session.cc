@@ -184,6 +184,10 @@ auto withDictionary(const tarnel_dictionary* message) {
   };
 }
 
+auto withFile(const char* path) {
+  return [path](Request& request) { return UploadFile::open(path, request.file); };
+}
+
 auto withLogData(const tarnel_array* logData) {
   return [logData](Request& request) {
     if (logData == nullptr) return failure(TARNEL_ERROR_INVALID_ARGUMENT, "log_data is NULL");
@@ -345,6 +349,15 @@ tarnel_status tarnel_session_finish(tarnel_session* session, tarnel_completion c
 tarnel_status tarnel_session_finish_and_wait(tarnel_session* session, uint32_t timeout_ms,
                                              tarnel_reply** reply) {
   return call(session, Kind::finish, Waiting{timeout_ms, reply});
+}
+
+tarnel_status tarnel_session_upload_file(tarnel_session* session, const char* path,
+                                         tarnel_completion completion, void* context) {
+  return call(session, Kind::uploadFile, Async{completion, context}, withFile(path));
+}
+tarnel_status tarnel_session_upload_file_and_wait(tarnel_session* session, const char* path,
+                                                  uint32_t timeout_ms, tarnel_reply** reply) {
+  return call(session, Kind::uploadFile, Waiting{timeout_ms, reply}, withFile(path));
 }
 
 tarnel_status tarnel_session_upload_log_data(tarnel_session* session, const tarnel_array* log_data,

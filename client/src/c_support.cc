@@ -65,6 +65,7 @@ const char* tarnel_status_name(tarnel_status status) {
     TARNEL_CASE(TARNEL_ERROR_WRONG_THREAD);
     TARNEL_CASE(TARNEL_ERROR_FORKED);
     TARNEL_CASE(TARNEL_ERROR_SYSTEM);
+    TARNEL_CASE(TARNEL_ERROR_FILE);
     default:
       return "unknown";
   }

@@ -20,6 +20,8 @@ namespace {
 
 // Messages handled before the caller's side gets a turn again.
 constexpr int kRoundsPerTurn = 64;
+// A day. How long an upload takes is the network's business; the daemon ends those that make no progress.
+constexpr uint64_t kUploadTimeoutMicroseconds = uint64_t{86'400} * 1'000'000;
 
 Outcome lost() {
   return failure(TARNEL_ERROR_INTERRUPTED,
@@ -83,6 +85,12 @@ Outcome Connection::start(Descriptor socket) {
             return onAggregated(message, self, error);
           },
           SD_BUS_VTABLE_UNPRIVILEGED),
+      SD_BUS_METHOD(
+          wire::kDeleteFile.name, wire::kDeleteFile.arguments, wire::kDeleteFile.result,
+          [](sd_bus_message* message, void* self, sd_bus_error* error) {
+            return onDeleteFile(message, self, error);
+          },
+          SD_BUS_VTABLE_UNPRIVILEGED),
       SD_BUS_VTABLE_END,
   };
   sd_bus* bus = nullptr;
@@ -93,7 +101,7 @@ Outcome Connection::start(Descriptor socket) {
   }
   if (result >= 0) {
     socket.release();
-    result = sd_bus_negotiate_fds(bus, 0);
+    result = sd_bus_negotiate_fds(bus, 1);
   }
   if (result >= 0) {
     result = sd_bus_add_object_vtable(bus, nullptr, wire::kReplyPath, wire::kReplyInterface, kVtable, this);
@@ -145,8 +153,10 @@ Outcome Connection::send(std::vector<Request> requests) {
 }
 
 Outcome Connection::transmit(std::vector<Request> requests, BusMessage message) {
+  const bool isUpload = requests.front().kind == Request::Kind::uploadFile;
+  // An upload is known until it is answered: meanwhile the daemon may ask for the file's deletion.
   const bool wantsReply =
-      requests.front().kind == Request::Kind::barrier ||
+      isUpload || requests.front().kind == Request::Kind::barrier ||
       std::any_of(requests.begin(), requests.end(), [](const Request& r) { return bool(r.completion); });
   const uint64_t sequence = ++lastSequence_;
   int result = 0;
@@ -167,7 +177,7 @@ Outcome Connection::transmit(std::vector<Request> requests, BusMessage message) 
     result = sd_bus_call_async(
         bus_.get(), nullptr, message.get(),
         [](sd_bus_message* reply, void* held, sd_bus_error* error) { return onReply(reply, held, error); },
-        &call, replyTimeoutMicroseconds_);
+        &call, isUpload ? kUploadTimeoutMicroseconds : replyTimeoutMicroseconds_);
   }
   return result < 0 ? lost() : Outcome{};
 }
@@ -226,6 +236,20 @@ void Connection::passBarriers() {
     calls_.pop_front();
     for (Request& request : requests) host_.answered(request, Answer());
   }
+}
+
+// The daemon can only name a file that it was given and has not answered for.
+int Connection::onDeleteFile(sd_bus_message* message, void* self, void*) noexcept {
+  const char* fileURL = nullptr;
+  const int result = sd_bus_message_read(message, "s", &fileURL);
+  if (result < 0) return result;
+  for (Call& call : static_cast<Connection*>(self)->calls_) {
+    auto& file = call.requests.front().file;
+    if (file == nullptr || file->fileURL() != fileURL) continue;
+    file->deleteIfSame();
+    break;
+  }
+  return sd_bus_reply_method_return(message, "");
 }
 
 int Connection::onAggregated(sd_bus_message* message, void* self, void*) noexcept {

@@ -86,6 +86,7 @@ class Connection {
 
   // noexcept: nothing may be thrown through the bus library, whatever a callback does.
   static int onReply(sd_bus_message* reply, void* call, void* error) noexcept;
+  static int onDeleteFile(sd_bus_message* message, void* connection, void* error) noexcept;
   static int onAggregated(sd_bus_message* message, void* connection, void* error) noexcept;
   Outcome transmit(std::vector<Request> requests, BusMessage message);
   void handleReply(Call& call, sd_bus_message* reply);

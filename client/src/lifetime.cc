@@ -10,6 +10,7 @@
 #include <new>
 
 #include "client/src/session_core.h"
+#include "client/src/upload_file.h"
 
 namespace tarnel::core {
 namespace {
@@ -22,6 +23,7 @@ struct Registry {
   std::vector<std::shared_ptr<SessionCore>> sessions;
   // Sessions of a parent process: never touched, never let go.
   std::vector<std::shared_ptr<SessionCore>> inherited;
+  std::vector<int> uploads;  // open descriptors
   std::atomic<uint32_t> generation{0};
 };
 
@@ -46,6 +48,8 @@ void afterForkInChild() {
     all.inherited.push_back(std::move(session));
   }
   all.sessions.clear();
+  for (const int descriptor : all.uploads) ::close(descriptor);
+  all.uploads.clear();
   ++all.generation;
   all.mutex.unlock();
 }
@@ -67,6 +71,23 @@ void ForkVisibleDescriptor::change(const std::function<int()>& change) {
 void ForkVisibleDescriptor::closeInChild() {
   if (fd_ >= 0) ::close(fd_);
   fd_ = -1;
+}
+
+int openForUpload(const std::function<int()>& open) {
+  Registry& all = registry();
+  const std::lock_guard lock(all.mutex);
+  if (all.uploads.size() >= kMaxUploadFiles) return kTooManyUploads;
+  all.uploads.reserve(all.uploads.size() + 1);
+  const int descriptor = open();
+  if (descriptor >= 0) all.uploads.push_back(descriptor);
+  return descriptor;
+}
+
+void closeForUpload(int descriptor) {
+  Registry& all = registry();
+  const std::lock_guard lock(all.mutex);
+  std::erase(all.uploads, descriptor);
+  ::close(descriptor);
 }
 
 void rememberSession(const std::shared_ptr<SessionCore>& session) {

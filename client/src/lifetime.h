@@ -28,6 +28,13 @@ class ForkVisibleDescriptor {
   int fd_ = -1;
 };
 
+// The descriptors of files that wait to be uploaded: a forked child closes them, too. Threads: any.
+inline constexpr int kTooManyUploads = -2;
+// Runs `open`, which returns a descriptor or -1, while no fork can happen. kTooManyUploads when as many are
+// open as may be.
+int openForUpload(const std::function<int()>& open);
+void closeForUpload(int descriptor);
+
 // Makes the session known until it is forgotten, and sees to it that fork and exit are noticed.
 void rememberSession(const std::shared_ptr<SessionCore>& session);
 void forgetSession(const SessionCore* session);

@@ -171,6 +171,10 @@ bool measureArguments(const Request& request, Meter& meter) {
       return meter.maybe(request.dictionary);
     case Kind::sendDictionary:
       return meter.dictionary(*request.dictionary, 1);
+    case Kind::uploadFile:
+      meter.fixed(4, 4 + request.file->fileURL().size() + 1);
+      meter.fixed(4, 4);
+      return true;
     case Kind::uploadLogData:
       return meter.array(*request.array, 1);
     case Kind::sendSingleMessage:

@@ -3,6 +3,7 @@
 #include <systemd/sd-bus.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <cstring>
 #include <string>
 #include <string_view>
@@ -43,6 +44,8 @@ const wire::Method& methodFor(std::span<const Request> requests) {
       return wire::kFlushMessages;
     case Kind::finish:
       return wire::kFinishSession;
+    case Kind::uploadFile:
+      return wire::kUploadFile;
     case Kind::uploadLogData:
       return wire::kUploadLogData;
     case Kind::sendSingleMessage:
@@ -89,6 +92,14 @@ MaybeError appendInfos(sd_bus_message* call, const Request& request) {
                     [call, &request] { return wire::appendMaybeDictionary(call, request.userInfo); });
 }
 
+MaybeError appendFile(sd_bus_message* call, const UploadFile& file) {
+  const int result = sd_bus_message_append(call, "sh", file.fileURL().c_str(), file.descriptor());
+  if (result == -EOPNOTSUPP) {
+    return Error(wire::kErrorFailed, result, "the daemon takes no files: is it older than the library?");
+  }
+  return appended(result);
+}
+
 MaybeError appendArguments(sd_bus_message* call, const wire::Method& method,
                            std::span<const Request> requests) {
   const Request& request = requests.front();
@@ -109,6 +120,8 @@ MaybeError appendArguments(sd_bus_message* call, const wire::Method& method,
                         [call, &request] { return wire::appendMaybeDictionary(call, request.dictionary); });
     case Kind::sendDictionary:
       return wire::appendDictionary(call, *request.dictionary);
+    case Kind::uploadFile:
+      return appendFile(call, *request.file);
     case Kind::uploadLogData:
       return wire::appendArray(call, *request.array);
     case Kind::sendSingleMessage:
@@ -178,6 +191,12 @@ Answer readAnswer(sd_bus_message* reply, Kind kind) {
         take(answer, wire::readMaybeError(reply), answer.error);
       }
       break;
+    case Kind::uploadFile: {
+      int success = 0;
+      if (sd_bus_message_read_basic(reply, 'b', &success) <= 0) return unreadable("no boolean");
+      answer.success = success != 0;
+      break;
+    }
     case Kind::uploadLogData: {
       int success = 0;
       if (sd_bus_message_read_basic(reply, 'b', &success) <= 0) return unreadable("no boolean");
@@ -228,6 +247,8 @@ Outcome makeCall(sd_bus* bus, std::span<const Request> requests, BusMessage& cal
   call.reset(made);
   if (const auto error = appendArguments(made, method, requests)) {
     call.reset();
+    if (error->domain() == wire::kErrorFailed)
+      return failure(TARNEL_ERROR_DAEMON, error->localizedDescription());
     return failure(TARNEL_ERROR_INVALID_ARGUMENT, "this cannot be sent: " + error->localizedDescription());
   }
   return {};

@@ -9,6 +9,7 @@
 #include <csignal>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <functional>
 #include <future>
 #include <optional>
@@ -100,6 +101,34 @@ class ProcessTest : public ::testing::Test {
   test::ScratchFolder folder_;
   const std::string path_ = folder_.file("socket");
 };
+
+TEST_F(ProcessTest, AForkedChildHasNoneOfTheFilesThatAreUploaded) {
+  test::TestDaemon daemon(path_);
+  daemon.isSilent = true;
+  auto session = std::make_unique<Session>(options());
+  const std::string file = folder_.file("upload.log");
+  std::ofstream(file) << "text";
+  ASSERT_TRUE(session->uploadFile(file));
+  daemon.waitFor(1);
+  const auto timesOpen = [&file] {
+    int count = 0;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+      std::error_code ignored;
+      if (std::filesystem::read_symlink(entry.path(), ignored) == file) ++count;
+    }
+    return count;
+  };
+  // The stand-in, in this same process, lets go of the message with its copy.
+  while (timesOpen() > 1) std::this_thread::yield();
+  EXPECT_EQ(timesOpen(), 1);
+  EXPECT_EQ(inChild([&] {
+              if (session->uploadFile(file).code != TARNEL_ERROR_FORKED) return 2;
+              session.reset();
+              return timesOpen();
+            }),
+            0);
+  EXPECT_EQ(timesOpen(), 1);
+}
 
 TEST_F(ProcessTest, InAForkedChildTheSessionIsInert) {
   test::TestDaemon daemon(path_);

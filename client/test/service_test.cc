@@ -1,7 +1,11 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <sys/stat.h>
+
 #include <chrono>
+#include <filesystem>
+#include <fstream>
 #include <future>
 #include <string>
 
@@ -42,10 +46,11 @@ TEST(ClientAndService, EveryCallOfTheInterfaceIsUnderstoodAndAnswered) {
   EXPECT_EQ(session.flushAndWait(kLong).error->description, "No backends available to send message");
   EXPECT_EQ(session.finishAndWait(kLong).error->code, 503);
   EXPECT_TRUE(session.uploadLogDataAndWait(client::Array().append("line"), kLong).success);
+  EXPECT_FALSE(session.uploadFileAndWait("/etc/passwd", kLong).success);
   const auto single = session.sendSingleMessageAndWait(info, {}, 5, 6, {}, kLong);
   EXPECT_TRUE(single.ok()) << single.status.message;
   EXPECT_EQ(single.text, std::nullopt);
-  EXPECT_EQ(service.session()->count(), 11U);
+  EXPECT_EQ(service.session()->count(), 12U);
 }
 
 TEST(ClientAndService, AThousandMessagesArriveInOrderWithAndWithoutAnswers) {
@@ -134,6 +139,184 @@ TEST(ClientAndService, TheServiceGoingAwayIsAnInterruption) {
   ASSERT_TRUE(session.startConfigAndWait(kLong).ok());
   service.reset();
   EXPECT_EQ(told.get_future().get().why.code, TARNEL_ERROR_INTERRUPTED);
+}
+
+// Files that the library hands over; what the daemon does with each is `use`.
+class FilesAndService : public ::testing::Test {
+ protected:
+  void onFile(std::function<void(ClientFile&)> use) {
+    service.prepare = [this, use = std::move(use)](RecordingSession& session) {
+      session.uploadFile = [this, use](const std::string& token) {
+        const auto file = service.clientFiles().consume(token);
+        if (file != nullptr) use(*file);
+        return file != nullptr;
+      };
+    };
+    service.start();
+  }
+  std::string write(const std::string& name, const std::string& text = "text") const {
+    std::string path = service.folder().path() + '/' + name;
+    std::ofstream(path) << text;
+    return path;
+  }
+  static bool exists(const std::string& path) { return std::filesystem::exists(path); }
+
+  Service service;
+};
+
+TEST_F(FilesAndService, AFileIsHandedOverAndDeletedBeforeTheCompletionRuns) {
+  const auto path = write("a b\xFF.log", "contents");
+  onFile([](ClientFile& file) {
+    EXPECT_EQ(*file.contents(), "contents");
+    file.requestDeletion();
+  });
+  client::Session session(optionsFor(service));
+  std::promise<bool> isGone;
+  ASSERT_TRUE(session.uploadFile(path, [&](const client::Reply& reply) {
+    EXPECT_TRUE(reply.success);
+    isGone.set_value(!exists(path));
+  }));
+  EXPECT_TRUE(isGone.get_future().get());
+  EXPECT_THAT(service.session()->calls(),
+              ElementsAre("uploadFile file://" + service.folder().path() + "/a%20b%FF.log"));
+}
+
+TEST_F(FilesAndService, WithoutTheWishTheFileStays) {
+  const auto path = write("x");
+  onFile([](ClientFile&) {});
+  client::Session session(optionsFor(service));
+  EXPECT_TRUE(session.uploadFileAndWait(path, kLong).success);
+  EXPECT_TRUE(exists(path));
+}
+
+TEST_F(FilesAndService, WithoutACompletionTheFileIsDeletedAsWell) {
+  const auto path = write("x");
+  onFile([](ClientFile& file) { file.requestDeletion(); });
+  client::Session session(optionsFor(service));
+  EXPECT_TRUE(session.uploadFile(path));
+  EXPECT_TRUE(session.drain(kLong));
+  EXPECT_FALSE(exists(path));
+}
+
+TEST_F(FilesAndService, AnotherFileOfTheSameNameIsKept) {
+  const auto path = write("x");
+  onFile([this, &path](ClientFile& file) {
+    std::filesystem::rename(write("y", "another"), path);
+    file.requestDeletion();
+  });
+  client::Session session(optionsFor(service));
+  EXPECT_TRUE(session.uploadFileAndWait(path, kLong).success);
+  std::string text;
+  std::ifstream(path) >> text;
+  EXPECT_EQ(text, "another");
+}
+
+TEST_F(FilesAndService, ALinkThatTakesItsPlaceIsKept) {
+  const auto path = write("x");
+  onFile([this, &path](ClientFile& file) {
+    std::filesystem::rename(path, path + ".moved");
+    std::filesystem::create_symlink(path + ".moved", path);
+    file.requestDeletion();
+  });
+  client::Session session(optionsFor(service));
+  EXPECT_TRUE(session.uploadFileAndWait(path, kLong).success);
+  EXPECT_TRUE(std::filesystem::is_symlink(path));
+  EXPECT_TRUE(exists(path + ".moved"));
+}
+
+TEST_F(FilesAndService, TheFolderOfTheCallCounts) {
+  const auto path = write("x");
+  onFile([](ClientFile& file) { file.requestDeletion(); });
+  client::Session session(optionsFor(service));
+  const auto before = std::filesystem::current_path();
+  std::filesystem::current_path(service.folder().path());
+  EXPECT_TRUE(session.uploadFile("x"));
+  std::filesystem::current_path(before);
+  EXPECT_TRUE(session.drain(kLong));
+  EXPECT_FALSE(exists(path));
+}
+
+TEST_F(FilesAndService, WhatIsNoReadableRegularFileIsRefusedAtOnce) {
+  onFile([](ClientFile&) { ADD_FAILURE(); });
+  client::Session session(optionsFor(service));
+  const auto folder = service.folder().path();
+  const auto fifo = folder + "/fifo";
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  std::filesystem::create_symlink(write("x"), folder + "/link");
+  const auto refusal = [&session](const std::string& path) {
+    const auto status = session.uploadFile(path);
+    EXPECT_EQ(status.code, TARNEL_ERROR_FILE) << path;
+    return status.message;
+  };
+  EXPECT_EQ(refusal(folder), folder + " is no regular file: only those are uploaded");
+  EXPECT_EQ(refusal(fifo), fifo + " is no regular file: only those are uploaded");
+  EXPECT_EQ(refusal("/dev/null"), "/dev/null is no regular file: only those are uploaded");
+  EXPECT_EQ(refusal(folder + "/link"),
+            folder + "/link is a symbolic link: give the path of the file itself");
+  EXPECT_EQ(refusal(folder + "/missing"), folder + "/missing cannot be opened: No such file or directory");
+  EXPECT_EQ(session.uploadFile("").code, TARNEL_ERROR_INVALID_ARGUMENT);
+  EXPECT_EQ(tarnel_session_upload_file(session.handle(), nullptr, nullptr, nullptr),
+            TARNEL_ERROR_INVALID_ARGUMENT);
+  EXPECT_STREQ(tarnel_last_error(), "the path is empty");
+}
+
+TEST_F(FilesAndService, SeveralUploadsAreToldApart) {
+  const auto kept = write("1", "keep");
+  const auto gone = write("2", "delete");
+  onFile([](ClientFile& file) {
+    if (*file.contents() == "delete") file.requestDeletion();
+  });
+  client::Session session(optionsFor(service));
+  EXPECT_TRUE(session.uploadFile(kept));
+  EXPECT_TRUE(session.uploadFile(gone));
+  EXPECT_TRUE(session.uploadFile(kept));
+  EXPECT_TRUE(session.drain(kLong));
+  EXPECT_TRUE(exists(kept));
+  EXPECT_FALSE(exists(gone));
+}
+
+TEST_F(FilesAndService, NoFileStaysOpenAndTheirNumberIsBounded) {
+  const auto path = write("x");
+  std::promise<void> goOn;
+  auto mayGoOn = goOn.get_future().share();
+  onFile([mayGoOn](ClientFile&) { mayGoOn.wait(); });
+  client::Session session(optionsFor(service));
+  ASSERT_TRUE(session.startConfigAndWait(kLong).ok());
+  const size_t before = openDescriptors();
+  for (int i = 0; i < 64; ++i) EXPECT_TRUE(session.uploadFile(path)) << i;
+  const auto status = session.uploadFile(path);
+  EXPECT_EQ(status.code, TARNEL_ERROR_QUEUE_FULL);
+  EXPECT_EQ(status.message, "64 files of this process wait to be uploaded: wait for answers");
+  goOn.set_value();
+  EXPECT_TRUE(session.drain(kLong));
+  ASSERT_TRUE(session.startConfigAndWait(kLong).ok());
+  EXPECT_EQ(openDescriptors(), before);
+  EXPECT_TRUE(session.uploadFileAndWait(path, kLong).success);
+}
+
+TEST_F(FilesAndService, AnUploadThatIsCutOffTellsSoAndKeepsTheFile) {
+  const auto path = write("x");
+  std::promise<void> isUnderWay;
+  std::promise<void> goOn;
+  onFile([&](ClientFile& file) {
+    isUnderWay.set_value();
+    goOn.get_future().wait();
+    file.requestDeletion();
+  });
+  auto options = optionsFor(service);
+  options.linger = 0ms;
+  std::promise<tarnel_status> told;
+  {
+    client::Session session(options);
+    ASSERT_TRUE(
+        session.uploadFile(path, [&told](const client::Reply& reply) { told.set_value(reply.status.code); }));
+    isUnderWay.get_future().wait();
+  }
+  EXPECT_EQ(told.get_future().get(), TARNEL_ERROR_CLOSED);
+  goOn.set_value();
+  EXPECT_TRUE(eventually([this] { return service.invalidations() == 1; }));
+  EXPECT_TRUE(exists(path));
+  EXPECT_TRUE(service.logged("was uploaded and is kept: "));
 }
 
 }  // namespace

@@ -106,6 +106,8 @@ void writeAnswer(sd_bus_message* reply, std::string_view member, const std::vect
     const int success = 1;
     sd_bus_message_append_basic(reply, 'b', &success);
     wire::appendMaybeError(reply, std::nullopt);
+  } else if (member == wire::kUploadFile.name) {
+    sd_bus_message_append(reply, "b", 1);
   } else if (member == wire::kSendSingleMessage.name) {
     wire::appendMaybeString(reply, "finished");
   } else if (member != wire::kSetSessionInfo.name) {

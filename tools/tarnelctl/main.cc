@@ -16,6 +16,7 @@
 #include "tools/tarnelctl/send_command.h"
 #include "tools/tarnelctl/settings_command.h"
 #include "tools/tarnelctl/storebag_command.h"
+#include "tools/tarnelctl/upload_command.h"
 
 #ifndef TARNEL_VERSION
 #error "TARNEL_VERSION comes from the build"
@@ -50,6 +51,8 @@ struct CommandLine {
   ReplayOptions replay;
   std::string recording;
   uint32_t timeoutSeconds = 30;
+  std::string uploaded;
+  uint32_t uploadSeconds = 600;
   LogOptions logOptions;
   SettingsOptions settings;
   bool consentJson = false;
@@ -63,7 +66,7 @@ void addSocketOption(CommandLine& line, CLI::App* command) {
                       "the daemon's socket (default TARNEL_SOCKET, else the installed one)");
 }
 
-void addMessageOptions(CommandLine& line, CLI::App* command) {
+void addSessionOptions(CommandLine& line, CLI::App* command) {
   auto& send = line.send;
   addSocketOption(line, command);
   command->add_option("--client-type", send.clientType, "client type; 5 to 17 have a storebag")->required();
@@ -75,6 +78,12 @@ void addMessageOptions(CommandLine& line, CLI::App* command) {
       ->add_option("--user-info", send.userInfo,
                    "more user info, KEY=VALUE or KEY:TYPE=VALUE; may be repeated")
       ->allow_extra_args(false);
+  command->add_flag("--json", send.json, "answer in JSON");
+}
+
+void addMessageOptions(CommandLine& line, CLI::App* command) {
+  auto& send = line.send;
+  addSessionOptions(line, command);
   command->add_option("--category", send.category, "category of the message, 0 to 65535")->required();
   command->add_option("--type", send.type, "type of the message, 0 to 65535")->required();
   command->add_option(
@@ -83,7 +92,6 @@ void addMessageOptions(CommandLine& line, CLI::App* command) {
   command->add_option("--timeout", line.timeoutSeconds, "seconds to wait for each answer")
       ->capture_default_str()
       ->check(CLI::Range(1, 86400));
-  command->add_flag("--json", send.json, "answer in JSON");
 }
 
 void addSend(CommandLine& line) {
@@ -111,6 +119,23 @@ void addSingle(CommandLine& line) {
       line.send.socketPath = line.socketPath;
       line.send.timeout = std::chrono::seconds(line.timeoutSeconds);
       return sendSingleMessage(line.send, line.terminal);
+    };
+  });
+}
+
+void addUpload(CommandLine& line, const char* name, const char* what, const char* file,
+               ExitStatus (*upload)(const SendOptions&, const std::string&, const Terminal&)) {
+  auto* command = line.app.add_subcommand(name, what);
+  addSessionOptions(line, command);
+  command->add_option("file", line.uploaded, file)->required();
+  command->add_option("--timeout", line.uploadSeconds, "seconds to wait for each answer")
+      ->capture_default_str()
+      ->check(CLI::Range(1, 86400));
+  command->callback([&line, upload] {
+    line.run = [&line, upload] {
+      line.send.socketPath = line.socketPath;
+      line.send.timeout = std::chrono::seconds(line.uploadSeconds);
+      return upload(line.send, line.uploaded, line.terminal);
     };
   });
 }
@@ -252,6 +277,9 @@ int runCommandLine(int argc, char** argv) {
   addSend(line);
   addReplay(line);
   addSingle(line);
+  addUpload(line, "upload", "upload a file, which is deleted when the server takes it", "the file", uploadFile);
+  addUpload(line, "upload-log", "upload log records",
+            "JSON array of records, or one record a line; - for standard input", uploadLogRecords);
   addLog(line);
   addSettings(line);
   addConsent(line);

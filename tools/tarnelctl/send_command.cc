@@ -57,12 +57,6 @@ struct MaybeClientDictionary {
   std::optional<client::Dictionary> held;
 };
 
-client::Session makeSession(const SendOptions& options) {
-  client::Options sessionOptions;
-  sessionOptions.socketPath = options.socketPath;
-  return client::Session(std::move(sessionOptions));
-}
-
 // One answer for people (or into `json`).
 void show(const char* step, const client::Reply& reply, Dictionary* json, const Terminal& terminal) {
   Dictionary answer;
@@ -98,18 +92,10 @@ ExitStatus finish(const Dictionary& json, bool wanted, ExitStatus status, const 
   return status;
 }
 
-}  // namespace
-
-ExitStatus sendMessage(const SendOptions& options, const Terminal& terminal) {
-  const auto message = describe(options, terminal);
-  if (!message) return ExitStatus::usage;
-  auto session = makeSession(options);
-  const MaybeClientDictionary userInfo(message->userInfo);
-  const MaybeClientDictionary payload(message->payload);
-  session.setSessionInfo(toClient(message->sessionInfo), userInfo.view());
-
-  Dictionary json;
-  Dictionary* const collected = options.json ? &json : nullptr;
+ExitStatus start(client::Session& session, const Message& message, const SendOptions& options,
+                 Dictionary& json, const Terminal& terminal) {
+  const MaybeClientDictionary userInfo(message.userInfo);
+  session.setSessionInfo(toClient(message.sessionInfo), userInfo.view());
   const auto started = session.startConfigAndWait(options.timeout);
   if (!started.ok()) return reportFailure(started.status, terminal);
   if (!started.names) {
@@ -117,7 +103,37 @@ ExitStatus sendMessage(const SendOptions& options, const Terminal& terminal) {
                  << ": see the daemon's log for the reason\n";
     return finish(json, options.json, ExitStatus::failed, terminal);
   }
-  show("start", started, collected, terminal);
+  show("start", started, options.json ? &json : nullptr, terminal);
+  if (started.names->empty()) {
+    terminal.err << "tarnelctl: nothing is reported for this client: look at tarnelctl consent status and at "
+                    "what the daemon logs with TARNEL_LOG_LEVEL=debug\n";
+  }
+  return ExitStatus::ok;
+}
+
+}  // namespace
+
+client::Session makeSession(const SendOptions& options) {
+  client::Options sessionOptions;
+  sessionOptions.socketPath = options.socketPath;
+  return client::Session(std::move(sessionOptions));
+}
+
+ExitStatus startSession(client::Session& session, const SendOptions& options, Dictionary& json,
+                        const Terminal& terminal) {
+  const auto message = describe(options, terminal);
+  return message ? start(session, *message, options, json, terminal) : ExitStatus::usage;
+}
+
+ExitStatus sendMessage(const SendOptions& options, const Terminal& terminal) {
+  const auto message = describe(options, terminal);
+  if (!message) return ExitStatus::usage;
+  auto session = makeSession(options);
+  const MaybeClientDictionary payload(message->payload);
+  Dictionary json;
+  Dictionary* const collected = options.json ? &json : nullptr;
+  if (const auto status = start(session, *message, options, json, terminal); status != ExitStatus::ok)
+    return status;
   const auto sent = session.sendMessageAndWait(options.category, options.type, payload.view(),
                                                static_cast<client::Flag>(options.flag), options.timeout);
   if (!sent.ok()) return reportFailure(sent.status, terminal);

@@ -5,6 +5,8 @@
 #include <string>
 #include <vector>
 
+#include "client/include/tarnel/tarnel.h"
+#include "platform/base/value.h"
 #include "tools/tarnelctl/terminal.h"
 
 // `tarnelctl send` and `tarnelctl single`: one message to the daemon.
@@ -33,5 +35,11 @@ struct SendOptions {
 ExitStatus sendMessage(const SendOptions& options, const Terminal& terminal);
 // The message with its session info in one call.
 ExitStatus sendSingleMessage(const SendOptions& options, const Terminal& terminal);
+
+// A session of the options, and its configuring and start; what that showed goes into `json` where it is
+// wanted. Not ok: the command ends with it.
+client::Session makeSession(const SendOptions& options);
+ExitStatus startSession(client::Session& session, const SendOptions& options, Dictionary& json,
+                        const Terminal& terminal);
 
 }  // namespace tarnel::ctl

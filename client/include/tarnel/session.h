@@ -39,7 +39,7 @@ struct Reply {
   Status status;
   std::optional<std::vector<std::string>> names;  // live backends, of startConfig and fetchStates
   std::optional<std::string> text;
-  bool success = false;  // of uploadLogData
+  bool success = false;  // of uploadFile and uploadLogData
   std::optional<BackendError> error;
 
   bool ok() const noexcept { return status.ok(); }
@@ -239,6 +239,14 @@ class Session {
   }
   Reply finishAndWait(std::chrono::milliseconds timeout) {
     return wait(timeout, tarnel_session_finish_and_wait, handle_);
+  }
+
+  // Uploads a file, which is deleted when the server takes it; see tarnel_session_upload_file. Reply: success.
+  Status uploadFile(const std::string& path, Completion completion = {}) {
+    return async(std::move(completion), tarnel_session_upload_file, handle_, path.c_str());
+  }
+  Reply uploadFileAndWait(const std::string& path, std::chrono::milliseconds timeout) {
+    return wait(timeout, tarnel_session_upload_file_and_wait, handle_, path.c_str());
   }
 
   // Reply: success, error.

@@ -194,6 +194,22 @@ TARNEL_API tarnel_status tarnel_session_finish(tarnel_session* session, tarnel_c
 TARNEL_API tarnel_status tarnel_session_finish_and_wait(tarnel_session* session, uint32_t timeout_ms,
                                                         tarnel_reply** reply);
 
+/* Uploads a file to the server that the session's configuration names, compressed; the session is configured
+ * before. path: not NULL; absolute, or taken from the working directory at the time of the call. It must be a
+ * regular file that this process may read; a symbolic link is not followed.
+ * The file is opened here and read by the daemon through what was opened; a process has at most 64 open for
+ * uploads. When the server takes it the library deletes it, before the completion runs: unless another
+ * file stands at the path by then, it was changed meanwhile, or this process may not delete it.
+ * Reply: success: a request was made and has ended, whatever the server said; whether the file is gone says
+ * what became of it. The answer takes as long as the upload, whatever reply_timeout_ms says; other calls of
+ * the session wait meanwhile, but no other session's. A file above the daemon's limit is refused.
+ * TARNEL_ERROR_FILE: the file cannot be opened, or is no regular file. TARNEL_ERROR_QUEUE_FULL: also when too
+ * many are open. */
+TARNEL_API tarnel_status tarnel_session_upload_file(tarnel_session* session, const char* path,
+                                                    tarnel_completion completion, void* context);
+TARNEL_API tarnel_status tarnel_session_upload_file_and_wait(tarnel_session* session, const char* path,
+                                                             uint32_t timeout_ms, tarnel_reply** reply);
+
 /* Uploads log records. log_data: not NULL. Reply: success, error. It may take as long as the upload. */
 TARNEL_API tarnel_status tarnel_session_upload_log_data(tarnel_session* session, const tarnel_array* log_data,
                                                         tarnel_completion completion, void* context);

@@ -54,7 +54,9 @@ enum {
   /* The session was made before fork() and this is the child: make a new one. */
   TARNEL_ERROR_FORKED = 13,
   /* The system gave no thread, descriptor or memory. */
-  TARNEL_ERROR_SYSTEM = 14
+  TARNEL_ERROR_SYSTEM = 14,
+  /* The file to upload cannot be opened for reading, or is no regular file. */
+  TARNEL_ERROR_FILE = 15
 };
 
 /* The constant's name ("TARNEL_ERROR_QUEUE_FULL"), or "unknown". Never NULL; valid for ever.
