@@ -43,7 +43,7 @@ namespace {
 // What the utility class comes to here: behind whatever the user waits for.
 constexpr int kUtilityNice = 5;
 // Each connection takes a few descriptors; the usual soft limit would end long before the limit on clients.
-constexpr rlim_t kDescriptors = 8192;
+constexpr rlim_t kDescriptors = 16384;
 // For the posts of sessions that end with the process.
 constexpr std::chrono::seconds kLastPosts{5};
 
