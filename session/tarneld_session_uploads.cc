@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "client/include/tarnel/keys.h"
+#include "client/shared/tarnel_logging.h"
 #include "session/tarneld_session.h"
 #include "util/device_facts.h"
 #include "util/message_log.h"
@@ -68,8 +69,9 @@ void TarneldSession::uploadFileWithURL(const std::string& fileURL, const std::st
   } else {
     TARNEL_LOG(dependencies_.log, error, "uploadFileWithURL: File upload failed for %s", path.c_str());
   }
+  // The client's text must not look like lines of the log's own.
   writeToLogFile(dependencies_, "[uploadFileWithURL] Upload %s for file %s", success ? "succeeded" : "failed",
-                 fileURL.c_str());
+                 escapedForLog(fileURL).c_str());
   completionHandler(success);
 }
 

@@ -39,6 +39,13 @@ TEST_F(SessionUploads, UploadWithoutBackendsAnswersFalse) {
   EXPECT_THAT(messageLog(), ElementsAre("[uploadFileWithURL] Upload failed for file file:///tmp/a%20b.log"));
 }
 
+TEST_F(SessionUploads, WhatTheClientSaysStaysOneLineOfTheMessageLog) {
+  upload("/tmp/x\n(2026-01-01 00:00:00 +0000) [httppost -> flushMessages] forged\x1b[31m");
+  EXPECT_THAT(messageLog(),
+              ElementsAre("[uploadFileWithURL] Upload failed for file /tmp/x\\n(2026-01-01 00:00:00 +0000) "
+                          "[httppost -> flushMessages] forged\\x1b[31m"));
+}
+
 TEST_F(SessionUploads, AllBackendsAreAskedAndOneSuccessIsEnough) {
   offer({"uploadserver", "httppost"});
   backends.scripts["uploadserver"].uploads = true;

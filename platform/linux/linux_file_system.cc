@@ -64,6 +64,10 @@ MaybeError LinuxFileSystem::appendToFile(const std::string& path, std::string_vi
   struct stat status {};
   if (::fstat(fd.get(), &status) != 0) return systemError(path, "cannot be examined");
   if (!S_ISREG(status.st_mode)) return Error(kFileErrorDomain, EINVAL, path + ": is not a regular file");
+  if (static_cast<uint64_t>(status.st_size) + text.size() > maxAppendedFile_) {
+    return Error(kFileErrorDomain, EFBIG,
+                 path + ": would grow beyond " + std::to_string(maxAppendedFile_) + " bytes");
+  }
   while (!text.empty()) {
     const ssize_t count = ::write(fd.get(), text.data(), text.size());
     if (count < 0 && errno == EINTR) continue;

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <cstdint>
+
 #include "platform/file_system.h"
 
 namespace tarnel {
@@ -7,6 +9,10 @@ namespace tarnel {
 // The file manager on the real file system.
 class LinuxFileSystem final : public FileSystem {
  public:
+  // Files that are appended to grow to this many bytes; a client that never tires must not fill the disk.
+  explicit LinuxFileSystem(uint64_t maxAppendedFile = uint64_t{256} << 20U)
+      : maxAppendedFile_(maxAppendedFile) {}
+
   Result<std::vector<std::string>> contentsOfDirectory(const std::string& path) override;
   MaybeError createDirectory(const std::string& path) override;
   // The time of birth where the file system keeps one, else of the last change.
@@ -15,6 +21,9 @@ class LinuxFileSystem final : public FileSystem {
   MaybeError createFile(const std::string& path) override;
   MaybeError appendToFile(const std::string& path, std::string_view text) override;
   MaybeError removeFile(const std::string& path) override;
+
+ private:
+  const uint64_t maxAppendedFile_;
 };
 
 }  // namespace tarnel

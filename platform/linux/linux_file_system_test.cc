@@ -79,6 +79,18 @@ TEST_F(LinuxFileSystemTest, AFullDiskIsAnError) {
   EXPECT_EQ(said, std::to_string(EFBIG));
 }
 
+TEST_F(LinuxFileSystemTest, AFileGrowsToItsLimitOnly) {
+  LinuxFileSystem files(10);
+  folder_.write("log", "");
+  EXPECT_FALSE(files.appendToFile(folder_.path("log"), "123456"));
+  EXPECT_FALSE(files.appendToFile(folder_.path("log"), "7890"));
+  const auto error = files.appendToFile(folder_.path("log"), "x");
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), EFBIG);
+  EXPECT_EQ(error->localizedDescription(), folder_.path("log") + ": would grow beyond 10 bytes");
+  EXPECT_EQ(folder_.read("log"), "1234567890");
+}
+
 TEST_F(LinuxFileSystemTest, NoLinkAndNoPipeIsWrittenTo) {
   folder_.write("target", "");
   ASSERT_EQ(::symlink(folder_.path("target").c_str(), folder_.path("link").c_str()), 0);
