@@ -163,7 +163,13 @@ std::unique_ptr<EntitlementRules> EntitlementRules::load(const std::string& conf
                                                          std::vector<ConfigurationProblem>& problems) {
   std::vector<EntitlementRule> rules;
   const std::string directory = configurationDirectory + "/entitlements.d";
-  for (const std::string& name : sortedEntries(directory, ".toml")) {
+  const std::vector<std::string> names = sortedEntries(directory, ".toml");
+  if (names.empty()) {
+    problems.push_back({LogLevel::warning, directory +
+                                               ": holds no grant, so no client is let in; write one (see "
+                                               "tarneld.conf(5)) and start the daemon anew"});
+  }
+  for (const std::string& name : names) {
     loadFile(directory + "/" + name, rules, problems);
   }
   return std::make_unique<EntitlementRules>(std::move(rules));

@@ -62,7 +62,9 @@ class EntitlementRulesTest : public testing::Test {
 
 TEST_F(EntitlementRulesTest, WithoutRulesNobodyHoldsAnything) {
   EXPECT_FALSE(EntitlementRules::load(folder_.path("none"), problems_)->holds(peer(0, 0), kEntitlement));
-  EXPECT_THAT(texts(), IsEmpty());
+  EXPECT_THAT(texts(), ElementsAre(folder_.path("none/entitlements.d") +
+                                   ": holds no grant, so no client is let in; write one (see "
+                                   "tarneld.conf(5)) and start the daemon anew"));
 }
 
 TEST_F(EntitlementRulesTest, AGrantIsForItsEntitlementAlone) {
