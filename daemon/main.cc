@@ -8,9 +8,10 @@
 namespace {
 
 constexpr char kUsage[] =
-    "Usage: tarneld\n"
-    "The Tarnel reporting daemon. It takes no arguments; its directories come from the environment\n"
-    "variables RUNTIME_DIRECTORY, STATE_DIRECTORY, LOGS_DIRECTORY and CONFIGURATION_DIRECTORY.\n"
+    "Usage: tarneld [--help | --version]\n"
+    "The Tarnel reporting daemon. It takes no other arguments; its directories come from the environment\n"
+    "variables RUNTIME_DIRECTORY, STATE_DIRECTORY, LOGS_DIRECTORY and CONFIGURATION_DIRECTORY, and the\n"
+    "key that it trusts from the folder named in TARNEL_BUNDLE.\n"
     "See tarneld(8) and tarneld.conf(5).\n";
 
 // Nothing that the daemon does depends on its arguments; these are for people who ask.
