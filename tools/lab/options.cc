@@ -33,7 +33,10 @@ void addOptions(CLI::App& app, LabOptions& options) {
   app.add_option("--ready-file", options.readyFile, "file to write the status to once listening");
   auto* json = app.add_flag("--json", options.json, "print one JSON object a line");
   app.add_flag("-q,--quiet", options.quiet, "print warnings only")->excludes(json);
-  app.set_version_flag("--version", TARNEL_VERSION);
+  app.set_version_flag("--version", "tarnel-lab " TARNEL_VERSION);
+  app.failure_message([](const CLI::App* /*app*/, const CLI::Error& error) {
+    return "tarnel-lab: " + std::string(error.what()) + "\nRun it with --help for more information.\n";
+  });
 }
 
 }  // namespace

@@ -78,10 +78,11 @@ Result<StorebagKey> StorebagKey::load(const std::string& path) {
   if (!pem) return pem.error();
   Result<StorebagKey> key = fromPem(*pem);
   if (key) return key;
-  return Error(kToolErrorDomain, -1,
-               path + ": " + key.error().localizedDescription() +
-                   "; put the right key there, or remove the file to have a new one made (the daemon then "
-                   "needs the new publicKey.der)");
+  return Error(
+      kToolErrorDomain, -1,
+      path + ": " + key.error().localizedDescription() +
+          "; give a storebag-key.pem that tarnelctl storebag keygen or tarnel-lab made (remove the file, and "
+          "the lab makes a new one; the daemon then needs the new publicKey.der)");
 }
 
 MaybeError StorebagKey::save(const std::string& path) const {

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cstdlib>
 #include <filesystem>
@@ -8,6 +9,7 @@
 
 #include "platform/fake/fake_log.h"
 #include "platform/linux/toml_settings_store.h"
+#include "tools/tarnelctl/acting_as_owner.h"
 #include "tools/tarnelctl/consent_command.h"
 #include "tools/tarnelctl/log_command.h"
 #include "tools/tarnelctl/settings_command.h"
@@ -85,16 +87,49 @@ TEST_F(CommandTest, ABadValueIsAUsageError) {
 TEST_F(CommandTest, ConsentIsOffUntilTurnedOn) {
   EXPECT_EQ(showConsent(path("config"), false, terminal_), ExitStatus::ok);
   EXPECT_EQ(out(), "Submission of diagnostics is off.\n");
-  EXPECT_EQ(storeConsent(path("config"), true, store_, terminal_), ExitStatus::ok);
+  EXPECT_EQ(storeConsent(path("config"), path("state"), true, store_, terminal_), ExitStatus::ok);
   clear();
   EXPECT_EQ(showConsent(path("config"), true, terminal_), ExitStatus::ok);
   EXPECT_EQ(out(), "{\"diagnostics\":true}\n");
   store_.setObject("com.orvane.tarnel", "dnu:respect", "old");
-  EXPECT_EQ(storeConsent(path("config"), false, store_, terminal_), ExitStatus::ok);
+  EXPECT_EQ(storeConsent(path("config"), path("state"), false, store_, terminal_), ExitStatus::ok);
   EXPECT_FALSE(store_.objectForKey("com.orvane.tarnel", "dnu:respect"));
   clear();
   EXPECT_EQ(showConsent(path("config"), false, terminal_), ExitStatus::ok);
   EXPECT_EQ(out(), "Submission of diagnostics is off.\n");
+}
+
+TEST_F(CommandTest, AFailedChangeNamesTheRemedy) {
+  EXPECT_EQ(storeConsent(path("none"), path("state"), true, store_, terminal_), ExitStatus::failed);
+  EXPECT_NE(err().find("; install the daemon, or name its directory in CONFIGURATION_DIRECTORY\n"),
+            std::string::npos)
+      << err();
+}
+
+// A new key's bundle is of the client library's version, not of a storebag's.
+TEST_F(CommandTest, ABundleHasTheVersionOfTheClientLibrary) {
+  ASSERT_EQ(makeStorebagKey({.output = path("keys"), .bits = 2048}, terminal_), ExitStatus::ok) << err();
+  std::string version;
+  std::ifstream(path("keys/bundle/version")) >> version;
+  EXPECT_EQ(version, "8.0");
+}
+
+TEST_F(CommandTest, RootActsAsTheOwnerAndComesBack) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root";
+  ASSERT_EQ(::chmod(home_.c_str(), 0755), 0);
+  ASSERT_EQ(::chown(path("state").c_str(), 65534, 65534), 0);
+  {
+    const ActingAsOwner owner(path("state"));
+    EXPECT_EQ(::geteuid(), 65534U);
+    EXPECT_EQ(::getegid(), 65534U);
+    // What the owner may not do, this may not do on their behalf.
+    write("config/settings/x", "forged");
+    EXPECT_FALSE(fs::exists(path("config/settings/x")));
+  }
+  EXPECT_EQ(::geteuid(), 0U);
+  EXPECT_EQ(::getegid(), 0U);
+  const ActingAsOwner nobody(path("missing"));
+  EXPECT_EQ(::geteuid(), 0U);
 }
 
 TEST_F(CommandTest, StorebagsAreMadeSignedVerifiedAndShown) {

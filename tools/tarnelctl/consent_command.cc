@@ -1,5 +1,6 @@
 #include "tools/tarnelctl/consent_command.h"
 
+#include <cerrno>
 #include <ostream>
 #include <string_view>
 
@@ -7,6 +8,7 @@
 #include "platform/base/log.h"
 #include "platform/linux/file_consent.h"
 #include "platform/linux/system_random.h"
+#include "tools/tarnelctl/acting_as_owner.h"
 
 namespace tarnel::ctl {
 namespace {
@@ -25,6 +27,12 @@ class TerminalLog final : public Log {
   const Terminal& terminal_;
 };
 
+std::string remedyFor(const Error& error) {
+  if (error.code() == EACCES || error.code() == EPERM) return "; run it as root";
+  return error.code() == ENOENT ? "; install the daemon, or name its directory in CONFIGURATION_DIRECTORY"
+                                : "";
+}
+
 }  // namespace
 
 ExitStatus showConsent(const std::string& configurationDirectory, bool json, const Terminal& terminal) {
@@ -38,13 +46,14 @@ ExitStatus showConsent(const std::string& configurationDirectory, bool json, con
   return ExitStatus::ok;
 }
 
-ExitStatus storeConsent(const std::string& configurationDirectory, bool allowed, TomlSettingsStore& store,
-                        const Terminal& terminal) {
+ExitStatus storeConsent(const std::string& configurationDirectory, const std::string& stateDirectory,
+                        bool allowed, TomlSettingsStore& store, const Terminal& terminal) {
   if (const auto error = FileConsent::store(configurationDirectory, allowed)) {
-    terminal.err << "tarnelctl: " << error->localizedDescription() << '\n';
+    terminal.err << "tarnelctl: " << error->localizedDescription() << remedyFor(*error) << '\n';
     return ExitStatus::failed;
   }
   if (!allowed) {
+    const ActingAsOwner owner(stateDirectory);
     TerminalLog log(terminal);
     FileConsent consent(configurationDirectory, log);
     SystemRandom random;

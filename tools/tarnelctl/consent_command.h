@@ -12,7 +12,7 @@ namespace tarnel::ctl {
 ExitStatus showConsent(const std::string& configurationDirectory, bool json, const Terminal& terminal);
 // Withholding consent also drops the identifier that honours it, so that one made later tells nothing of the
 // old.
-ExitStatus storeConsent(const std::string& configurationDirectory, bool allowed, TomlSettingsStore& store,
-                        const Terminal& terminal);
+ExitStatus storeConsent(const std::string& configurationDirectory, const std::string& stateDirectory,
+                        bool allowed, TomlSettingsStore& store, const Terminal& terminal);
 
 }  // namespace tarnel::ctl

@@ -70,8 +70,29 @@ class DirectoryWatch {
   int fd_;
 };
 
+// Until the daemon has made the directory; false when the wait ended before.
+bool waitForDirectory(const std::string& directory) {
+  std::error_code error;
+  while (!fs::is_directory(directory, error)) {
+    fs::path missing = directory;
+    while (missing.has_relative_path() && !fs::exists(missing.parent_path(), error))
+      missing = missing.parent_path();
+    const DirectoryWatch watch(missing.parent_path());
+    if (!watch) return false;
+    // It may have been made before the watch began.
+    if (!fs::exists(missing, error) && !watch.wait()) return false;
+  }
+  return true;
+}
+
 ExitStatus follow(const LogOptions& options, std::string path, std::streamoff position,
                   const Terminal& terminal) {
+  if (terminal.errIsTerminal && path.empty()) terminal.err << "(nothing was sent yet)\n";
+  if (!waitForDirectory(options.directory)) {
+    terminal.err << "tarnelctl: cannot wait for " << options.directory << ": " << std::strerror(errno)
+                 << '\n';
+    return ExitStatus::failed;
+  }
   const DirectoryWatch watch(options.directory);
   if (!watch) {
     terminal.err << "tarnelctl: cannot watch " << options.directory << ": " << std::strerror(errno) << '\n';

@@ -4,12 +4,15 @@
 
 #include <CLI/CLI.hpp>
 #include <algorithm>
+#include <cstdlib>
 #include <exception>
 #include <functional>
 #include <iostream>
+#include <limits>
 #include <string_view>
 
 #include "platform/linux/directories.h"
+#include "tools/tarnelctl/acting_as_owner.h"
 #include "tools/tarnelctl/consent_command.h"
 #include "tools/tarnelctl/log_command.h"
 #include "tools/tarnelctl/replay_command.h"
@@ -17,6 +20,7 @@
 #include "tools/tarnelctl/settings_command.h"
 #include "tools/tarnelctl/storebag_command.h"
 #include "tools/tarnelctl/upload_command.h"
+#include "tools/tarnelctl/visible_output.h"
 
 #ifndef TARNEL_VERSION
 #error "TARNEL_VERSION comes from the build"
@@ -28,22 +32,39 @@ namespace {
 constexpr char kFooter[] =
     "Exit status: 0 done, 1 failed, 2 wrong usage, 3 no daemon is listening or it refuses this process.\n"
     "A private instance is chosen by RUNTIME_DIRECTORY, STATE_DIRECTORY, LOGS_DIRECTORY and\n"
-    "CONFIGURATION_DIRECTORY; the daemon's socket by --socket or TARNEL_SOCKET. See tarnelctl(1).";
+    "CONFIGURATION_DIRECTORY; --socket and TARNEL_SOCKET name another socket. See tarnelctl(1).";
 
 // Errors of the settings store are told by the commands; what it logs beside them goes to standard error.
 class StandardErrorLog final : public Log {
+ public:
+  explicit StandardErrorLog(const Terminal& terminal) : terminal_(terminal) {}
+
  protected:
   void write(LogLevel /*level*/, std::string_view text) override {
-    std::cerr << "tarnelctl: " << text << '\n';
+    terminal_.err << "tarnelctl: " << text << '\n';
   }
+
+ private:
+  const Terminal& terminal_;
+};
+
+// Standard output and standard error; on a terminal nothing that is printed can steer it.
+struct Streams {
+  const bool outIsTerminal = isatty(STDOUT_FILENO) == 1;
+  const bool errIsTerminal = isatty(STDERR_FILENO) == 1;
+  VisibleOutput visibleOut{*std::cout.rdbuf()};
+  VisibleOutput visibleErr{*std::cerr.rdbuf()};
+  std::ostream out{outIsTerminal ? &visibleOut : std::cout.rdbuf()};
+  std::ostream err{errIsTerminal ? &visibleErr : std::cerr.rdbuf()};
 };
 
 // All that the options of all commands fill in, and the command that was chosen.
 struct CommandLine {
   CLI::App app{"Runs, configures and debugs the Tarnel reporting daemon.", "tarnelctl"};
-  Terminal terminal{std::cout, std::cerr, isatty(STDOUT_FILENO) == 1, isatty(STDERR_FILENO) == 1};
+  Streams streams;
+  Terminal terminal{streams.out, streams.err, streams.outIsTerminal, streams.errIsTerminal, &std::cerr};
   Directories directories = Directories::fromEnvironment();
-  StandardErrorLog log;
+  StandardErrorLog log{terminal};
   std::string socketPath;
   std::function<ExitStatus()> run;
 
@@ -59,19 +80,30 @@ struct CommandLine {
   StorebagOptions storebag;
 
   TomlSettingsStore store() { return {directories.configuration(), directories.state(), log}; }
+  // Empty where the client library finds the installed daemon, or what TARNEL_SOCKET names, by itself.
+  std::string socket() const {
+    const bool privateInstance = std::getenv("RUNTIME_DIRECTORY") != nullptr;
+    if (!socketPath.empty() || std::getenv("TARNEL_SOCKET") != nullptr || !privateInstance) return socketPath;
+    return directories.runtime() + "/com.orvane.tarneld";
+  }
 };
 
 void addSocketOption(CommandLine& line, CLI::App* command) {
-  command->add_option("--socket", line.socketPath,
-                      "the daemon's socket (default TARNEL_SOCKET, else the installed one)");
+  command->add_option(
+      "--socket", line.socketPath,
+      "the daemon's socket (default TARNEL_SOCKET, else the one in RUNTIME_DIRECTORY or the installed one)");
 }
 
 void addSessionOptions(CommandLine& line, CLI::App* command) {
   auto& send = line.send;
   addSocketOption(line, command);
   command->add_option("--client-type", send.clientType, "client type; 5 to 17 have a storebag")->required();
-  command->add_option("--session-id", send.sessionID, "session number")->capture_default_str();
-  command->add_option("--client-version", send.clientVersion, "version of the client")->capture_default_str();
+  command->add_option("--session-id", send.sessionID, "session number, 0 to 4294967295")
+      ->capture_default_str()
+      ->check(CLI::Range(uint32_t{0}, std::numeric_limits<uint32_t>::max()));
+  command->add_option("--client-version", send.clientVersion, "version of the client, 0 to 65535")
+      ->capture_default_str()
+      ->check(CLI::Range(0, 65535));
   command->add_option("--client-name", send.clientName, "user info: name of the client");
   command->add_option("--service-name", send.serviceName, "user info: name of the service");
   command
@@ -84,8 +116,12 @@ void addSessionOptions(CommandLine& line, CLI::App* command) {
 void addMessageOptions(CommandLine& line, CLI::App* command) {
   auto& send = line.send;
   addSessionOptions(line, command);
-  command->add_option("--category", send.category, "category of the message, 0 to 65535")->required();
-  command->add_option("--type", send.type, "type of the message, 0 to 65535")->required();
+  command->add_option("--category", send.category, "category of the message, 0 to 65535")
+      ->required()
+      ->check(CLI::Range(0, 65535));
+  command->add_option("--type", send.type, "type of the message, 0 to 65535")
+      ->required()
+      ->check(CLI::Range(0, 65535));
   command->add_option(
       "payload", send.payload,
       "payload, KEY=VALUE or KEY:TYPE=VALUE with TYPE string, int, real, bool, date, data or json");
@@ -104,7 +140,7 @@ void addSend(CommandLine& line) {
   command->add_flag("--flush", line.send.flush, "flush after sending, and wait for it");
   command->callback([&line] {
     line.run = [&line] {
-      line.send.socketPath = line.socketPath;
+      line.send.socketPath = line.socket();
       line.send.timeout = std::chrono::seconds(line.timeoutSeconds);
       return sendMessage(line.send, line.terminal);
     };
@@ -116,7 +152,7 @@ void addSingle(CommandLine& line) {
   addMessageOptions(line, command);
   command->callback([&line] {
     line.run = [&line] {
-      line.send.socketPath = line.socketPath;
+      line.send.socketPath = line.socket();
       line.send.timeout = std::chrono::seconds(line.timeoutSeconds);
       return sendSingleMessage(line.send, line.terminal);
     };
@@ -133,7 +169,7 @@ void addUpload(CommandLine& line, const char* name, const char* what, const char
       ->check(CLI::Range(1, 86400));
   command->callback([&line, upload] {
     line.run = [&line, upload] {
-      line.send.socketPath = line.socketPath;
+      line.send.socketPath = line.socket();
       line.send.timeout = std::chrono::seconds(line.uploadSeconds);
       return upload(line.send, line.uploaded, line.terminal);
     };
@@ -149,7 +185,7 @@ void addReplay(CommandLine& line) {
   command->add_flag("--json", line.replay.json, "summary in JSON");
   command->callback([&line] {
     line.run = [&line] {
-      line.replay.socketPath = line.socketPath;
+      line.replay.socketPath = line.socket();
       return replayFile(line.recording, line.replay, line.terminal);
     };
   });
@@ -176,6 +212,7 @@ void addSettings(CommandLine& line) {
     auto* command = group->add_subcommand(name, what);
     command->callback([&line, action] {
       line.run = [&line, action] {
+        const ActingAsOwner owner(line.directories.state());
         auto store = line.store();
         return action(line.settings, store, line.terminal);
       };
@@ -206,6 +243,7 @@ void addConsent(CommandLine& line) {
   status->add_flag("--json", line.consentJson, "answer in JSON");
   status->callback([&line] {
     line.run = [&line] {
+      const ActingAsOwner owner(line.directories.state());  // as the daemon sees it
       return showConsent(line.directories.configuration(), line.consentJson, line.terminal);
     };
   });
@@ -215,7 +253,8 @@ void addConsent(CommandLine& line) {
     command->callback([&line, allowed] {
       line.run = [&line, allowed] {
         auto store = line.store();
-        return storeConsent(line.directories.configuration(), allowed, store, line.terminal);
+        return storeConsent(line.directories.configuration(), line.directories.state(), allowed, store,
+                            line.terminal);
       };
     });
   }
@@ -233,6 +272,8 @@ void addStorebag(CommandLine& line) {
   auto& options = line.storebag;
   auto* keygen = add("keygen", "make a signing key and the bundle that trusts it", makeStorebagKey);
   keygen->add_option("folder", options.output, "where to put them")->required();
+  keygen->add_option("--bundle-version", options.bundleVersion, "version of the client library")
+      ->capture_default_str();
   keygen->add_option("--bits", options.bits, "length of the key")
       ->capture_default_str()
       ->check(CLI::Range(2048, 16384));
@@ -254,24 +295,38 @@ void addStorebag(CommandLine& line) {
   for (auto* command : {fresh, sign}) {
     command->add_option("-o,--output", options.output, "file to write (default: standard output)");
   }
-  for (auto* command : {keygen, fresh, sign}) {
-    command->add_flag("--force", options.force, "replace what is there; sign in spite of errors");
-  }
+  for (auto* command : {keygen, fresh}) command->add_flag("--force", options.force, "replace what is there");
+  sign->add_flag("--force", options.force, "replace what is there; sign in spite of errors");
 }
 
 // The parser itself would only say that a command is missing.
-bool isUnknownCommand(const CLI::App& app, int argc, char** argv) {
-  if (argc < 2 || argv[1][0] == '-') return false;
-  const auto commands = app.get_subcommands([](const CLI::App*) { return true; });
-  const auto isNamed = [name = argv[1]](const CLI::App* command) { return command->check_name(name); };
-  if (std::any_of(commands.begin(), commands.end(), isNamed)) return false;
-  std::cerr << "tarnelctl: unknown command '" << argv[1] << "': tarnelctl --help lists them\n";
-  return true;
+bool isUnknownCommand(const CommandLine& line, int argc, char** argv) {
+  const CLI::App* app = &line.app;
+  std::string called = "tarnelctl";
+  for (int i = 1; i < argc && argv[i][0] != '-'; ++i) {
+    const auto commands = app->get_subcommands([](const CLI::App*) { return true; });
+    if (commands.empty()) return false;
+    const auto isNamed = [name = argv[i]](const CLI::App* command) { return command->check_name(name); };
+    const auto found = std::find_if(commands.begin(), commands.end(), isNamed);
+    if (found == commands.end()) {
+      line.terminal.err << "tarnelctl: unknown command '" << argv[i] << "': " << called
+                        << " --help lists them\n";
+      return true;
+    }
+    app = *found;
+    called += std::string(" ") + argv[i];
+  }
+  return false;
+}
+
+std::string usageError(const CLI::App* /*app*/, const CLI::Error& error) {
+  return "tarnelctl: " + std::string(error.what()) + "\nRun it with --help for more information.\n";
 }
 
 int runCommandLine(int argc, char** argv) {
   CommandLine line;
   line.app.footer(kFooter);
+  line.app.failure_message(usageError);
   line.app.set_version_flag("--version", "tarnelctl " TARNEL_VERSION);
   line.app.require_subcommand(1);
   addSend(line);
@@ -284,17 +339,18 @@ int runCommandLine(int argc, char** argv) {
   addSettings(line);
   addConsent(line);
   addStorebag(line);
-  if (isUnknownCommand(line.app, argc, argv)) return static_cast<int>(ExitStatus::usage);
+  if (isUnknownCommand(line, argc, argv)) return static_cast<int>(ExitStatus::usage);
   try {
     line.app.parse(argc, argv);
   } catch (const CLI::ParseError& error) {
     // Help and version come this way too, with code 0.
-    return line.app.exit(error) == 0 ? 0 : static_cast<int>(ExitStatus::usage);
+    return line.app.exit(error, std::cout, line.terminal.err) == 0 ? 0 : static_cast<int>(ExitStatus::usage);
   }
-  for (const auto& problem : line.directories.problems()) std::cerr << "tarnelctl: " << problem << '\n';
+  for (const auto& problem : line.directories.problems())
+    line.terminal.err << "tarnelctl: " << problem << '\n';
   const auto status = line.run();
-  std::cout.flush();
-  return std::cout.good() ? static_cast<int>(status) : static_cast<int>(ExitStatus::failed);
+  line.terminal.out.flush();
+  return line.terminal.out.good() ? static_cast<int>(status) : static_cast<int>(ExitStatus::failed);
 }
 
 }  // namespace

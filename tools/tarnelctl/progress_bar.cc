@@ -13,10 +13,12 @@ constexpr std::chrono::milliseconds kPause{100};
 }  // namespace
 
 ProgressBar::ProgressBar(const Terminal& terminal, size_t total, bool quiet)
-    : terminal_(terminal), total_(total), shown_(terminal.errIsTerminal && !quiet && total != 0) {}
+    : screen_(terminal.screen != nullptr ? *terminal.screen : terminal.err),
+      total_(total),
+      shown_(terminal.errIsTerminal && !quiet && total != 0) {}
 
 ProgressBar::~ProgressBar() {
-  if (shown_) terminal_.err << "\r\x1b[K" << std::flush;
+  if (shown_) screen_ << "\r\x1b[K" << std::flush;
 }
 
 void ProgressBar::update(size_t done) {
@@ -28,8 +30,8 @@ void ProgressBar::update(size_t done) {
 
 void ProgressBar::draw(size_t done) {
   const size_t filled = std::min(kWidth, done * kWidth / total_);
-  terminal_.err << "\r[" << std::string(filled, '#') << std::string(kWidth - filled, '.') << "] " << done
-                << '/' << total_ << std::flush;
+  screen_ << "\r[" << std::string(filled, '#') << std::string(kWidth - filled, '.') << "] " << done << '/'
+          << total_ << std::flush;
 }
 
 }  // namespace tarnel::ctl

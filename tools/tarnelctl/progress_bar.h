@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <cstddef>
+#include <iosfwd>
 
 #include "tools/tarnelctl/terminal.h"
 
@@ -21,7 +22,7 @@ class ProgressBar {
  private:
   void draw(size_t done);
 
-  const Terminal& terminal_;
+  std::ostream& screen_;
   const size_t total_;
   const bool shown_;
   std::chrono::steady_clock::time_point next_{};

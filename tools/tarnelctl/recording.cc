@@ -131,13 +131,24 @@ Error refused(size_t line, const std::string& text) {
   return {kRecordingErrorDomain, -1, "line " + std::to_string(line) + ": " + text};
 }
 
+// The next line, as far as it is no longer than `most`; false at the end.
+bool readLine(std::istream& input, std::string& line, size_t most) {
+  line.clear();
+  char character = 0;
+  while (line.size() <= most && input.get(character)) {
+    if (character == '\n') return true;
+    line += character;
+  }
+  return !line.empty();
+}
+
 }  // namespace
 
 Result<Recording> readRecording(std::istream& input, size_t maxBytes) {
   RecordingReader reader;
   std::string text;
   size_t bytes = 0;
-  for (size_t line = 1; std::getline(input, text); ++line) {
+  for (size_t line = 1; readLine(input, text, maxBytes - bytes); ++line) {
     bytes += text.size() + 1;
     if (bytes > maxBytes)
       return refused(line, "the recording is larger than " + std::to_string(maxBytes) + " bytes");
@@ -146,8 +157,13 @@ Result<Recording> readRecording(std::istream& input, size_t maxBytes) {
     if (!record) return refused(line, record.error().localizedDescription());
     if (const auto refusal = reader.take(*record)) return refused(line, *refusal);
   }
+  if (input.bad()) return Error(kRecordingErrorDomain, -1, "cannot be read: is it a file?");
   auto recording = reader.finish();
-  if (recording.sessions.empty()) return refused(1, "the recording describes no session");
+  if (recording.sessions.empty()) {
+    return Error(
+        kRecordingErrorDomain, -1,
+        "the recording describes no session: examples/call-recording.ndjson shows what one looks like");
+  }
   return recording;
 }
 

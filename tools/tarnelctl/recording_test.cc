@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <fstream>
 #include <sstream>
 
 namespace tarnel::ctl {
@@ -82,7 +83,8 @@ TEST(RecordingTest, TimeNeverGoesBack) {
 }
 
 TEST(RecordingTest, RefusesAnEmptyOne) {
-  EXPECT_EQ(readText("").error().localizedDescription(), "line 1: the recording describes no session");
+  EXPECT_EQ(readText("").error().localizedDescription(),
+            "the recording describes no session: examples/call-recording.ndjson shows what one looks like");
 }
 
 TEST(RecordingTest, IsBounded) {
@@ -90,6 +92,21 @@ TEST(RecordingTest, IsBounded) {
   const auto recording = readRecording(input, 20);
   ASSERT_FALSE(recording);
   EXPECT_EQ(recording.error().localizedDescription(), "line 1: the recording is larger than 20 bytes");
+}
+
+TEST(RecordingTest, ALineWithoutEndIsNotReadToItsEnd) {
+  std::istringstream input(std::string(1000, 'x'));
+  const auto recording = readRecording(input, 100);
+  ASSERT_FALSE(recording);
+  EXPECT_EQ(recording.error().localizedDescription(), "line 1: the recording is larger than 100 bytes");
+  EXPECT_LE(input.tellg(), 102);
+}
+
+TEST(RecordingTest, AFolderIsNoRecording) {
+  std::ifstream folder("/");
+  const auto recording = readRecording(folder);
+  ASSERT_FALSE(recording);
+  EXPECT_EQ(recording.error().localizedDescription(), "cannot be read: is it a file?");
 }
 
 }  // namespace

@@ -1,9 +1,11 @@
 #include "tools/tarnelctl/settings_command.h"
 
+#include <cerrno>
 #include <ostream>
 #include <utility>
 
 #include "platform/document.h"
+#include "platform/file_system.h"
 #include "tools/tarnelctl/typed_value.h"
 
 namespace tarnel::ctl {
@@ -16,6 +18,11 @@ const char* layerName(SettingsLayer layer) {
 ExitStatus fail(const Terminal& terminal, const std::string& text) {
   terminal.err << "tarnelctl: " << text << '\n';
   return ExitStatus::failed;
+}
+
+const char* remedyFor(const Error& error) {
+  const bool denied = error.code() == EACCES || error.code() == EPERM || error.code() == EROFS;
+  return denied && error.domain() == kFileErrorDomain ? "; run it as root or as the daemon's user" : "";
 }
 
 Dictionary asDictionary(const std::string& domain, const SettingsEntry& entry) {
@@ -89,7 +96,7 @@ ExitStatus setSetting(const SettingsOptions& options, TomlSettingsStore& store, 
     return ExitStatus::usage;
   }
   if (const auto error = store.setObject(options.domain, options.key, *value)) {
-    return fail(terminal, error->localizedDescription());
+    return fail(terminal, error->localizedDescription() + remedyFor(*error));
   }
   warnWhenHidden(options, store, terminal, "stored");
   return ExitStatus::ok;
@@ -97,7 +104,7 @@ ExitStatus setSetting(const SettingsOptions& options, TomlSettingsStore& store, 
 
 ExitStatus unsetSetting(const SettingsOptions& options, TomlSettingsStore& store, const Terminal& terminal) {
   if (const auto error = store.removeObject(options.domain, options.key)) {
-    return fail(terminal, error->localizedDescription());
+    return fail(terminal, error->localizedDescription() + remedyFor(*error));
   }
   warnWhenHidden(options, store, terminal, "removed");
   return ExitStatus::ok;

@@ -59,8 +59,12 @@ std::optional<std::string> read(const std::string& path, const Terminal& termina
 // From a DER file, or from the publicKey.der of a bundle folder.
 std::shared_ptr<const RsaPublicKey> publicKey(const std::string& path, const Terminal& terminal) {
   const std::string inBundle = path + "/publicKey.der";
-  const auto der = read(pathExists(inBundle) ? inBundle : path, terminal);
-  if (!der) return nullptr;
+  const auto der = readFile(pathExists(inBundle) ? inBundle : path, kMaxFileBytes);
+  if (!der) {
+    fail(terminal,
+         der.error().localizedDescription() + ": --key takes a publicKey.der or the bundle folder with it");
+    return nullptr;
+  }
   auto key = RsaPublicKey::fromDer({reinterpret_cast<const uint8_t*>(der->data()), der->size()});
   if (key == nullptr) {
     fail(terminal, path + " is no RSA public key in DER form: make one with tarnelctl storebag keygen");
@@ -97,7 +101,7 @@ ExitStatus makeStorebagKey(const StorebagOptions& options, const Terminal& termi
   if (!key) return fail(terminal, key.error().localizedDescription());
   if (const auto error = key->save(keyPath)) return fail(terminal, error->localizedDescription());
   const std::string bundle = options.output + "/bundle";
-  if (const auto error = writeClientBundle(bundle, *key, options.version)) {
+  if (const auto error = writeClientBundle(bundle, *key, options.bundleVersion)) {
     return fail(terminal, error->localizedDescription());
   }
   terminal.out << "private key: " << keyPath << " (keep it secret)\n"

@@ -13,6 +13,7 @@ struct StorebagOptions {
   std::string output;  // a file or folder; empty: standard output where that makes sense
   std::string key;     // private key (sign), public key or bundle folder (verify, show)
   std::string version = "1.0.0";
+  std::string bundleVersion = "8.0";  // of the client library that the bundle belongs to
   std::string client = "Example";
   std::string service = "example-service";
   std::string postURL = "{{LAB_URL}}";

@@ -10,6 +10,8 @@ struct Terminal {
   std::ostream& err;
   bool outIsTerminal = false;
   bool errIsTerminal = false;
+  // Where the cursor may be moved; `err` when null.
+  std::ostream* screen = nullptr;
 };
 
 // What the program exits with.
