@@ -2,8 +2,10 @@
 
 #include <sys/socket.h>
 
+#include <algorithm>
 #include <array>
 #include <bit>
+#include <cerrno>
 #include <cstdint>
 #include <cstring>
 
@@ -60,6 +62,13 @@ ssize_t receiveWithDescriptors(int socket, char* room, size_t size, std::vector<
 }
 
 ssize_t sendWithDescriptors(int socket, std::string_view bytes, const std::vector<UniqueFd>& descriptors) {
+  std::array<int, wire::kMaxDescriptors> numbers{};
+  if (descriptors.size() > numbers.size()) {
+    errno = EINVAL;
+    return -1;
+  }
+  std::transform(descriptors.begin(), descriptors.end(), numbers.begin(),
+                 [](const UniqueFd& descriptor) { return descriptor.get(); });
   alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * wire::kMaxDescriptors)> control{};
   iovec piece{const_cast<char*>(bytes.data()), bytes.size()};
   msghdr message{};
@@ -72,10 +81,7 @@ ssize_t sendWithDescriptors(int socket, std::string_view bytes, const std::vecto
     header->cmsg_level = SOL_SOCKET;
     header->cmsg_type = SCM_RIGHTS;
     header->cmsg_len = CMSG_LEN(sizeof(int) * descriptors.size());
-    for (size_t i = 0; i < descriptors.size(); ++i) {
-      const int descriptor = descriptors[i].get();
-      std::memcpy(CMSG_DATA(header) + i * sizeof(int), &descriptor, sizeof(int));
-    }
+    std::memcpy(control.data() + CMSG_LEN(0), numbers.data(), sizeof(int) * descriptors.size());
   }
   return sendmsg(socket, &message, MSG_DONTWAIT | MSG_NOSIGNAL);
 }
