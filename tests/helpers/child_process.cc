@@ -5,11 +5,13 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/eventfd.h>
+#include <sys/ioctl.h>
 #include <sys/prctl.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstdlib>
@@ -162,8 +164,13 @@ void ChildProcess::readStreams() {
     for (size_t i = 0; i < 2; ++i) {
       if (entries[i].revents == 0) continue;
       read = true;
+      {
+        const std::lock_guard lock(mutex_);
+        streams[i]->reading = true;
+      }
       const ssize_t count = ::read(streams[i]->descriptor.get(), bytes.data(), bytes.size());
       const std::lock_guard lock(mutex_);
+      streams[i]->reading = false;
       if (count <= 0) {
         streams[i]->ended = true;
       } else if (streams[i]->text.size() < kMaxText) {
@@ -175,14 +182,24 @@ void ChildProcess::readStreams() {
   }
 }
 
+// What was written before this call is in the pipe or in the text, or on the way from one to the other.
+std::string ChildProcess::textOf(const Stream& stream) const {
+  std::unique_lock lock(mutex_);
+  const auto deadline = Deadline().end();
+  changed_.wait_until(lock, deadline, [&stream] { return stream.ended || !stream.reading; });
+  int waiting = 0;
+  if (stream.ended || ::ioctl(stream.descriptor.get(), FIONREAD, &waiting) != 0) return stream.text;
+  const size_t whole = std::min(kMaxText, stream.text.size() + static_cast<size_t>(waiting));
+  changed_.wait_until(lock, deadline, [&] { return stream.ended || stream.text.size() >= whole; });
+  return stream.text;
+}
+
 std::string ChildProcess::output() const {
-  const std::lock_guard lock(mutex_);
-  return output_.text;
+  return textOf(output_);
 }
 
 std::string ChildProcess::errors() const {
-  const std::lock_guard lock(mutex_);
-  return errors_.text;
+  return textOf(errors_);
 }
 
 bool ChildProcess::waitFor(const Stream& stream, std::string_view text, size_t from,

@@ -50,7 +50,7 @@ class ChildProcess {
   int endDescriptor() const { return pidfd_.get(); }
   bool isRunning() const;
 
-  // All so far.
+  // All that it has written until now.
   std::string output() const;
   std::string errors() const;
   // Waits until the text stands in the output (or errors) behind the given position; false when it does not
@@ -68,10 +68,12 @@ class ChildProcess {
   struct Stream {
     UniqueFd descriptor;
     std::string text;
+    bool reading = false;
     bool ended = false;
   };
 
   void readStreams();
+  std::string textOf(const Stream& stream) const;
   bool waitFor(const Stream& stream, std::string_view text, size_t from, Deadline deadline) const;
 
   pid_t pid_ = -1;
