@@ -1,20 +1,18 @@
 #include "platform/linux/ipc/connection_loop.h"
 
-#include <fcntl.h>
 #include <poll.h>
 #include <sys/socket.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstring>
+#include <exception>
+#include <iterator>
 #include <utility>
 
 #include "platform/ipc/wire.h"
 #include "platform/linux/ipc/descriptor_passing.h"
-#include "platform/linux/ipc/generic_tools.h"
-#include "platform/linux/ipc/session_methods.h"
 
 namespace tarnel {
 namespace {
@@ -370,124 +368,6 @@ void ConnectionLoop::runTasks() {
     if (!task) return;
     task(*this);
   }
-}
-
-int ConnectionLoop::onMessage(sd_bus_message* message) {
-  ++messages_;
-  const bool hasDescriptors = std::exchange(announced_, 0) > 0;
-  uint8_t type = 0;
-  if (sd_bus_message_get_type(message, &type) < 0 || type != SD_BUS_MESSAGE_METHOD_CALL) return 1;
-  const char* interface = sd_bus_message_get_interface(message);
-  if (interface != nullptr && std::strcmp(interface, wire::kSessionInterface) == 0 &&
-      std::strcmp(sd_bus_message_get_path(message), wire::kSessionPath) == 0) {
-    // A call that waits for its answer must not hold descriptors meanwhile.
-    if (hasDescriptors && std::strcmp(sd_bus_message_get_member(message), wire::kUploadFile.name) != 0) {
-      refuse(message, wire::kErrorInvalidArguments, "only UploadFile takes a descriptor");
-      return 1;
-    }
-    carryOut(message, callSessionMethod);
-    return 1;
-  }
-  if (isPeerGone()) return 1;
-  return answerGenericTool(message) ? 1 : 0;
-}
-
-// The library's way of answering needs a message; this one stands for what it has not read.
-void ConnectionLoop::onSendCall(SendCall call) {
-  sd_bus_message* made = nullptr;
-  int r = sd_bus_message_new_method_call(bus_.get(), &made, nullptr, wire::kSessionPath,
-                                         wire::kSessionInterface, call.member());
-  const BusMessage message(made);
-  if (r >= 0) r = sd_bus_message_set_expect_reply(made, call.wantsReply ? 1 : 0);
-  if (r >= 0) r = sd_bus_message_seal(made, call.serial, 0);
-  if (r < 0) {
-    setup_.link->stop(std::string("its call cannot be answered: ") + strerror(-r));
-    return;
-  }
-  carryOut(made, [&call](const SessionCall& sessionCall) -> MaybeError {
-    runSendCall(sessionCall, std::move(call));
-    return std::nullopt;
-  });
-}
-
-template <class Run>
-void ConnectionLoop::carryOut(sd_bus_message* message, Run run) {
-  current_ = message;
-  currentSerial_ = ++lastSerial_;
-  currentAbandoned_ = false;
-  runCall(message, run);
-  // Answered later, from whichever thread.
-  const bool owed = current_ != nullptr && sd_bus_message_get_expect_reply(message) > 0;
-  current_ = nullptr;
-  if (!owed || peerGone_) return;
-  if (currentAbandoned_) {
-    refuse(message, wire::kErrorNoReply, "no answer will come");
-  } else {
-    unanswered_.emplace(currentSerial_, BusMessage(sd_bus_message_ref(message)));
-  }
-}
-
-template <class Run>
-void ConnectionLoop::runCall(sd_bus_message* message, Run run) {
-  const SessionCall call{message,     *setup_.object, setup_.link,       currentSerial_,
-                         setup_.peer, setup_.log,     setup_.clientFiles};
-  try {
-    if (const MaybeError error = run(call)) {
-      current_ = nullptr;
-      refuse(message, error->domain().c_str(), error->localizedDescription());
-    }
-  } catch (const std::exception& error) {
-    callFailed(message, error.what());
-  } catch (...) {
-    callFailed(message, "unknown failure");
-  }
-}
-
-void ConnectionLoop::callFailed(sd_bus_message* message, const char* what) {
-  setup_.log.log(LogLevel::error, "IpcConnection: %s of %s failed: %s", sd_bus_message_get_member(message),
-                 setup_.peer.c_str(), what);
-  if (current_ == nullptr) return;  // it had answered before it failed
-  current_ = nullptr;
-  refuse(message, wire::kErrorFailed, what);
-}
-
-BusMessage ConnectionLoop::takeCall(uint64_t serial) {
-  if (current_ != nullptr && serial == currentSerial_) {
-    return BusMessage(sd_bus_message_ref(std::exchange(current_, nullptr)));
-  }
-  auto node = unanswered_.extract(serial);
-  return node ? std::move(node.mapped()) : nullptr;
-}
-
-void ConnectionLoop::abandon(uint64_t serial) {
-  if (current_ != nullptr && serial == currentSerial_) {
-    currentAbandoned_ = true;
-    return;
-  }
-  const BusMessage call = takeCall(serial);
-  if (call != nullptr) refuse(call.get(), wire::kErrorNoReply, "no answer will come");
-}
-
-void ConnectionLoop::refuse(sd_bus_message* call, const char* name, const std::string& text) {
-  if (sd_bus_message_get_expect_reply(call) <= 0 || isPeerGone()) return;
-  const bool sendable = isValidUtf8(text);
-  sd_bus_reply_method_errorf(call, name, "%s", sendable ? text.c_str() : "(the reason is not UTF-8)");
-}
-
-MaybeError ConnectionLoop::newClientCall(const char* member, BusMessage& message) {
-  sd_bus_message* made = nullptr;
-  int r = sd_bus_message_new_method_call(bus_.get(), &made, nullptr, wire::kReplyPath, wire::kReplyInterface,
-                                         member);
-  message.reset(made);
-  if (r >= 0) r = sd_bus_message_set_expect_reply(made, 0);
-  if (r >= 0) return std::nullopt;
-  return Error(wire::kErrorFailed, -1, std::string("cannot call the client: ") + strerror(-r));
-}
-
-MaybeError ConnectionLoop::send(sd_bus_message* message) {
-  const int r = isPeerGone() ? -ECONNRESET : sd_bus_send(bus_.get(), message, nullptr);
-  if (r >= 0) return std::nullopt;
-  return Error(wire::kErrorFailed, -1, std::string("cannot call the client: ") + strerror(-r));
 }
 
 }  // namespace tarnel
