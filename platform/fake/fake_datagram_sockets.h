@@ -36,7 +36,11 @@ class FakeDatagramSockets final : public DatagramSockets {
   int bindError = 0;
   int connectError = 0;
 
+  // Set to have sockets come from there instead.
+  DatagramSockets* real = nullptr;
+
   Result<std::unique_ptr<DatagramSocket>> create() override {
+    if (real != nullptr) return real->create();
     if (createError != 0) return Error(kDatagramErrorDomain, createError, "refused by the test");
     auto record = std::make_shared<SocketRecord>();
     record->descriptor = 1000 + static_cast<int>(records.size());

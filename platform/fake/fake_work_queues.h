@@ -22,8 +22,12 @@ class FakeWorkQueues final : public WorkQueues {
   bool refuseTimers = false;
   bool refuseReadSources = false;
 
+  // Set to have queues come from there instead.
+  WorkQueues* real = nullptr;
+
   std::shared_ptr<WorkQueue> makeQueue(std::string label) override {
     if (refuseQueues) return nullptr;
+    if (real != nullptr) return real->makeQueue(std::move(label));
     labels.push_back(std::move(label));
     return std::make_shared<Queue>(*this);
   }
