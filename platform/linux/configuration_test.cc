@@ -38,6 +38,7 @@ TEST(Configuration, WithoutFilesTheDefaultsHold) {
   EXPECT_EQ(configuration.http.maxQueuedBytes, 67108864U);
   EXPECT_EQ(configuration.http.connectionsPerHost, 6U);
   EXPECT_EQ(configuration.http.connections, 32U);
+  EXPECT_EQ(configuration.bundleRoot, "");
 }
 
 TEST(Configuration, EveryKeyIsTaken) {
@@ -46,6 +47,8 @@ TEST(Configuration, EveryKeyIsTaken) {
 level = "debug"
 [locale]
 country = "DE"
+[bundles]
+root = "/srv/tarnel"
 [limits]
 connections = 10
 connections_per_user = 5
@@ -73,6 +76,7 @@ connections = 8
   EXPECT_EQ(configuration.http.maxQueuedBytes, 6000U);
   EXPECT_EQ(configuration.http.connectionsPerHost, 7U);
   EXPECT_EQ(configuration.http.connections, 8U);
+  EXPECT_EQ(configuration.bundleRoot, "/srv/tarnel");
 }
 
 TEST(Configuration, LaterFilesWinKeyByKey) {
@@ -108,6 +112,27 @@ TEST(Configuration, UnknownKeysAreNamedWithFileAndLine) {
       ElementsAre(file + ":3: unknown key limits.conections; it is ignored, tarneld.conf(5) lists the keys",
                   file + ":4: unknown key other; it is ignored, tarneld.conf(5) lists the keys"));
   EXPECT_EQ(configuration.problems[0].level, LogLevel::warning);
+}
+
+TEST(Configuration, TheRootOfBundlesIsAPlainPathOrEmpty) {
+  const TemporaryFolder folder;
+  for (const char* good : {"", "/a", "/a/b.c/..d"}) {
+    folder.write("tarneld.toml", std::string("[bundles]\nroot = \"") + good + "\"\n");
+    const Configuration configuration = loadConfiguration(folder.path());
+    EXPECT_THAT(texts(configuration), IsEmpty()) << good;
+    EXPECT_EQ(configuration.bundleRoot, good);
+  }
+  for (const char* bad :
+       {"\"/\"", "\"a/b\"", "\"/a/\"", "\"/a//b\"", "\"/a/./b\"", "\"/a/../b\"", "\"/a\\u0000b\"", "5"}) {
+    folder.write("tarneld.toml", std::string("[bundles]\nroot = ") + bad + "\n");
+    const Configuration configuration = loadConfiguration(folder.path());
+    EXPECT_THAT(texts(configuration),
+                ElementsAre(folder.path("tarneld.toml") +
+                            ":2: bundles.root must be an absolute path without \".\", \"..\" and superfluous "
+                            "slashes, or the empty text; the default stays"))
+        << bad;
+    EXPECT_EQ(configuration.bundleRoot, "");
+  }
 }
 
 TEST(Configuration, BadValuesAreNamedWithWhatWasExpectedAndTheDefaultStays) {
@@ -213,7 +238,7 @@ TEST(Configuration, TheManualNamesEveryKeyOfTheShippedFile) {
       ++keys;
     }
   }
-  EXPECT_EQ(keys, 12U);
+  EXPECT_EQ(keys, 13U);
 }
 
 TEST(Configuration, TrustedCertificatesAreListedByName) {
