@@ -4,8 +4,8 @@
 #include "backends/dravik/dravik_backend.h"
 #include "backends/https/https_post_backend.h"
 #include "backends/tarnel_backend.h"
-#include "backends/vesmer/vesmer_backend.h"
 #include "backends/upload/upload_backend.h"
+#include "backends/vesmer/vesmer_backend.h"
 #include "client/include/tarnel/keys.h"
 #include "util/device_facts.h"
 

@@ -100,7 +100,8 @@ struct LinuxWorld::Prepared {
         keepAlive({.idleExit = configuration.limits.idleExit,
                    .arm = [this](std::chrono::seconds delay,
                                  uint64_t generation) { loop.armTimer(delay, generation); },
-                   .isOtherWorkUnderWay = [this] { return http.underWay() != 0 || workQueues.sourcesUnderWay() != 0; },
+                   .isOtherWorkUnderWay =
+                       [this] { return http.underWay() != 0 || workQueues.sourcesUnderWay() != 0; },
                    .idle = [this] { loop.exit(); }}),
         codeBundles(configuration.bundleRoot, *log),
         powerLog({.file = powerLogFile(directories, kJournalSocket)}, clock, *log),

@@ -19,7 +19,7 @@ struct Ipv4Address {
 
 // An IPv4 UDP socket. No operation waits. Those that can fail return the error number, 0 for success.
 //
-// Threads: one at a time; connecting and sending may go on while the descriptor is waited for elsewhere.
+// Threads: one at a time; the descriptor may be waited for on another.
 class DatagramSocket {
  public:
   DatagramSocket() = default;

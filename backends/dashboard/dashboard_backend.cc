@@ -159,6 +159,7 @@ bool DashboardBackend::connectAndStartTimer(const Ipv4Address& address, std::chr
     TARNEL_LOG(log, error, "DashboardBackend(initWithName): can't create timer source.");
     return false;
   }
+  startReading();
   timer->start([backend = self()] { backend->myPeriodicTask(); },
                [backend = self()] {
                  if (!backend->reliableUDP) backend->closeSocket();
@@ -166,13 +167,12 @@ bool DashboardBackend::connectAndStartTimer(const Ipv4Address& address, std::chr
   return true;
 }
 
-// Gives back what a failed initializer took. A descriptor that is waited for is closed once that has ended.
+// Gives back what a failed initializer took. A descriptor with a source is closed by the source's cancel
+// handler, which only a started one has.
 void DashboardBackend::giveUp() {
-  if (readSource != nullptr) {
-    readSource->cancel();
-  } else {
-    closeSocket();
-  }
+  if (readSource == nullptr) return closeSocket();
+  startReading();
+  readSource->cancel();
 }
 
 void DashboardBackend::closeSocket() {

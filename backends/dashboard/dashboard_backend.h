@@ -87,8 +87,9 @@ class DashboardBackend final : public TarnelBackend {
   void giveUp();
   void closeSocket();
 
-  // dashboard_backend_delivery.cc; on the work queue but for the first
+  // dashboard_backend_delivery.cc; on the work queue but for the first two
   void useReliableUDP();
+  void startReading();
   void tryToSendMsg(const DashboardBuffer& bytes, size_t length, EventID eventNumber);
   bool sendWhole(std::span<const uint8_t> datagram);
   void myPeriodicTask();

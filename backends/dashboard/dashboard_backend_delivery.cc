@@ -28,8 +28,12 @@ void DashboardBackend::useReliableUDP() {
   if (readSource == nullptr) {
     // Delivery stays reliable: datagrams are sent again and then dropped, never acknowledged.
     TARNEL_LOG(log, error, "DashboardBackend(useReliableUDP): can't create read source");
-    return;
   }
+}
+
+// Once the socket is connected: until then there is nothing that could be acknowledged.
+void DashboardBackend::startReading() {
+  if (readSource == nullptr) return;
   readSource->start([backend = self()] { backend->processSocketRead(); },
                     [backend = self()] { backend->closeSocket(); });
 }

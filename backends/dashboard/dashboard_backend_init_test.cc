@@ -42,7 +42,7 @@ TEST_F(DashboardBackendInitTest, DisplayUrlMayBeAbsent) {
   EXPECT_EQ(make(profileOf())->displayURL(), std::nullopt);
 }
 
-TEST_F(DashboardBackendInitTest, ReliableProfileBindsAndReadsBeforeItConnects) {
+TEST_F(DashboardBackendInitTest, ReliableProfileBindsBeforeItConnects) {
   const auto backend = make(profileOf({{"reliable", 200}}));
   ASSERT_NE(backend, nullptr);
   EXPECT_EQ(socket().calls, (Calls{"suppressBrokenPipeSignal", "bindToWildcard", "connectTo"}));

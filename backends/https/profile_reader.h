@@ -20,8 +20,8 @@ class ProfileSection;
 // Threads: one at a time.
 class ProfileReader {
  public:
-  // `className`, `operation` and `backendName` stand in the warnings. Log and profile must outlive this object
-  // and everything that it hands out.
+  // `className`, `operation` and `backendName` stand in the warnings. Log and profile must outlive this
+  // object and everything that it hands out.
   ProfileReader(Log& log, std::string backendName, const char* operation,
                 const char* className = "HTTPSPostBackend");
 

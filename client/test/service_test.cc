@@ -251,8 +251,7 @@ TEST_F(FilesAndService, WhatIsNoReadableRegularFileIsRefusedAtOnce) {
   EXPECT_EQ(refusal(folder), folder + " is no regular file: only those are uploaded");
   EXPECT_EQ(refusal(fifo), fifo + " is no regular file: only those are uploaded");
   EXPECT_EQ(refusal("/dev/null"), "/dev/null is no regular file: only those are uploaded");
-  EXPECT_EQ(refusal(folder + "/link"),
-            folder + "/link is a symbolic link: give the path of the file itself");
+  EXPECT_EQ(refusal(folder + "/link"), folder + "/link is a symbolic link: give the path of the file itself");
   EXPECT_EQ(refusal(folder + "/missing"), folder + "/missing cannot be opened: No such file or directory");
   EXPECT_EQ(session.uploadFile("").code, TARNEL_ERROR_INVALID_ARGUMENT);
   EXPECT_EQ(tarnel_session_upload_file(session.handle(), nullptr, nullptr, nullptr),

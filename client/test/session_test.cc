@@ -30,6 +30,13 @@ class SessionTest : public ::testing::Test {
     return options;
   }
 
+  // From when this returns: the stand-in's thread has gone round once, and sees the flag before it waits
+  // again.
+  void stopAccepting() {
+    daemon_.stopsAccepting = true;
+    daemon_.callClients({}, 0, 0, 0, {});
+  }
+
   test::ScratchFolder folder_;
   test::TestDaemon daemon_{folder_.file("socket")};
 };
@@ -176,7 +183,7 @@ TEST_F(SessionTest, EveryTypeOfValueArrives) {
 }
 
 TEST_F(SessionTest, WhatWaitsTravelsTogetherInOrderAndEachGetsItsOwnAnswer) {
-  daemon_.stopsAccepting = true;  // so that everything is queued before the first is sent
+  stopAccepting();  // so that everything is queued before the first is sent
   Session session(options());
   std::vector<std::string> answers;
   std::promise<void> last;
@@ -204,7 +211,7 @@ TEST_F(SessionTest, WhatWaitsTravelsTogetherInOrderAndEachGetsItsOwnAnswer) {
 }
 
 TEST_F(SessionTest, ABatchIsBoundedInBytes) {
-  daemon_.stopsAccepting = true;
+  stopAccepting();
   Session session(options());
   const auto payload = Dictionary().set("s", std::string(100'000, 'x'));
   for (int i = 0; i < 5; ++i) ASSERT_TRUE(session.sendMessage(1, 1, payload));
@@ -243,7 +250,7 @@ TEST_F(SessionTest, NoMoreThanTheLimitIsUnanswered) {
 }
 
 TEST_F(SessionTest, AFullQueueIsAClearErrorAndNothingIsHalfAccepted) {
-  daemon_.stopsAccepting = true;
+  stopAccepting();
   auto small = options();
   small.maxQueuedCalls = 2;
   Session session(std::move(small));
@@ -265,7 +272,7 @@ TEST_F(SessionTest, AFullQueueIsAClearErrorAndNothingIsHalfAccepted) {
 }
 
 TEST_F(SessionTest, TheQueueIsBoundedInBytesToo) {
-  daemon_.stopsAccepting = true;
+  stopAccepting();
   auto small = options();
   small.maxQueuedBytes = 100'000;
   Session session(std::move(small));
@@ -411,7 +418,7 @@ TEST_F(SessionTest, DrainWaitsForCallsWithoutAnswersToo) {
 TEST_F(SessionTest, ASessionMayBeDestroyedByItsOwnCallback) {
   std::promise<void> answered;
   std::promise<tarnel_status> rest;
-  daemon_.stopsAccepting = true;
+  stopAccepting();
   auto session = std::make_unique<Session>(options());
   ASSERT_TRUE(session->startConfig([&session, &answered](const Reply&) {
     session.reset();

@@ -27,7 +27,7 @@ struct Configuration {
   struct Limits {
     uint32_t connections = 1024;  // of all clients together
     uint32_t connectionsPerUser = 64;
-    std::chrono::seconds idleExit{0};       // 0: an idle process stays
+    std::chrono::seconds idleExit{0};      // 0: an idle process stays
     uint64_t maxUploadBytes = 32U << 20U;  // of one client file; at most half of what may be queued
     friend bool operator==(const Limits&, const Limits&) = default;
   };

@@ -113,8 +113,9 @@ std::vector<std::string> Directories::create() const {
     if (failures.size() != before) return;
     if (::faccessat(AT_FDCWD, path.c_str(), W_OK | X_OK, AT_EACCESS) == 0) return;
     const std::string user = std::to_string(::geteuid());
-    failures.push_back(systemError(path, ("cannot be written by user " + user).c_str()).localizedDescription() +
-                       "; change that with: chown " + user + " " + path);
+    failures.push_back(
+        systemError(path, ("cannot be written by user " + user).c_str()).localizedDescription() +
+        "; change that with: chown " + user + " " + path);
   };
   makeWritable(runtime_, private_ ? 0700 : 0755);
   makeWritable(state_, 0700);

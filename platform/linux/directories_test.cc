@@ -117,8 +117,9 @@ TEST(Directories, WhatCannotBeWrittenIsNamedWithTheRemedy) {
   });
   std::string expected;
   for (const char* name : {"run", "state", "logs"}) {
-    expected += folder.path(name) + ": cannot be written by user 65534: Permission denied; change that with: " +
-                "chown 65534 " + folder.path(name) + "\n";
+    expected += folder.path(name) +
+                ": cannot be written by user 65534: Permission denied; change that with: " + "chown 65534 " +
+                folder.path(name) + "\n";
   }
   EXPECT_EQ(said, expected);
 }

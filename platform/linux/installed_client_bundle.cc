@@ -35,7 +35,8 @@ std::vector<std::string> InstalledClientBundle::problems() {
   if (!contents) {
     problems.push_back(contents.error().localizedDescription() + ", so no storebag can be verified" + remedy);
   } else if (!der || RsaPublicKey::fromDer(*der) == nullptr) {
-    problems.push_back(key + ": holds no RSA public key in DER form, so no storebag can be verified" + remedy);
+    problems.push_back(key + ": holds no RSA public key in DER form, so no storebag can be verified" +
+                       remedy);
   }
   if (!version()) {
     problems.push_back(folder_ + "/version: holds no version, so storebags are asked for as by 8.0" + remedy);

@@ -58,9 +58,9 @@ TEST(InstalledClientBundle, ItsProblemsAreNamedWithTheRemedy) {
   folder.write("bundle/version", "8.2");
   folder.write("bundle/publicKey.der", "no key");
   EXPECT_EQ(bundle.problems(),
-            (std::vector<std::string>{folder.path("bundle/publicKey.der") +
-                                      ": holds no RSA public key in DER form, so no storebag can be verified" +
-                                      remedy}));
+            (std::vector<std::string>{
+                folder.path("bundle/publicKey.der") +
+                ": holds no RSA public key in DER form, so no storebag can be verified" + remedy}));
   folder.write("bundle/publicKey.der", publicKeyDer());
   EXPECT_TRUE(bundle.problems().empty());
 }

@@ -15,6 +15,7 @@
 #include "tools/tarnelctl/acting_as_owner.h"
 #include "tools/tarnelctl/consent_command.h"
 #include "tools/tarnelctl/log_command.h"
+#include "tools/tarnelctl/power_log_command.h"
 #include "tools/tarnelctl/replay_command.h"
 #include "tools/tarnelctl/send_command.h"
 #include "tools/tarnelctl/settings_command.h"
@@ -75,6 +76,7 @@ struct CommandLine {
   std::string uploaded;
   uint32_t uploadSeconds = 600;
   LogOptions logOptions;
+  PowerLogOptions powerLog;
   SettingsOptions settings;
   bool consentJson = false;
   StorebagOptions storebag;
@@ -200,6 +202,26 @@ void addLog(CommandLine& line) {
     line.run = [&line] {
       line.logOptions.directory = line.directories.messageLogDirectory();
       return showMessageLog(line.logOptions, line.terminal);
+    };
+  });
+}
+
+void addPowerLog(CommandLine& line) {
+  auto& options = line.powerLog;
+  auto* command = line.app.add_subcommand("power-log", "show the power log: events that were recorded there");
+  command->add_option("-n,--lines", options.lines, "only the last N records");
+  command->add_flag("-f,--follow", options.follow, "go on with what is recorded, until interrupted");
+  command->add_flag("--json", options.json, "one line of JSON for each");
+  command->add_option("--unit", options.unit, "whose entries of the journal count; empty: everybody's")
+      ->capture_default_str();
+  auto* directory =
+      command->add_option("--directory", options.journalDirectory, "a folder with the journal's files");
+  command->add_option("--file", options.file, "a file of records")->excludes(directory);
+  command->callback([&line] {
+    line.run = [&line] {
+      if (line.powerLog.journalDirectory.empty() && line.powerLog.file.empty())
+        line.powerLog.file = powerLogFile(line.directories, kJournalSocket);
+      return showPowerLog(line.powerLog, line.terminal);
     };
   });
 }
@@ -332,10 +354,12 @@ int runCommandLine(int argc, char** argv) {
   addSend(line);
   addReplay(line);
   addSingle(line);
-  addUpload(line, "upload", "upload a file, which is deleted when the server takes it", "the file", uploadFile);
+  addUpload(line, "upload", "upload a file, which is deleted when the server takes it", "the file",
+            uploadFile);
   addUpload(line, "upload-log", "upload log records",
             "JSON array of records, or one record a line; - for standard input", uploadLogRecords);
   addLog(line);
+  addPowerLog(line);
   addSettings(line);
   addConsent(line);
   addStorebag(line);

@@ -241,7 +241,8 @@ class Session {
     return wait(timeout, tarnel_session_finish_and_wait, handle_);
   }
 
-  // Uploads a file, which is deleted when the server takes it; see tarnel_session_upload_file. Reply: success.
+  // Uploads a file, which is deleted when the server takes it; see tarnel_session_upload_file. Reply:
+  // success.
   Status uploadFile(const std::string& path, Completion completion = {}) {
     return async(std::move(completion), tarnel_session_upload_file, handle_, path.c_str());
   }
