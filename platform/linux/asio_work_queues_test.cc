@@ -169,6 +169,7 @@ TEST_F(AsioWorkQueuesTest, ReadSourceFiresForWhatWasThereBeforeAndForWhatComes) 
   std::string got;
   std::promise<void> two;
   std::promise<void> three;
+  std::promise<void> gone;
   source->start(
       [&got, &two, &three, fd = here.get()] {
         char c = 0;
@@ -176,12 +177,12 @@ TEST_F(AsioWorkQueuesTest, ReadSourceFiresForWhatWasThereBeforeAndForWhatComes) 
         if (got.size() == 2) two.set_value();
         if (got.size() == 3) three.set_value();
       },
-      nullptr);
+      [&gone] { gone.set_value(); });
   expectSoon(two.get_future());
   ASSERT_EQ(::send(there.get(), "c", 1, 0), 1);
   expectSoon(three.get_future());
   source.reset();
-  settle(*queue);
+  expectSoon(gone.get_future());  // only then may the descriptor be closed
   EXPECT_EQ(got, "abc");
 }
 
