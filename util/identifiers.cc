@@ -7,6 +7,9 @@
 namespace tarnel {
 namespace {
 
+// Names come from clients. Longer keys are not stored, so that no client fills the settings with a single one.
+constexpr size_t kMaxKeyBytes = 512;
+
 // Held while an identifier is made, so that two sessions asking at once get the same one.
 constinit std::mutex creationMutex;
 
@@ -26,6 +29,13 @@ MaybeString storedIdentifier(const Dependencies& dependencies, const std::string
 }
 
 std::string storedOrNewIdentifier(const Dependencies& dependencies, const std::string& key) {
+  if (key.size() > kMaxKeyBytes) {
+    TARNEL_LOG(dependencies.log, warning,
+               "getPersistentIdentifierForCustomClientIDSuffix: a key of %zu bytes is not stored; names may "
+               "have %zu bytes together",
+               key.size(), kMaxKeyBytes);
+    return uuidText(dependencies.random.uuid());
+  }
   if (auto stored = storedIdentifier(dependencies, key)) return *std::move(stored);
   const std::lock_guard lock(creationMutex);
   if (auto stored = storedIdentifier(dependencies, key)) return *std::move(stored);

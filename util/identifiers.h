@@ -8,7 +8,7 @@ namespace tarnel {
 
 // A random UUID text (36 characters) that stays the same for the same two parts, kept in the settings store
 // under "uuid:FIRST:SECOND"; a missing part is the empty text. A store that cannot be read gives a new one
-// every time.
+// every time, and so do names of more than about 500 bytes, which are not stored.
 std::string getPersistentIdentifierForCustomClientIDSuffix(const Dependencies& dependencies,
                                                            const MaybeString& first,
                                                            const MaybeString& second);

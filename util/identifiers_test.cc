@@ -92,6 +92,16 @@ TEST_F(IdentifiersTest, ValueThatIsNoIdentifierIsReplaced) {
   }
 }
 
+TEST_F(IdentifiersTest, KeysThatAreTooLongAreNotStored) {
+  const std::string longest(512 - std::string("uuid:").size() - std::string(":").size(), 'x');
+  EXPECT_EQ(identifier(longest, std::nullopt), identifier(longest, std::nullopt));
+  EXPECT_NE(identifier(longest + "x", std::nullopt), identifier(longest + "x", std::nullopt));
+  EXPECT_EQ(stored("uuid:" + longest + "x:"), std::nullopt);
+  EXPECT_TRUE(world_.log.contains(LogLevel::warning,
+                                  "getPersistentIdentifierForCustomClientIDSuffix: a key of 513 bytes is not "
+                                  "stored; names may have 512 bytes together"));
+}
+
 TEST_F(IdentifiersTest, ThreadsThatAskAtOnceGetTheSame) {
   std::vector<std::string> results(4);
   std::vector<std::thread> threads;
