@@ -7,7 +7,7 @@
 namespace tarnel {
 namespace {
 
-// Names come from clients. Longer keys are not stored, so that no client fills the settings with a single one.
+// Names come from clients. Longer keys are not stored, so that none of them fills the settings alone.
 constexpr size_t kMaxKeyBytes = 512;
 
 // Held while an identifier is made, so that two sessions asking at once get the same one.
