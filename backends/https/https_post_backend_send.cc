@@ -122,10 +122,11 @@ MaybeString HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion comple
     completion(std::nullopt, flushError("Can not flush: the events can not be written as JSON"));
     return std::nullopt;
   }
-  postJSONMessage(std::move(*body), Flag::normal, std::nullopt, std::nullopt,
-                  [pretty, completion = std::move(completion)](MaybeString, MaybeError error) mutable {
-                    completion(std::move(pretty), std::move(error));
-                  });
+  postJSONMessage(
+      std::move(*body), Flag::normal, std::nullopt, std::nullopt,
+      [pretty, completion = std::move(completion)](const MaybeString& /*text*/, MaybeError error) mutable {
+        completion(std::move(pretty), std::move(error));
+      });
   return pretty;
 }
 

@@ -154,6 +154,7 @@ void TarnelLogging::write(LogLevel level, std::string_view text) {
   if (journal_) {
     std::vector<std::string> fields = journalFields(level, text);
     std::vector<iovec> parts;
+    parts.reserve(fields.size());
     for (std::string& field : fields) parts.push_back({.iov_base = field.data(), .iov_len = field.size()});
     if (::sd_journal_sendv(parts.data(), static_cast<int>(parts.size())) >= 0) return;
   }

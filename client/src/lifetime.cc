@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <chrono>
 #include <cstdlib>
+#include <memory>
 #include <mutex>
 #include <new>
 
@@ -30,7 +31,7 @@ struct Registry {
 // Never destroyed: threads and static objects may use it until the very end of the process.
 Registry& registry() {
   alignas(Registry) static std::byte storage[sizeof(Registry)];
-  static Registry* const made = ::new (storage) Registry;
+  static Registry* const made = std::construct_at(reinterpret_cast<Registry*>(storage));
   return *made;
 }
 
