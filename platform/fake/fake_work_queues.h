@@ -17,6 +17,21 @@ class FakeWorkQueues final : public WorkQueues {
  public:
   using Time = std::chrono::nanoseconds;
 
+  FakeWorkQueues() = default;
+  // Lets go of what handlers hold, as the end of the real queues does: a backend and its timer hold each
+  // other.
+  ~FakeWorkQueues() override {
+    const auto sources = std::move(sources_);
+    sources_.clear();
+    for (const auto& source : sources) source->isCancelled = true;
+    for (const auto& source : sources) {
+      source->event = nullptr;
+      source->cancel = nullptr;
+    }
+    while (!ready_.empty()) ready_.pop_front();
+    delayed_.clear();
+  }
+
   // Set to have the next makings refused.
   bool refuseQueues = false;
   bool refuseTimers = false;

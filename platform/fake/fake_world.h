@@ -37,8 +37,8 @@ struct FakeWorld {
   ProcessValues process{log, deviceInformation, settings};
   FakeClientFiles clientFiles;
   Uploads uploads{clientFiles};
-  FakeWorkQueues workQueues;
   FakeDatagramSockets datagramSockets;
+  FakeWorkQueues workQueues;  // goes first: what its handlers hold uses the sockets
   Dependencies dependencies{.log = log,
                             .clock = clock,
                             .random = random,
