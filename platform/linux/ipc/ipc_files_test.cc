@@ -191,11 +191,13 @@ TEST_F(IpcFilesTest, ATokenIsGoodOnceAndUntilItsCallEnds) {
   service.start();
   BusClient client(service.path());
   EXPECT_EQ(upload(client, "/x", open(write("x", "x"))), true);
+  const std::string first = kept;
+  // The answer may be here before its call has ended; the next call only begins after that.
+  EXPECT_EQ(upload(client, "/x", open(write("x", "x"))), true);
   const char* const ended =
       "ClientFiles: An extension token is refused: no file was handed over with it, or its call has ended";
-  EXPECT_EQ(refusal(kept), ended);
+  EXPECT_EQ(refusal(first), ended);
   EXPECT_EQ(refusal(""), ended);
-  EXPECT_EQ(upload(client, "/x", open(write("x", "x"))), true);
 }
 
 TEST_F(IpcFilesTest, ATokenOfAnotherConnectionIsRefused) {
