@@ -162,9 +162,9 @@ struct LinuxWorld::Prepared {
                                   .consentIdentifiers = consentIdentifiers,
                                   .process = process,
                                   .uploads = uploads,
-                                  .messageLogDirectory = directories.messageLogDirectory(),
                                   .workQueues = workQueues,
-                                  .datagramSockets = datagramSockets};
+                                  .datagramSockets = datagramSockets,
+                                  .messageLogDirectory = directories.messageLogDirectory()};
 };
 
 LinuxWorld::LinuxWorld() = default;

@@ -1,6 +1,5 @@
 #pragma once
 
-#include <cerrno>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
@@ -50,9 +49,7 @@ class DatagramSockets {
   virtual ~DatagramSockets() = default;
 
   // The error's code is the error number.
-  virtual Result<std::unique_ptr<DatagramSocket>> create() {
-    return Error(kDatagramErrorDomain, ENOSYS, "no datagram sockets here");
-  }
+  virtual Result<std::unique_ptr<DatagramSocket>> create() = 0;
 
   static constexpr char kDatagramErrorDomain[] = "TarnelDatagramErrorDomain";
 };

@@ -66,7 +66,7 @@ class WorkQueues {
   virtual ~WorkQueues() = default;
 
   // The label names the queue in the log. Null when none can be had (logged).
-  virtual std::shared_ptr<WorkQueue> makeQueue(std::string /*label*/) { return nullptr; }
+  virtual std::shared_ptr<WorkQueue> makeQueue(std::string label) = 0;
 };
 
 }  // namespace tarnel

@@ -23,10 +23,6 @@
 
 namespace tarnel {
 
-// For worlds in which no datagrams are sent: they have neither queues nor sockets.
-inline WorkQueues noWorkQueues;
-inline DatagramSockets noDatagramSockets;
-
 // Everything through which the agent, its sessions and their backends reach the world. Built once, in main
 // or in a test fixture; outlives all of them.
 struct Dependencies {
@@ -46,9 +42,9 @@ struct Dependencies {
   ConsentIdentifiers& consentIdentifiers;
   ProcessValues& process;
   Uploads& uploads;
+  WorkQueues& workQueues;
+  DatagramSockets& datagramSockets;
   std::string messageLogDirectory;
-  WorkQueues& workQueues = noWorkQueues;
-  DatagramSockets& datagramSockets = noDatagramSockets;
 };
 
 }  // namespace tarnel

@@ -42,23 +42,7 @@ class MessageLogFilesTest : public testing::Test {
   int64_t realNow_ = 0;
   fake::FakeWorld world_;
   LinuxFileSystem files_;
-  Dependencies dependencies_{.log = world_.log,
-                             .clock = world_.clock,
-                             .random = world_.random,
-                             .http = world_.http,
-                             .deviceInformation = world_.deviceInformation,
-                             .settings = world_.settings,
-                             .consent = world_.consent,
-                             .locale = world_.locale,
-                             .files = files_,
-                             .clientBundle = world_.clientBundle,
-                             .keepAlive = world_.keepAlive,
-                             .codeBundles = world_.codeBundles,
-                             .powerLog = world_.powerLog,
-                             .consentIdentifiers = world_.consentIdentifiers,
-                             .process = world_.process,
-                             .uploads = world_.uploads,
-                             .messageLogDirectory = {}};
+  Dependencies dependencies_ = world_.withFiles(files_);
 };
 
 TEST_F(MessageLogFilesTest, DirectoryAndFileAreMadeAndAppendedTo) {

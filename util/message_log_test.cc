@@ -224,23 +224,7 @@ TEST_F(MessageLogTest, WriteFailureDeletesTheFile) {
 
 TEST_F(MessageLogTest, FileThatCannotBeDeletedIsReportedAndTheMessageStillWritten) {
   UndeletableFiles files(world_.files);
-  Dependencies dependencies{.log = world_.log,
-                            .clock = world_.clock,
-                            .random = world_.random,
-                            .http = world_.http,
-                            .deviceInformation = world_.deviceInformation,
-                            .settings = world_.settings,
-                            .consent = world_.consent,
-                            .locale = world_.locale,
-                            .files = files,
-                            .clientBundle = world_.clientBundle,
-                            .keepAlive = world_.keepAlive,
-                            .codeBundles = world_.codeBundles,
-                            .powerLog = world_.powerLog,
-                            .consentIdentifiers = world_.consentIdentifiers,
-                            .process = world_.process,
-                            .uploads = world_.uploads,
-                            .messageLogDirectory = kDirectory};
+  const Dependencies dependencies = world_.withFiles(files);
   const auto old = addFile("tarneld_1_messageLog.diag", 90000);
   writeToLogFile(dependencies, "message");
   EXPECT_TRUE(exists(old));

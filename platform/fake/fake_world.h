@@ -39,25 +39,30 @@ struct FakeWorld {
   Uploads uploads{clientFiles};
   FakeDatagramSockets datagramSockets;
   FakeWorkQueues workQueues;  // goes first: what its handlers hold uses the sockets
-  Dependencies dependencies{.log = log,
-                            .clock = clock,
-                            .random = random,
-                            .http = http,
-                            .deviceInformation = deviceInformation,
-                            .settings = settings,
-                            .consent = consent,
-                            .locale = locale,
-                            .files = files,
-                            .clientBundle = clientBundle,
-                            .keepAlive = keepAlive,
-                            .codeBundles = codeBundles,
-                            .powerLog = powerLog,
-                            .consentIdentifiers = consentIdentifiers,
-                            .process = process,
-                            .uploads = uploads,
-                            .messageLogDirectory = "/log/Retired",
-                            .workQueues = workQueues,
-                            .datagramSockets = datagramSockets};
+  Dependencies dependencies = withFiles(files);
+
+  // The same world with another file system.
+  Dependencies withFiles(FileSystem& otherFiles) {
+    return {.log = log,
+            .clock = clock,
+            .random = random,
+            .http = http,
+            .deviceInformation = deviceInformation,
+            .settings = settings,
+            .consent = consent,
+            .locale = locale,
+            .files = otherFiles,
+            .clientBundle = clientBundle,
+            .keepAlive = keepAlive,
+            .codeBundles = codeBundles,
+            .powerLog = powerLog,
+            .consentIdentifiers = consentIdentifiers,
+            .process = process,
+            .uploads = uploads,
+            .workQueues = workQueues,
+            .datagramSockets = datagramSockets,
+            .messageLogDirectory = "/log/Retired"};
+  }
 };
 
 }  // namespace tarnel::fake

@@ -325,9 +325,5 @@ TEST_F(AsioWorkQueuesTest, ThreadLeavesSignalsToOthers) {
   EXPECT_EQ(sigismember(&here, SIGTERM), 0);
 }
 
-TEST(WorkQueuesTest, BaseHasNoQueues) {
-  EXPECT_EQ(WorkQueues().makeQueue("com.example.one"), nullptr);
-}
-
 }  // namespace
 }  // namespace tarnel

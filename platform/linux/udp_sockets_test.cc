@@ -155,11 +155,5 @@ TEST(UdpSocketsTest, WithoutDescriptorsTheErrorNumberIsGiven) {
   EXPECT_EQ(socket.error().code(), EMFILE);
 }
 
-TEST(DatagramSocketsTest, BaseHasNoSockets) {
-  const auto socket = DatagramSockets().create();
-  ASSERT_FALSE(static_cast<bool>(socket));
-  EXPECT_EQ(socket.error().code(), ENOSYS);
-}
-
 }  // namespace
 }  // namespace tarnel
