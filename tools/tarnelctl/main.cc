@@ -13,15 +13,16 @@
 
 #include "platform/linux/directories.h"
 #include "tools/tarnelctl/acting_as_owner.h"
+#include "tools/tarnelctl/archive_command.h"
 #include "tools/tarnelctl/consent_command.h"
 #include "tools/tarnelctl/log_command.h"
 #include "tools/tarnelctl/power_log_command.h"
 #include "tools/tarnelctl/replay_command.h"
 #include "tools/tarnelctl/send_command.h"
 #include "tools/tarnelctl/settings_command.h"
+#include "tools/tarnelctl/standard_streams.h"
 #include "tools/tarnelctl/storebag_command.h"
 #include "tools/tarnelctl/upload_command.h"
-#include "tools/tarnelctl/visible_output.h"
 
 #ifndef TARNEL_VERSION
 #error "TARNEL_VERSION comes from the build"
@@ -35,34 +36,10 @@ constexpr char kFooter[] =
     "A private instance is chosen by RUNTIME_DIRECTORY, STATE_DIRECTORY, LOGS_DIRECTORY and\n"
     "CONFIGURATION_DIRECTORY; --socket and TARNEL_SOCKET name another socket. See tarnelctl(1).";
 
-// Errors of the settings store are told by the commands; what it logs beside them goes to standard error.
-class StandardErrorLog final : public Log {
- public:
-  explicit StandardErrorLog(const Terminal& terminal) : terminal_(terminal) {}
-
- protected:
-  void write(LogLevel /*level*/, std::string_view text) override {
-    terminal_.err << "tarnelctl: " << text << '\n';
-  }
-
- private:
-  const Terminal& terminal_;
-};
-
-// Standard output and standard error; on a terminal nothing that is printed can steer it.
-struct Streams {
-  const bool outIsTerminal = isatty(STDOUT_FILENO) == 1;
-  const bool errIsTerminal = isatty(STDERR_FILENO) == 1;
-  VisibleOutput visibleOut{*std::cout.rdbuf()};
-  VisibleOutput visibleErr{*std::cerr.rdbuf()};
-  std::ostream out{outIsTerminal ? &visibleOut : std::cout.rdbuf()};
-  std::ostream err{errIsTerminal ? &visibleErr : std::cerr.rdbuf()};
-};
-
 // All that the options of all commands fill in, and the command that was chosen.
 struct CommandLine {
   CLI::App app{"Runs, configures and debugs the Tarnel reporting daemon.", "tarnelctl"};
-  Streams streams;
+  StandardStreams streams;
   Terminal terminal{streams.out, streams.err, streams.outIsTerminal, streams.errIsTerminal, &std::cerr};
   Directories directories = Directories::fromEnvironment();
   StandardErrorLog log{terminal};
@@ -80,6 +57,7 @@ struct CommandLine {
   SettingsOptions settings;
   bool consentJson = false;
   StorebagOptions storebag;
+  ArchiveOptions archive;
 
   TomlSettingsStore store() { return {directories.configuration(), directories.state(), log}; }
   // Empty where the client library finds the installed daemon, or what TARNEL_SOCKET names, by itself.
@@ -321,6 +299,18 @@ void addStorebag(CommandLine& line) {
   sign->add_flag("--force", options.force, "replace what is there; sign in spite of errors");
 }
 
+void addArchive(CommandLine& line) {
+  auto* group = line.app.add_subcommand("archive", "look into uploaded log data")->require_subcommand(1);
+  auto* show = group->add_subcommand("show", "print what a keyed archive holds");
+  show->add_option("file", line.archive.file,
+                   "the body of a log data upload, at most 16 MiB; - for standard input")
+      ->required();
+  show->add_flag("--json", line.archive.json,
+                 "one JSON document; a date is {\"$date\": ...}, data is {\"$data\": base-64}");
+  show->callback(
+      [&line] { line.run = [&line] { return showArchive(line.archive, STDIN_FILENO, line.terminal); }; });
+}
+
 // The parser itself would only say that a command is missing.
 bool isUnknownCommand(const CommandLine& line, int argc, char** argv) {
   const CLI::App* app = &line.app;
@@ -363,6 +353,7 @@ int runCommandLine(int argc, char** argv) {
   addSettings(line);
   addConsent(line);
   addStorebag(line);
+  addArchive(line);
   if (isUnknownCommand(line, argc, argv)) return static_cast<int>(ExitStatus::usage);
   try {
     line.app.parse(argc, argv);
