@@ -36,7 +36,8 @@ TomlNode convert(const toml::node& node) {
   if (const auto* table = node.as_table()) {
     result.kind = TomlNode::Kind::table;
     result.entries.reserve(table->size());
-    for (const auto& [key, entry] : *table) result.entries.emplace_back(key.str(), convert(entry));
+    for (const auto& [key, entry] : *table)
+      result.entries.push_back({std::string(key.str()), convert(entry)});
   } else if (const auto* array = node.as_array()) {
     result.kind = TomlNode::Kind::array;
     result.elements.reserve(array->size());

@@ -4,7 +4,6 @@
 #include <optional>
 #include <string>
 #include <string_view>
-#include <utility>
 #include <vector>
 
 #include "platform/base/error.h"
@@ -16,20 +15,27 @@
 
 namespace tarnel {
 
+struct TomlEntry;
+
 // One value of a document. Exactly one of the three forms is filled.
 struct TomlNode {
   enum class Kind : uint8_t { scalar, array, table };
 
   Kind kind = Kind::scalar;
-  uint32_t line = 0;                                      // 1 and up
-  Value scalar;                                           // null: a local time, which no value can hold
-  std::vector<TomlNode> elements;                         // of an array
-  std::vector<std::pair<std::string, TomlNode>> entries;  // of a table, sorted by key
+  uint32_t line = 0;               // 1 and up
+  Value scalar;                    // null: a local time, which no value can hold
+  std::vector<TomlNode> elements;  // of an array
+  std::vector<TomlEntry> entries;  // of a table, sorted by key
 
   // The entry of a table, or null.
   const TomlNode* find(std::string_view key) const;
   // All of it as one value. A date-time without offset counts as UTC; a local time becomes null.
   Value value() const;
+};
+
+struct TomlEntry {
+  std::string key;
+  TomlNode node;
 };
 
 inline constexpr char kTomlErrorDomain[] = "TarnelTomlErrorDomain";
