@@ -4,6 +4,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <stdexcept>
 #include <string>
 #include <utility>
 #include <vector>
@@ -44,6 +45,8 @@ struct BackendScript {
   MaybeError flushError;
   bool holdFlush = false;
   bool uploads = false;
+  bool sendThrows = false;
+  bool cleanupThrows = false;
 };
 
 // Keeps what it is given. Like a real one it takes no lock.
@@ -72,7 +75,10 @@ class FakeBackend final : public TarnelBackend {
     setDisplayURL(script.displayURL);
   }
 
-  void cleanup() override { journal_.add(name() + " cleanup"); }
+  void cleanup() override {
+    journal_.add(name() + " cleanup");
+    if (script_.cleanupThrows) throw std::runtime_error("cleanup went wrong");
+  }
   void updateState() override {
     journal_.add(name() + " updateState");
     setHierarchy(script_.hierarchy);
@@ -92,6 +98,7 @@ class FakeBackend final : public TarnelBackend {
                               RespCode respCode, EventID eventID, Flag flag) override {
     journal_.add(name() + " send " + std::to_string(static_cast<int>(method)) + "/" +
                  std::to_string(static_cast<int>(respCode)));
+    if (script_.sendThrows) throw std::runtime_error("send went wrong");
     sent.push_back({payload, timestamp, method, respCode, eventID, flag, combinedSessionIDString()});
     return script_.sends;
   }

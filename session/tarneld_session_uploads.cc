@@ -1,6 +1,7 @@
 // Uploads, and single messages with session info of their own.
 
 #include <array>
+#include <exception>
 #include <utility>
 
 #include "client/include/tarnel/keys.h"
@@ -48,6 +49,31 @@ std::string pathOfURL(std::string_view url) {
 bool holds(const MaybeDictionary& dictionary, const char* key) {
   return dictionary && dictionary->contains(key);
 }
+
+// Cleans up every backend at its end, whatever sending or another's clean-up comes to.
+class TemporaryBackends {
+ public:
+  TemporaryBackends(BackendSet backends, Log& log) : backends_(std::move(backends)), log_(log) {}
+  TemporaryBackends(const TemporaryBackends&) = delete;
+  TemporaryBackends& operator=(const TemporaryBackends&) = delete;
+  ~TemporaryBackends() {
+    for (const auto& [name, backend] : backends_) cleanUp(name, *backend);
+  }
+  const BackendSet& backends() const noexcept { return backends_; }
+
+ private:
+  void cleanUp(const std::string& name, TarnelBackend& backend) noexcept {
+    try {
+      backend.cleanup();
+    } catch (const std::exception& failure) {
+      TARNEL_LOG(log_, error, "sendMessageWithSessionInfo: %s was not cleaned up in order: %s", name.c_str(),
+                 failure.what());
+    }
+  }
+
+  const BackendSet backends_;
+  Log& log_;
+};
 
 }  // namespace
 
@@ -128,18 +154,18 @@ void TarneldSession::sendMessageWithSessionInfo(const Dependencies& dependencies
   }
   std::array<char, 41> deviceid{};
   getUniqueDeviceID(dependencies.deviceInformation, deviceid.data(), deviceid.size());
-  const auto backends =
-      createBackends(dependencies, factory, storebag, sessionInfo, userInfo, deviceid.data());
-  if (!backends || backends->empty()) {
+  auto created = createBackends(dependencies, factory, storebag, sessionInfo, userInfo, deviceid.data());
+  if (!created || created->empty()) {
     TARNEL_LOG(log, error, "sendMessageWithSessionInfo: No backends available to send single message");
     return;
   }
+  const TemporaryBackends temporary(*std::move(created), log);
   const Value* required = sessionInfo->find(kTarnelSessionInfoRequireUserInfo);
   if (userInfo && (required == nullptr || !required->boolValue())) {
     TARNEL_LOG(log, warning, "sendMessageWithSessionInfo: user info provided without requiring it.");
   }
   const TimeValue now = dependencies.clock.timeOfDay();
-  for (const auto& [name, backend] : *backends) {
+  for (const auto& [name, backend] : temporary.backends()) {
     backend->updateState();
     const MaybeSentObject sent =
         backend->sendMessage(payload, now, Method{category}, RespCode{type}, Flag::normal);
@@ -147,7 +173,6 @@ void TarneldSession::sendMessageWithSessionInfo(const Dependencies& dependencies
     writeToLogFile(dependencies, "[%s -> sendMessageWithSessionInfo] %s", name.c_str(),
                    tarnel::description(*sent).c_str());
   }
-  for (const auto& [name, backend] : *backends) backend->cleanup();
 }
 
 }  // namespace tarnel

@@ -82,6 +82,16 @@ TEST_F(SessionUploads, LogDataIsOfferedToEveryBackend) {
   EXPECT_THAT(backends.journal.lines(),
               ElementsAre("dashboard uploadLogData of 2", "httppost uploadLogData of 2"));
   EXPECT_TRUE(logged(LogLevel::debug, "uploadLogData: Log data array upload successful"));
+  EXPECT_FALSE(logged(LogLevel::error, "uploadLogData: Log data array upload failed"));
+}
+
+TEST_F(SessionUploads, LogDataGoesOnToTheOthersWhenOneHasTakenIt) {
+  offer({"dashboard", "httppost"});
+  backends.scripts["dashboard"].uploads = true;
+  configureAndStart();
+  EXPECT_EQ(uploadLog(), true);
+  EXPECT_THAT(backends.journal.lines(),
+              ElementsAre("dashboard uploadLogData of 2", "httppost uploadLogData of 2"));
 }
 
 TEST_F(SessionUploads, LogDataThatNoBackendTakesFailsWithoutAnError) {
@@ -112,6 +122,7 @@ TEST_F(SessionUploads, SingleMessageWithoutAStorebagSaysSo) {
 
 TEST_F(SessionUploads, SingleMessageGoesThroughABackendSetOfItsOwn) {
   offer({"httppost", "dashboard"});
+  session->setHasAggregator(true);  // it is not aggregated
   backends.scripts["httppost"].sends = SentObject(Error(kTarnelErrorDomain, -1, "broken"));
   EXPECT_EQ(single(info(9), user()), "finished");
   EXPECT_THAT(backends.journal.lines(),
@@ -126,6 +137,8 @@ TEST_F(SessionUploads, SingleMessageGoesThroughABackendSetOfItsOwn) {
   EXPECT_EQ(backend->udid(), "0123456789abcdef0123456789abcdef01234567");
   EXPECT_EQ(backend->sent.at(0).payload, (Dictionary{{"a", 1}}));
   EXPECT_EQ(backend->sent.at(0).flag, Flag::normal);
+  EXPECT_EQ(backend->sent.at(0).timestamp.seconds, world.clock.timeOfDay().seconds);
+  EXPECT_EQ(backend->sent.at(0).timestamp.microseconds, world.clock.timeOfDay().microseconds);
   EXPECT_TRUE(session->backends().empty());
   EXPECT_THAT(connection->sentToClient(), IsEmpty());
 }
@@ -135,8 +148,34 @@ TEST_F(SessionUploads, SingleMessageWarnsOfUserInfoThatIsNotRequired) {
   const std::string line = "sendMessageWithSessionInfo: user info provided without requiring it.";
   single(info(9), user());
   EXPECT_FALSE(logged(LogLevel::warning, line));
+  single(info(9, false));
+  EXPECT_FALSE(logged(LogLevel::warning, line));
   single(info(9, false), user());
-  EXPECT_TRUE(logged(LogLevel::warning, line));
+  EXPECT_EQ(world.log.count(LogLevel::warning, line), 1U);
+  Dictionary without = info(9);
+  without.remove(kTarnelSessionInfoRequireUserInfo);
+  single(without, user());
+  EXPECT_EQ(world.log.count(LogLevel::warning, line), 2U);
+}
+
+TEST_F(SessionUploads, WhatASingleMessagesBackendAnswersIsLogged) {
+  offer({"httppost"});
+  backends.scripts["httppost"].sends = SentObject(std::string("what was posted"));
+  EXPECT_EQ(single(info(9)), "finished");
+  EXPECT_THAT(messageLog(), ElementsAre("[httppost -> sendMessageWithSessionInfo] what was posted"));
+}
+
+TEST_F(SessionUploads, EveryBackendOfASingleMessageIsCleanedUpWhateverIsThrown) {
+  offer({"httppost", "dashboard"});
+  backends.scripts["httppost"].sendThrows = true;
+  backends.scripts["httppost"].cleanupThrows = true;
+  EXPECT_THROW(single(info(9)), std::runtime_error);
+  const auto lines = backends.journal.lines();
+  ASSERT_GE(lines.size(), 3U);
+  EXPECT_THAT(Lines(lines.end() - 3, lines.end()),
+              ElementsAre("httppost send 3/4", "httppost cleanup", "dashboard cleanup"));
+  EXPECT_TRUE(logged(LogLevel::error,
+                     "sendMessageWithSessionInfo: httppost was not cleaned up in order: cleanup went wrong"));
 }
 
 TEST_F(SessionUploads, SingleMessageWithoutAnyBackendIsStillFinished) {
