@@ -28,6 +28,12 @@ Outcome lost() {
                  "the connection to the daemon was lost: reconnect and configure the session again");
 }
 
+// Uploads travel alone.
+bool isUpload(const std::vector<Request>& requests) {
+  const auto kind = requests.front().kind;
+  return kind == Request::Kind::uploadFile || kind == Request::Kind::uploadLogData;
+}
+
 bool isDisconnect(int error) {
   return error == ECONNRESET || error == EPIPE || error == ENOTCONN || error == ECONNABORTED ||
          error == ESHUTDOWN || error == ECONNREFUSED;
@@ -153,10 +159,10 @@ Outcome Connection::send(std::vector<Request> requests) {
 }
 
 Outcome Connection::transmit(std::vector<Request> requests, BusMessage message) {
-  const bool isUpload = requests.front().kind == Request::Kind::uploadFile;
-  // An upload is known until it is answered: meanwhile the daemon may ask for the file's deletion.
+  // An upload is known until it is answered: meanwhile the daemon may ask for the file's deletion, and calls
+  // behind it have to wait.
   const bool wantsReply =
-      isUpload || requests.front().kind == Request::Kind::barrier ||
+      isUpload(requests) || requests.front().kind == Request::Kind::barrier ||
       std::any_of(requests.begin(), requests.end(), [](const Request& r) { return bool(r.completion); });
   const uint64_t sequence = ++lastSequence_;
   int result = 0;
@@ -172,12 +178,13 @@ Outcome Connection::transmit(std::vector<Request> requests, BusMessage message) 
       request.array.reset();
     }
     unanswered_ += requests.size();
+    if (isUpload(requests)) ++uploads_;
     Call& call = calls_.emplace_back(Call{this, sequence, std::move(requests), false, {}});
     call.self = std::prev(calls_.end());
     result = sd_bus_call_async(
         bus_.get(), nullptr, message.get(),
         [](sd_bus_message* reply, void* held, sd_bus_error* error) { return onReply(reply, held, error); },
-        &call, isUpload ? kUploadTimeoutMicroseconds : replyTimeoutMicroseconds_);
+        &call, uploads_ > 0 ? kUploadTimeoutMicroseconds : replyTimeoutMicroseconds_);
   }
   return result < 0 ? lost() : Outcome{};
 }
@@ -191,6 +198,7 @@ std::vector<Request> Connection::takeUnanswered() {
   bus_.reset();  // it still refers to the calls
   calls_.clear();
   unanswered_ = 0;
+  uploads_ = 0;
   return requests;
 }
 
@@ -224,6 +232,7 @@ void Connection::handleReply(Call& call, sd_bus_message* reply) {
   std::vector<Answer> answers = readAnswers(reply, call.requests);
   std::vector<Request> requests = std::move(call.requests);
   unanswered_ -= requests.size();
+  if (isUpload(requests)) --uploads_;
   calls_.erase(call.self);
   for (size_t i = 0; i < requests.size(); ++i) host_.answered(requests[i], answers[i]);
   passBarriers();

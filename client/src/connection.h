@@ -97,6 +97,7 @@ class Connection {
   std::unique_ptr<sd_bus, BusCloser> bus_;
   std::list<Call> calls_;
   size_t unanswered_ = 0;
+  size_t uploads_ = 0;  // of the calls; while there are any, no other call can be late
   uint64_t lastSequence_ = 0;
   uint64_t lastUnconfirmed_ = 0;  // the last call that asked for no answer
   uint64_t lastConfirmed_ = 0;    // the last call that was answered

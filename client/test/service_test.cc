@@ -293,6 +293,43 @@ TEST_F(FilesAndService, NoFileStaysOpenAndTheirNumberIsBounded) {
   EXPECT_TRUE(session.uploadFileAndWait(path, kLong).success);
 }
 
+// A second session's call that is late says when the time for answers is over.
+TEST_F(FilesAndService, NeitherUploadsNorCallsBehindThemAreEverLate) {
+  std::promise<void> goOn;
+  std::promise<void> end;
+  auto mayGoOn = goOn.get_future().share();
+  auto mayEnd = end.get_future().share();
+  service.prepare = [mayGoOn, mayEnd](RecordingSession& session) {
+    session.onCall = [mayGoOn, mayEnd](const std::string& call) {
+      if (call.starts_with("upload")) mayGoOn.wait();
+      if (call.starts_with("flush")) mayEnd.wait();
+    };
+  };
+  service.start();
+  auto options = optionsFor(service);
+  options.replyTimeout = 100ms;
+  client::Session ofFile(options);
+  EXPECT_TRUE(ofFile.uploadFile(write("x")));
+  client::Session ofLogData(options);
+  EXPECT_TRUE(ofLogData.uploadLogData(client::Array().append("line"), {}));
+  std::promise<tarnel_status> behindFile;
+  std::promise<tarnel_status> behindLogData;
+  const auto tell = [](std::promise<tarnel_status>& to) {
+    return [&to](const client::Reply& reply) { to.set_value(reply.status.code); };
+  };
+  EXPECT_TRUE(ofFile.startConfig(tell(behindFile)));
+  EXPECT_TRUE(ofLogData.startConfig(tell(behindLogData)));
+  client::Session other(options);
+  EXPECT_EQ(other.flushAndWait(kLong).status.code, TARNEL_ERROR_TIMED_OUT);
+  goOn.set_value();
+  EXPECT_EQ(behindFile.get_future().get(), TARNEL_OK);
+  EXPECT_EQ(behindLogData.get_future().get(), TARNEL_OK);
+  // Afterwards the time counts again.
+  EXPECT_EQ(ofFile.flushAndWait(kLong).status.code, TARNEL_ERROR_TIMED_OUT);
+  EXPECT_EQ(ofLogData.flushAndWait(kLong).status.code, TARNEL_ERROR_TIMED_OUT);
+  end.set_value();
+}
+
 TEST_F(FilesAndService, AnUploadThatIsCutOffTellsSoAndKeepsTheFile) {
   const auto path = write("x");
   std::promise<void> isUnderWay;

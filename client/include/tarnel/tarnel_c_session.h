@@ -77,7 +77,8 @@ typedef struct tarnel_options {
   uint32_t max_unanswered;
   /* For reaching the daemon; 1 to 600,000 ms, default 10,000. */
   uint32_t connect_timeout_ms;
-  /* From sending a call to its answer; 1 to 86,400,000 ms, default 120,000. */
+  /* From sending a call to its answer; 1 to 86,400,000 ms, default 120,000. Uploads, and calls that are sent
+   * while one is under way, have a day. */
   uint32_t reply_timeout_ms;
   /* How long destroying, and the end of the process, wait for what is still to be sent and answered; 0 to
    * 60,000 ms, default 200. */
@@ -210,7 +211,8 @@ TARNEL_API tarnel_status tarnel_session_upload_file(tarnel_session* session, con
 TARNEL_API tarnel_status tarnel_session_upload_file_and_wait(tarnel_session* session, const char* path,
                                                              uint32_t timeout_ms, tarnel_reply** reply);
 
-/* Uploads log records. log_data: not NULL. Reply: success, error. It may take as long as the upload. */
+/* Uploads log records. log_data: not NULL. Reply: success, error. The answer takes as long as the upload, as
+ * that of a file. */
 TARNEL_API tarnel_status tarnel_session_upload_log_data(tarnel_session* session, const tarnel_array* log_data,
                                                         tarnel_completion completion, void* context);
 TARNEL_API tarnel_status tarnel_session_upload_log_data_and_wait(tarnel_session* session,
