@@ -29,61 +29,52 @@ CallToken tokenOf(const SessionCall& call) {
   return {call.link, call.serial};
 }
 
-NamesReply namesReply(const SessionCall& call) {
-  if (!wantsReply(call)) return nullptr;
-  return [token = tokenOf(call)](std::optional<std::vector<std::string>> names) mutable {
-    const size_t bytes = kSmallAnswer + (names ? names->size() * kPerName : 0);
-    token.answer(bytes,
-                 [names = std::move(names)](sd_bus_message* m) { return wire::appendMaybeNames(m, names); });
-  };
+// How each kind of result goes into an answer, and about how many bytes it takes there beside the least.
+using MaybeNames = std::optional<std::vector<std::string>>;
+
+MaybeError append(sd_bus_message* m, bool value) {
+  if (sd_bus_message_append(m, "b", value ? 1 : 0) >= 0) return std::nullopt;
+  return Error(wire::kErrorFailed, -1, "no memory");
+}
+MaybeError append(sd_bus_message* m, const MaybeString& text) {
+  return wire::appendMaybeString(m, text);
+}
+MaybeError append(sd_bus_message* m, const MaybeNames& names) {
+  return wire::appendMaybeNames(m, names);
+}
+MaybeError append(sd_bus_message* m, const MaybeSentObject& sent) {
+  return wire::appendMaybeSentObject(m, sent);
+}
+MaybeError append(sd_bus_message* m, const MaybeError& error) {
+  return wire::appendMaybeError(m, error);
 }
 
-SentReply sentReply(const SessionCall& call) {
-  if (!wantsReply(call)) return nullptr;
-  return [token = tokenOf(call)](MaybeSentObject sent) mutable {
-    token.answer(answerBytes(sent), [sent = std::move(sent)](sd_bus_message* m) {
-      return wire::appendMaybeSentObject(m, sent);
-    });
-  };
+size_t bytesOf(bool) {
+  return 0;
+}
+size_t bytesOf(const MaybeString& text) {
+  return text ? text->size() : 0;
+}
+size_t bytesOf(const MaybeNames& names) {
+  return names ? names->size() * kPerName : 0;
+}
+size_t bytesOf(const MaybeSentObject& sent) {
+  return answerBytes(sent) - kSmallAnswer;
+}
+size_t bytesOf(const MaybeError&) {
+  return 0;
 }
 
-TextReply textReply(const SessionCall& call) {
+// What the session calls with its results, which answers the call; null when the client wants no answer.
+template <class... Results>
+OneShot<void(Results...)> replyTo(const SessionCall& call) {
   if (!wantsReply(call)) return nullptr;
-  return [token = tokenOf(call)](MaybeString text) mutable {
-    token.answer(kSmallAnswer + (text ? text->size() : 0),
-                 [text = std::move(text)](sd_bus_message* m) { return wire::appendMaybeString(m, text); });
-  };
-}
-
-FlushReply flushReply(const SessionCall& call) {
-  if (!wantsReply(call)) return nullptr;
-  return [token = tokenOf(call)](MaybeString text, MaybeError error) mutable {
-    token.answer(kSmallAnswer + (text ? text->size() : 0),
-                 [text = std::move(text), error = std::move(error)](sd_bus_message* m) {
-                   MaybeError failed = wire::appendMaybeString(m, text);
-                   return failed ? failed : wire::appendMaybeError(m, error);
-                 });
-  };
-}
-
-UploadReply uploadReply(const SessionCall& call) {
-  if (!wantsReply(call)) return nullptr;
-  return [token = tokenOf(call)](bool success, MaybeError error) mutable {
-    token.answer(kSmallAnswer, [success, error = std::move(error)](sd_bus_message* m) -> MaybeError {
-      if (sd_bus_message_append(m, "b", success ? 1 : 0) < 0) {
-        return Error(wire::kErrorFailed, -1, "no memory");
-      }
-      return wire::appendMaybeError(m, error);
-    });
-  };
-}
-
-SuccessReply successReply(const SessionCall& call) {
-  if (!wantsReply(call)) return nullptr;
-  return [token = tokenOf(call)](bool success) mutable {
-    token.answer(kSmallAnswer, [success](sd_bus_message* m) -> MaybeError {
-      if (sd_bus_message_append(m, "b", success ? 1 : 0) >= 0) return std::nullopt;
-      return Error(wire::kErrorFailed, -1, "no memory");
+  return [token = tokenOf(call)](Results... results) mutable {
+    const size_t bytes = (kSmallAnswer + ... + bytesOf(results));
+    token.answer(bytes, [... held = std::move(results)](sd_bus_message* m) {
+      MaybeError failed;
+      static_cast<void>(((failed = append(m, held)).has_value() || ...));
+      return failed;
     });
   };
 }
@@ -106,19 +97,19 @@ MaybeError setSessionInfo(const SessionCall& call) {
 }
 
 MaybeError startConfig(const SessionCall& call) {
-  call.session.startConfigWithCompletionHandler(namesReply(call));
+  call.session.startConfigWithCompletionHandler(replyTo<MaybeNames>(call));
   return std::nullopt;
 }
 
 MaybeError fetchStates(const SessionCall& call) {
   auto userInfo = wire::readMaybeDictionary(call.message);
   if (!userInfo) return userInfo.error();
-  call.session.fetchStatesWithUserInfo(*std::move(userInfo), namesReply(call));
+  call.session.fetchStatesWithUserInfo(*std::move(userInfo), replyTo<MaybeNames>(call));
   return std::nullopt;
 }
 
 MaybeError fetchDisplayURL(const SessionCall& call) {
-  call.session.fetchDisplayURL(textReply(call));
+  call.session.fetchDisplayURL(replyTo<MaybeString>(call));
   return std::nullopt;
 }
 
@@ -129,14 +120,14 @@ MaybeError sendMessage(const SessionCall& call) {
   sd_bus_message_read_basic(call.message, 'q', &type);
   auto payload = wire::readMaybeDictionary(call.message);
   if (!payload) return payload.error();
-  call.session.sendMessageWithCategory(category, type, *std::move(payload), sentReply(call));
+  call.session.sendMessageWithCategory(category, type, *std::move(payload), replyTo<MaybeSentObject>(call));
   return std::nullopt;
 }
 
 MaybeError sendMessageDictionary(const SessionCall& call) {
   auto message = wire::readDictionary(call.message);
   if (!message) return message.error();
-  call.session.sendMessageWithDictionary(*std::move(message), sentReply(call));
+  call.session.sendMessageWithDictionary(*std::move(message), replyTo<MaybeSentObject>(call));
   return std::nullopt;
 }
 
@@ -148,19 +139,19 @@ MaybeError sendMessages(const SessionCall& call) {
 }
 
 MaybeError flushMessages(const SessionCall& call) {
-  call.session.flushMessagesWithCompletion(flushReply(call));
+  call.session.flushMessagesWithCompletion(replyTo<MaybeString, MaybeError>(call));
   return std::nullopt;
 }
 
 MaybeError finishSession(const SessionCall& call) {
-  call.session.finishSessionWithReply(sentReply(call));
+  call.session.finishSessionWithReply(replyTo<MaybeSentObject>(call));
   return std::nullopt;
 }
 
 MaybeError uploadLogData(const SessionCall& call) {
   auto logData = wire::readArray(call.message);
   if (!logData) return logData.error();
-  call.session.uploadLogData(*std::move(logData), uploadReply(call));
+  call.session.uploadLogData(*std::move(logData), replyTo<bool, MaybeError>(call));
   return std::nullopt;
 }
 
@@ -179,7 +170,7 @@ MaybeError uploadFile(const SessionCall& call) {
     return Error(wire::kErrorFailed, -1, std::string("the file cannot be taken: ") + std::strerror(errno));
   }
   const auto offer = call.clientFiles->offer(std::move(file), fileURL, call.link);
-  call.session.uploadFileAtPath(fileURL, offer.token(), successReply(call));
+  call.session.uploadFileAtPath(fileURL, offer.token(), replyTo<bool>(call));
   return std::nullopt;
 }
 
@@ -195,7 +186,7 @@ MaybeError sendSingleMessage(const SessionCall& call) {
   auto payload = wire::readMaybeDictionary(call.message);
   if (!payload) return payload.error();
   call.session.sendMessageWithSessionInfo(*std::move(sessionInfo), *std::move(userInfo), category, type,
-                                          *std::move(payload), textReply(call));
+                                          *std::move(payload), replyTo<MaybeString>(call));
   return std::nullopt;
 }
 
@@ -254,11 +245,12 @@ void runSendCall(const SessionCall& call, SendCall sendCall) {
     case SendCall::Kind::batch:
       return runBatch(call, std::move(sendCall.messages));
     case SendCall::Kind::dictionary:
-      return call.session.sendMessageWithDictionary(std::move(sendCall.dictionary), sentReply(call));
+      return call.session.sendMessageWithDictionary(std::move(sendCall.dictionary),
+                                                    replyTo<MaybeSentObject>(call));
     case SendCall::Kind::message:
       auto& message = sendCall.messages.front();
       return call.session.sendMessageWithCategory(message.category, message.type, std::move(message.payload),
-                                                  sentReply(call));
+                                                  replyTo<MaybeSentObject>(call));
   }
 }
 
