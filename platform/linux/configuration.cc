@@ -38,6 +38,14 @@ const char* takeBytes(const TomlNode& node, uint64_t& target) {
   return nullptr;
 }
 
+// A file is compressed in one piece, whose length is counted in 32 bits.
+const char* takeUploadBytes(const TomlNode& node, Configuration& configuration) {
+  const int64_t* number = integerIn(node, 1024, UINT32_MAX);
+  if (number == nullptr) return "an integer from 1024 to 4294967295 (bytes)";
+  configuration.limits.maxUploadBytes = static_cast<uint64_t>(*number);
+  return nullptr;
+}
+
 const char* takeWait(const TomlNode& node, std::chrono::seconds& target) {
   const int64_t* number = integerIn(node, 1, 3600);
   if (number == nullptr) return "an integer from 1 to 3600 (seconds)";
@@ -103,8 +111,7 @@ constexpr std::array kRules{
             [](const TomlNode& node, C& c) { return takeCount(node, c.limits.connections); }},
     KeyRule{"limits", "connections_per_user",
             [](const TomlNode& node, C& c) { return takeCount(node, c.limits.connectionsPerUser); }},
-    KeyRule{"limits", "max_upload_bytes",
-            [](const TomlNode& node, C& c) { return takeBytes(node, c.limits.maxUploadBytes); }},
+    KeyRule{"limits", "max_upload_bytes", takeUploadBytes},
     KeyRule{"http", "connect_timeout_seconds",
             [](const TomlNode& node, C& c) { return takeWait(node, c.http.connectTimeout); }},
     KeyRule{"http", "no_progress_seconds",

@@ -102,6 +102,15 @@ TEST(Configuration, AnUploadFitsIntoHalfOfWhatMayBeQueued) {
                           "http.max_queued_bytes: 3000 is used; raise http.max_queued_bytes to 6002"));
 }
 
+TEST(Configuration, TheLargestUploadIsWhatCanBeCompressedInOnePiece) {
+  const TemporaryFolder folder;
+  folder.write("tarneld.toml",
+               "[limits]\nmax_upload_bytes = 4294967295\n[http]\nmax_queued_bytes = 8589934590\n");
+  const Configuration configuration = loadConfiguration(folder.path());
+  EXPECT_THAT(texts(configuration), ElementsAre());
+  EXPECT_EQ(configuration.limits.maxUploadBytes, 4294967295U);
+}
+
 TEST(Configuration, UnknownKeysAreNamedWithFileAndLine) {
   const TemporaryFolder folder;
   folder.write("tarneld.toml", "\n[limits]\nconections = 1\n[other]\nx = 1\n");
@@ -149,8 +158,10 @@ TEST(Configuration, BadValuesAreNamedWithWhatWasExpectedAndTheDefaultStays) {
        "limits.connections_per_user must be an integer from 1 to 1000000"},
       {"limits.idle_exit_seconds = -1",
        "limits.idle_exit_seconds must be an integer from 0 to 86400 (seconds; 0 switches it off)"},
-      {"limits.max_upload_bytes = 1",
-       "limits.max_upload_bytes must be an integer from 1024 to 1099511627776 (bytes)"},
+      {"limits.max_upload_bytes = 1023",
+       "limits.max_upload_bytes must be an integer from 1024 to 4294967295 (bytes)"},
+      {"limits.max_upload_bytes = 4294967296",
+       "limits.max_upload_bytes must be an integer from 1024 to 4294967295 (bytes)"},
       {"http.connect_timeout_seconds = 0",
        "http.connect_timeout_seconds must be an integer from 1 to 3600 (seconds)"},
       {"http.no_progress_seconds = 3601",
