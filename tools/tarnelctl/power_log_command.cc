@@ -48,7 +48,12 @@ std::string timeText(int64_t microseconds) {
 class LineReader {
  public:
   explicit LineReader(const std::string& path)
-      : fd_(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY)), error_(fd_ ? 0 : errno) {}
+      : fd_(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY)), error_(fd_ ? 0 : errno) {
+    struct stat status {};
+    if (!fd_ || ::fstat(fd_.get(), &status) != 0 || !S_ISDIR(status.st_mode)) return;
+    error_ = EISDIR;
+    fd_ = UniqueFd();
+  }
   explicit operator bool() const { return static_cast<bool>(fd_); }
   // Why there is none.
   int error() const { return error_; }
@@ -144,7 +149,8 @@ class FileReader {
 
   ExitStatus follow() {
     const UniqueFd watch(inotify_init1(IN_CLOEXEC));
-    const std::string directory = options_.file.substr(0, options_.file.rfind('/') + 1);
+    const size_t slash = options_.file.rfind('/');
+    const std::string directory = slash == std::string::npos ? "." : options_.file.substr(0, slash + 1);
     if (!watch ||
         inotify_add_watch(watch.get(), directory.c_str(), IN_MODIFY | IN_CREATE | IN_MOVED_TO) < 0) {
       terminal_.err << "tarnelctl: cannot watch " << directory << ": " << std::strerror(errno) << '\n';

@@ -95,6 +95,12 @@ TEST_F(PowerLogCommandTest, AnEmptyPowerLogIsSaid) {
   EXPECT_EQ(err_.str(), "tarnelctl: no power log at " + options_.file + ": nothing was recorded yet\n");
 }
 
+TEST_F(PowerLogCommandTest, AFolderIsNoPowerLog) {
+  options_.file = home_;
+  EXPECT_EQ(showPowerLog(options_, terminal_), ExitStatus::failed);
+  EXPECT_EQ(err_.str(), "tarnelctl: cannot read " + home_ + ": Is a directory\n");
+}
+
 // Takes what is printed, and ends the following once everything expected is there.
 class Until final : public std::stringbuf {
  public:
@@ -146,6 +152,20 @@ TEST_F(PowerLogCommandTest, FollowingGoesOnOverANewFile) {
   EXPECT_EQ(showPowerLog(options_, terminal), ExitStatus::ok);
   writer.join();
   EXPECT_EQ(buffer.str(), shown(1) + shown(2) + shown(3) + shown(4));
+}
+
+TEST_F(PowerLogCommandTest, FollowingTakesAPathOfTheWorkingDirectory) {
+  add(powerLogLine(record(1)));
+  const auto before = std::filesystem::current_path();
+  std::filesystem::current_path(home_);
+  options_.file = "power.ndjson";
+  options_.follow = true;
+  Until buffer(1);
+  std::ostream out(&buffer);
+  EXPECT_EQ(showPowerLog(options_, {out, err_}), ExitStatus::ok);
+  std::filesystem::current_path(before);
+  EXPECT_EQ(buffer.str(), shown(1));
+  EXPECT_EQ(err_.str(), "");
 }
 
 TEST(PowerLogFields, AreARecordWhenTheyAreComplete) {

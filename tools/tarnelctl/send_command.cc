@@ -1,5 +1,7 @@
 #include "tools/tarnelctl/send_command.h"
 
+#include <algorithm>
+#include <chrono>
 #include <optional>
 #include <ostream>
 #include <utility>
@@ -92,6 +94,11 @@ ExitStatus finish(const Dictionary& json, bool wanted, ExitStatus status, const 
   return status;
 }
 
+void reportNoStorebag(const SendOptions& options, const Terminal& terminal) {
+  terminal.err << "tarnelctl: no storebag is available for client type " << options.clientType
+               << ": see the daemon's log for the reason\n";
+}
+
 ExitStatus start(client::Session& session, const Message& message, const SendOptions& options,
                  Dictionary& json, const Terminal& terminal) {
   const MaybeClientDictionary userInfo(message.userInfo);
@@ -99,8 +106,7 @@ ExitStatus start(client::Session& session, const Message& message, const SendOpt
   const auto started = session.startConfigAndWait(options.timeout);
   if (!started.ok()) return reportFailure(started.status, terminal);
   if (!started.names) {
-    terminal.err << "tarnelctl: no storebag is available for client type " << options.clientType
-                 << ": see the daemon's log for the reason\n";
+    reportNoStorebag(options, terminal);
     return finish(json, options.json, ExitStatus::failed, terminal);
   }
   show("start", started, options.json ? &json : nullptr, terminal);
@@ -113,10 +119,16 @@ ExitStatus start(client::Session& session, const Message& message, const SendOpt
 
 }  // namespace
 
+client::Options sessionOptions(const SendOptions& options) {
+  client::Options result;
+  result.socketPath = options.socketPath;
+  // The library must not give up before this tool does.
+  result.replyTimeout = std::max<std::chrono::milliseconds>(result.replyTimeout, options.timeout);
+  return result;
+}
+
 client::Session makeSession(const SendOptions& options) {
-  client::Options sessionOptions;
-  sessionOptions.socketPath = options.socketPath;
-  return client::Session(std::move(sessionOptions));
+  return client::Session(sessionOptions(options));
 }
 
 ExitStatus startSession(client::Session& session, const SendOptions& options, Dictionary& json,
@@ -162,6 +174,7 @@ ExitStatus sendSingleMessage(const SendOptions& options, const Terminal& termina
   if (!reply.ok()) return reportFailure(reply.status, terminal);
   Dictionary json;
   show("single", reply, options.json ? &json : nullptr, terminal);
+  if (reply.text == "storebag not available") reportNoStorebag(options, terminal);
   return finish(json, options.json, reply.text == "finished" ? ExitStatus::ok : ExitStatus::failed, terminal);
 }
 

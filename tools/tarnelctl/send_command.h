@@ -36,6 +36,8 @@ ExitStatus sendMessage(const SendOptions& options, const Terminal& terminal);
 // The message with its session info in one call.
 ExitStatus sendSingleMessage(const SendOptions& options, const Terminal& terminal);
 
+// What the library is told of them.
+client::Options sessionOptions(const SendOptions& options);
 // A session of the options, and its configuring and start; what that showed goes into `json` where it is
 // wanted. Not ok: the command ends with it.
 client::Session makeSession(const SendOptions& options);

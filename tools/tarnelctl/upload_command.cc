@@ -4,6 +4,9 @@
 
 #include <algorithm>
 #include <array>
+#include <cerrno>
+#include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <iostream>
 #include <optional>
@@ -26,6 +29,17 @@ bool isThere(const std::string& path) {
 
 Error refusal(std::string text) {
   return {kLogRecordsErrorDomain, -1, std::move(text)};
+}
+
+// False, with a line that says why, when it cannot be read.
+bool open(const std::string& path, std::ifstream& file, const Terminal& terminal) {
+  errno = 0;
+  file.open(path);
+  int error = file ? 0 : errno;
+  if (std::error_code ignored; file && std::filesystem::is_directory(path, ignored)) error = EISDIR;
+  if (file && error == 0) return true;
+  terminal.err << "tarnelctl: " << path << " cannot be read: " << std::strerror(error) << '\n';
+  return false;
 }
 
 // Nothing when it is more than allowed.
@@ -52,6 +66,15 @@ Result<Array> readLines(std::string_view text) {
   return records;
 }
 
+// A null would be lost on the way.
+Result<Array> withoutNull(Array records) {
+  for (size_t i = 0; i < records.size(); ++i) {
+    if (records[i].isNull())
+      return refusal("record " + std::to_string(i + 1) + " is null, which is no record");
+  }
+  return records;
+}
+
 ExitStatus finish(client::Session& session, const SendOptions& options, const Dictionary& json,
                   ExitStatus status, const Terminal& terminal) {
   if (options.json) terminal.out << writeTextDocument(Value(json), true) << '\n';
@@ -63,16 +86,18 @@ ExitStatus finish(client::Session& session, const SendOptions& options, const Di
 
 Result<Array> readLogRecords(std::istream& input, size_t maxBytes) {
   const auto text = readAll(input, maxBytes);
+  if (input.bad()) return refusal("it cannot be read");
   if (!text) return refusal("these are more than " + std::to_string(maxBytes) + " bytes: send less at once");
   const size_t start = text->find_first_not_of(kBlanks);
   if (start == std::string::npos) return Array();
   // Several lines may each hold an array; only a whole document is taken for the list.
   if ((*text)[start] == '[') {
     const auto whole = parseDocument(*text);
-    if (whole && whole->array() != nullptr) return *whole->array();
+    if (whole && whole->array() != nullptr) return withoutNull(*whole->array());
     if (text->find_first_not_of(kBlanks, text->find('\n')) == std::string::npos) return whole.error();
   }
-  return readLines(*text);
+  auto records = readLines(*text);
+  return records ? withoutNull(*std::move(records)) : records;
 }
 
 ExitStatus uploadFile(const SendOptions& options, const std::string& path, const Terminal& terminal) {
@@ -104,13 +129,7 @@ ExitStatus uploadFile(const SendOptions& options, const std::string& path, const
 
 ExitStatus uploadLogRecords(const SendOptions& options, const std::string& path, const Terminal& terminal) {
   std::ifstream file;
-  if (path != "-") {
-    file.open(path);
-    if (!file) {
-      terminal.err << "tarnelctl: " << path << " cannot be read\n";
-      return ExitStatus::failed;
-    }
-  }
+  if (path != "-" && !open(path, file, terminal)) return ExitStatus::failed;
   const auto records = readLogRecords(path == "-" ? std::cin : file);
   if (!records) {
     terminal.err << "tarnelctl: " << (path == "-" ? "standard input" : path) << ": "

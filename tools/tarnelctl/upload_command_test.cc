@@ -28,6 +28,40 @@ TEST(LogRecordsTest, WhatIsWrongIsNamedWithItsLine) {
   EXPECT_TRUE(read("1\n\n{\"a\"\n").error().localizedDescription().starts_with("line 3: "));
   EXPECT_TRUE(read("[1\n[2]\n").error().localizedDescription().starts_with("line 1: "));
   EXPECT_FALSE(read("[1, 2"));
+  EXPECT_EQ(read("[1, null]").error().localizedDescription(), "record 2 is null, which is no record");
+  EXPECT_EQ(read("\nnull\n").error().localizedDescription(), "record 1 is null, which is no record");
+}
+
+TEST(SessionOptionsTest, TheLibraryWaitsAtLeastAsLongAsTheTool) {
+  EXPECT_EQ(sessionOptions({.timeout = std::chrono::minutes(10)}).replyTimeout, std::chrono::minutes(10));
+  EXPECT_EQ(sessionOptions({.timeout = std::chrono::seconds(1)}).replyTimeout,
+            client::Options().replyTimeout);
+  EXPECT_EQ(sessionOptions({.socketPath = "/s"}).socketPath, "/s");
+}
+
+class UnreadableFileTest : public ::testing::Test {
+ protected:
+  std::string refusal(const std::string& path) {
+    err_.str("");
+    EXPECT_EQ(uploadLogRecords({.socketPath = "/nonexistent"}, path, {out_, err_}), ExitStatus::failed);
+    return err_.str();
+  }
+  std::ostringstream out_;
+  std::ostringstream err_;
+};
+
+TEST_F(UnreadableFileTest, TheReasonIsSaid) {
+  EXPECT_EQ(refusal("/nonexistent"), "tarnelctl: /nonexistent cannot be read: No such file or directory\n");
+  EXPECT_EQ(refusal("/"), "tarnelctl: / cannot be read: Is a directory\n");
+}
+
+TEST_F(UnreadableFileTest, AReadThatFailsIsNoEndOfTheFile) {
+  class Broken final : public std::streambuf {
+    int_type underflow() override { throw std::ios_base::failure("broken"); }
+  };
+  Broken broken;
+  std::istream input(&broken);
+  EXPECT_EQ(readLogRecords(input).error().localizedDescription(), "it cannot be read");
 }
 
 TEST(LogRecordsTest, TheSizeIsBounded) {
