@@ -1,5 +1,6 @@
 #include <algorithm>
 #include <array>
+#include <cmath>
 
 #include "tools/storebag/storebag_findings.h"
 
@@ -44,7 +45,9 @@ void checkFraction(const Dictionary& dictionary, std::string_view key, const std
   const Value* number = valueOf(dictionary, key, Kind::number);
   if (number == nullptr) return;
   const double fraction = number->doubleValue();
-  if (!(fraction >= 0 && fraction <= 1)) {
+  if (std::isnan(fraction)) {
+    findings.warning(joined(path, key), "is not a number: no session comes to lie below it");
+  } else if (fraction < 0 || fraction > 1) {
     findings.warning(joined(path, key), "is a share from 0 to 1, not a percentage: " +
                                             std::string(fraction > 1 ? "everything above 1 counts as all"
                                                                      : "nothing is below 0"));
@@ -82,11 +85,11 @@ void checkDeviceList(const Dictionary& entry, std::string_view key, const std::s
 
 void checkNumberRange(const Dictionary& filter, std::string_view key, const std::string& path,
                       Findings& findings) {
-  const Value* number = valueOf(filter, key, Kind::number);
-  if (number == nullptr) return;
-  if (number->int64Value() > 65535) {
+  const auto number = checkInteger(filter, key, path, findings);
+  if (!number) return;
+  if (*number > 65535) {
     findings.warning(joined(path, key), "no event has one above 65535: the filter never acts");
-  } else if (number->int64Value() < 0) {
+  } else if (*number < 0) {
     findings.warning(joined(path, key), "below 0 counts as any; leave the key out instead");
   }
 }
@@ -162,11 +165,11 @@ void checkThresholds(const Dictionary& entry, const std::string& path, Findings&
     findings.warning(joined(path, "override_sampling"),
                      "below \"sampling_threshold\": no session is ever sampled out but live");
   }
-  const Value* threshold = entry.find("event_threshold");
-  if (threshold == nullptr) {
+  const auto threshold = checkInteger(entry, "event_threshold", path, findings);
+  if (!entry.contains("event_threshold")) {
     findings.warning(joined(path, "event_threshold"),
                      "missing: counts as 0, so that the second event of any category posts the batch");
-  } else if (threshold->isNumber() && threshold->int64Value() < 0) {
+  } else if (threshold && *threshold < 0) {
     findings.warning(joined(path, "event_threshold"), "below 0: every event posts what is batched before it");
   }
 }
@@ -186,8 +189,13 @@ void checkClientEntry(const Dictionary& entry, const std::string& path, Findings
   checkKeys(entry, kEntryRules, path, findings);
   checkNames(entry, "client", path, findings);
   checkNames(entry, "service", path, findings);
-  const Value* consent = valueOf(entry, "override_dnu", Kind::number);
-  if (consent != nullptr && consent->int64Value() != 0 && consent->int64Value() != 1) {
+  for (const char* key : {"expedite", "extras_on_internal"}) checkInteger(entry, key, path, findings);
+  const auto level = checkInteger(entry, "hierarchy", path, findings);
+  if (level && *level < 0) {
+    findings.warning(joined(path, "hierarchy"), "levels begin at 0: no other session finds one below");
+  }
+  const auto consent = checkInteger(entry, "override_dnu", path, findings);
+  if (consent && *consent != 0 && *consent != 1) {
     findings.warning(joined(path, "override_dnu"), "only 1 overrides the user's consent; this counts as 0");
   }
   const Value* countries = entry.find("locale_whitelist");

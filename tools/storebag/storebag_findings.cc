@@ -1,6 +1,7 @@
 #include "tools/storebag/storebag_findings.h"
 
 #include <algorithm>
+#include <cmath>
 #include <numeric>
 
 namespace tarnel {
@@ -141,9 +142,10 @@ void checkKeys(const Dictionary& dictionary, std::span<const KeyRule> rules, std
                                                                 std::string(nearest) + "\"?");
     } else if (!isOfKind(value, rule->kind)) {
       const bool mixedList = rule->kind == Kind::texts && value.array() != nullptr;
-      findings.error(joined(path, key), "must be " + kindName(rule->kind) + ", but is " +
-                                            (mixedList ? "a list that holds other things" : typeName(value)) +
-                                            ": the daemon takes it for absent");
+      findings.error(joined(path, key),
+                     "must be " + kindName(rule->kind) + ", but is " +
+                         (mixedList ? "a list that holds other things: the daemon leaves those out"
+                                    : typeName(value) + ": the daemon takes it for absent"));
     }
   }
 }
@@ -151,6 +153,22 @@ void checkKeys(const Dictionary& dictionary, std::span<const KeyRule> rules, std
 const Value* valueOf(const Dictionary& dictionary, std::string_view key, Kind kind) {
   const Value* value = dictionary.find(key);
   return value != nullptr && isOfKind(*value, kind) ? value : nullptr;
+}
+
+std::optional<int32_t> checkInteger(const Dictionary& dictionary, std::string_view key, std::string_view path,
+                                    Findings& findings) {
+  const Value* number = valueOf(dictionary, key, Kind::number);
+  if (number == nullptr) return std::nullopt;
+  const double written = number->doubleValue();
+  const int32_t read = number->int32Value();
+  if (written != read) {
+    const bool isFraction = std::trunc(written) == read;
+    findings.warning(joined(path, key),
+                     "counts as " + std::to_string(read) + ": " +
+                         (isFraction ? "what stands behind the point is cut off"
+                                     : "only numbers from -2147483648 to 2147483647 are read as they stand"));
+  }
+  return read;
 }
 
 void checkURL(const Dictionary& dictionary, std::string_view key, std::string_view path, Findings& findings) {

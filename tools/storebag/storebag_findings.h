@@ -1,5 +1,7 @@
 #pragma once
 
+#include <cstdint>
+#include <optional>
 #include <span>
 #include <string>
 #include <string_view>
@@ -49,6 +51,11 @@ void checkKeys(const Dictionary& dictionary, std::span<const KeyRule> rules, std
 
 // The value under the key when it is of the kind, else null.
 const Value* valueOf(const Dictionary& dictionary, std::string_view key, Kind kind);
+
+// The 32-bit integer that the daemon reads from a number, nothing without one. A finding when that is another
+// number than the one that is written.
+std::optional<int32_t> checkInteger(const Dictionary& dictionary, std::string_view key, std::string_view path,
+                                    Findings& findings);
 
 // An http or https address; anything else is a finding.
 void checkURL(const Dictionary& dictionary, std::string_view key, std::string_view path, Findings& findings);

@@ -25,9 +25,9 @@ constexpr std::array kBackendRules = {
 
 constexpr std::array kHTTPPostRules = {KeyRule{"clients", Kind::list}, KeyRule{"display_url", Kind::text},
                                        KeyRule{"active", Kind::number}};
-constexpr std::array kDashboardRules = {KeyRule{"ip", Kind::text},       KeyRule{"port", Kind::any},
-                                        KeyRule{"reliable", Kind::any},  KeyRule{"display_url", Kind::text},
-                                        KeyRule{"post_url", Kind::text}, KeyRule{"active", Kind::number}};
+constexpr std::array kDashboardRules = {KeyRule{"ip", Kind::text},         KeyRule{"port", Kind::number},
+                                        KeyRule{"reliable", Kind::number}, KeyRule{"display_url", Kind::text},
+                                        KeyRule{"post_url", Kind::text},   KeyRule{"active", Kind::number}};
 constexpr std::array kUploadRules = {KeyRule{"post_url", Kind::text}, KeyRule{"display_url", Kind::text},
                                      KeyRule{"active", Kind::number}};
 constexpr std::array kForwardingRules = {KeyRule{"active", Kind::number}};
@@ -53,6 +53,21 @@ void checkHTTPPost(const Dictionary& profile, const std::string& path, Findings&
   }
 }
 
+void checkReliable(const Dictionary& profile, const std::string& path, Findings& findings) {
+  constexpr double kLongest = 3600000;
+  const Value* reliable = valueOf(profile, "reliable", Kind::number);
+  if (reliable == nullptr) return;
+  if (!(reliable->doubleValue() >= 1)) {
+    findings.warning(joined(path, "reliable"),
+                     "any number turns reliable delivery on, also 0 and false; it is the period in "
+                     "milliseconds: leave the key out to turn it off");
+  } else if (reliable->doubleValue() > kLongest) {
+    findings.warning(joined(path, "reliable"), "counts as 3600000: an hour is the longest period");
+  } else {
+    checkInteger(profile, "reliable", path, findings);
+  }
+}
+
 void checkDashboard(const Dictionary& profile, const std::string& path, Findings& findings) {
   checkKeys(profile, kDashboardRules, path, findings);
   checkURL(profile, "display_url", path, findings);
@@ -63,20 +78,19 @@ void checkDashboard(const Dictionary& profile, const std::string& path, Findings
     in_addr address{};
     if (inet_pton(AF_INET, ip->c_str(), &address) != 1) {
       findings.error(joined(path, "ip"), "must be an IPv4 address in dotted form, but is \"" + *ip + "\"");
+    } else if (address.s_addr == INADDR_BROADCAST) {
+      findings.error(joined(path, "ip"), "the daemon makes no backend for the broadcast address");
     }
   }
-  const Value* port = profile.find("port");
-  if (port == nullptr) {
+  const Value* port = valueOf(profile, "port", Kind::number);
+  if (!profile.contains("port")) {
     findings.error(joined(path, "port"), "missing: the daemon makes no backend without the server's port");
-  } else if (port->int64Value() < 1 || port->int64Value() > 65535) {
+  } else if (port != nullptr && !(port->doubleValue() >= 1 && port->doubleValue() < 65536)) {
     findings.error(joined(path, "port"), "must be a number from 1 to 65535");
+  } else {
+    checkInteger(profile, "port", path, findings);
   }
-  const Value* reliable = profile.find("reliable");
-  if (reliable != nullptr && reliable->int64Value() <= 0) {
-    findings.warning(joined(path, "reliable"),
-                     "any value turns reliable delivery on, also 0 and false; the number is its period in "
-                     "milliseconds: leave the key out to turn it off");
-  }
+  checkReliable(profile, path, findings);
 }
 
 void checkUploadServer(const Dictionary& profile, const std::string& path, Findings& findings) {
@@ -121,10 +135,12 @@ void checkSection(const Dictionary& section, const std::string& path, Findings& 
 void checkRefreshCycle(const Dictionary& document, Findings& findings) {
   const Value* cycle = valueOf(document, "refresh_cycle", Kind::number);
   if (cycle == nullptr) return;
-  if (cycle->int64Value() > 86400) {
+  if (cycle->doubleValue() >= 86401) {
     findings.warning("refresh_cycle", "counts as 86400: a day is the longest");
-  } else if (cycle->int64Value() <= 0) {
+  } else if (!(cycle->doubleValue() >= 1)) {
     findings.warning("refresh_cycle", "every session fetches the storebag again, waiting for the server");
+  } else {
+    checkInteger(document, "refresh_cycle", "", findings);
   }
 }
 

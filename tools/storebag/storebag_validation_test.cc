@@ -2,6 +2,8 @@
 
 #include <gmock/gmock.h>
 
+#include <cmath>
+
 #include "platform/document.h"
 #include "tools/storebag/file_io.h"
 #include "tools/storebag/storebag_template.h"
@@ -87,6 +89,13 @@ TEST(StorebagValidation, RefreshCycleIsANumberOfAtMostADay) {
   EXPECT_THAT(findings(bag), ElementsAre("warning refresh_cycle: counts as 86400: a day is the longest"));
   bag.set("refresh_cycle", 0);
   EXPECT_THAT(findings(bag), ElementsAre(HasSubstr("warning refresh_cycle: every session fetches")));
+  bag.set("refresh_cycle", UINT64_MAX);
+  EXPECT_THAT(findings(bag), ElementsAre("warning refresh_cycle: counts as 86400: a day is the longest"));
+  bag.set("refresh_cycle", 0.5);
+  EXPECT_THAT(findings(bag), ElementsAre(HasSubstr("warning refresh_cycle: every session fetches")));
+  bag.set("refresh_cycle", 86400.5);
+  EXPECT_THAT(findings(bag),
+              ElementsAre(HasSubstr("counts as 86400: what stands behind the point is cut off")));
   bag.set("refresh_cycle", "3600");
   EXPECT_THAT(findings(bag), ElementsAre(HasSubstr("error refresh_cycle: must be a number, but is a text")));
 }
@@ -147,7 +156,34 @@ TEST(StorebagValidation, DashboardNeedsAddressAndPort) {
                   {{"dashboard", Dictionary{{"ip", "localhost"}, {"port", 70000}, {"reliable", false}}}}),
               ElementsAre(HasSubstr("ip: must be an IPv4 address in dotted form, but is \"localhost\""),
                           HasSubstr("port: must be a number from 1 to 65535"),
-                          HasSubstr("warning release.dashboard.reliable: any value turns")));
+                          HasSubstr("warning release.dashboard.reliable: any number turns")));
+  EXPECT_THAT(
+      findingsOfSection({{"dashboard", Dictionary{{"ip", "255.255.255.255"}, {"port", 9}}}}),
+      ElementsAre("error release.dashboard.ip: the daemon makes no backend for the broadcast address"));
+}
+
+TEST(StorebagValidation, DashboardNumbersAreThoseTheDaemonReads) {
+  const auto with = [](const Value& port, const Value& reliable) {
+    return findingsOfSection(
+        {{"dashboard", Dictionary{{"ip", "127.0.0.1"}, {"port", port}, {"reliable", reliable}}}});
+  };
+  EXPECT_THAT(with(1, 1), IsEmpty());
+  EXPECT_THAT(with(65535, 3600000), IsEmpty());
+  EXPECT_THAT(
+      with("9", "500"),
+      ElementsAre("error release.dashboard.port: must be a number, but is a text: the daemon takes it for "
+                  "absent",
+                  "error release.dashboard.reliable: must be a number, but is a text: the daemon takes it "
+                  "for absent"));
+  EXPECT_THAT(
+      with(9.5, 20.5),
+      ElementsAre("warning release.dashboard.port: counts as 9: what stands behind the point is cut off",
+                  "warning release.dashboard.reliable: counts as 20: what stands behind the point is cut "
+                  "off"));
+  EXPECT_THAT(
+      with(UINT64_MAX, 3600001),
+      ElementsAre("error release.dashboard.port: must be a number from 1 to 65535",
+                  "warning release.dashboard.reliable: counts as 3600000: an hour is the longest period"));
 }
 
 TEST(StorebagValidation, UploadServerNeedsItsAddress) {
@@ -211,6 +247,40 @@ TEST(StorebagValidation, ValuesThatAreProbablyNotMeant) {
               ElementsAre(HasSubstr("post_url: must be an http or https address")));
   EXPECT_THAT(findingsWith("post_url", "http://a.example/"), ElementsAre(HasSubstr("warning")));
   EXPECT_THAT(findingsWith("post_url", "https://a.example/x y"), ElementsAre(HasSubstr("holds no blanks")));
+}
+
+// Reads every number as the daemon does, so that the findings name what it will read.
+TEST(StorebagValidation, NumbersThatTheDaemonReadsOtherwise) {
+  const std::string range = ": only numbers from -2147483648 to 2147483647 are read as they stand";
+  for (const char* key : {"expedite", "hierarchy", "extras_on_internal", "event_threshold", "override_dnu"}) {
+    const std::string warning = "warning " + std::string(kEntry) + key + ": counts as ";
+    EXPECT_THAT(findingsWith(key, 1), IsEmpty()) << key;
+    EXPECT_THAT(findingsWith(key, (int64_t{1} << 32) + 1), ElementsAre(warning + "1" + range)) << key;
+    EXPECT_THAT(findingsWith(key, 1.5), ElementsAre(warning + "1: what stands behind the point is cut off"))
+        << key;
+    EXPECT_THAT(findingsWith(key, 0.5), ElementsAre(warning + "0: what stands behind the point is cut off"))
+        << key;
+    EXPECT_THAT(findingsWith(key, std::nan("")), ElementsAre(warning + "0" + range)) << key;
+  }
+  const std::string entry = std::string("warning ") + kEntry;
+  EXPECT_THAT(findingsWith("event_threshold", int64_t{1} << 31),
+              ElementsAre(entry + "event_threshold: counts as -2147483648" + range,
+                          HasSubstr("event_threshold: below 0")));
+  EXPECT_THAT(findingsWith("event_threshold", UINT64_MAX),
+              ElementsAre(entry + "event_threshold: counts as -1" + range, HasSubstr("below 0")));
+  EXPECT_THAT(findingsWith("hierarchy", -1), ElementsAre(HasSubstr("hierarchy: levels begin at 0")));
+  EXPECT_THAT(findingsWith("sampling_threshold", std::nan("")),
+              ElementsAre(entry + "sampling_threshold: is not a number: no session comes to lie below it"));
+  const Dictionary filter{
+      {"key", "a"}, {"action", "keep"}, {"method", (int64_t{1} << 32) + 7}, {"status", 1.5}};
+  EXPECT_THAT(findingsWith("filters", Array{filter}),
+              ElementsAre(entry + "filters[0].method: counts as 7" + range,
+                          entry + "filters[0].status: counts as 1: what stands behind the point is cut off"));
+}
+
+TEST(StorebagValidation, ListsOfMixedKindsLoseWhatIsNoText) {
+  EXPECT_THAT(findingsWith("device_blacklist", Array{"a", 1}),
+              ElementsAre(HasSubstr("but is a list that holds other things: the daemon leaves those out")));
 }
 
 TEST(StorebagValidation, FiltersAreCheckedOneByOne) {
