@@ -18,7 +18,8 @@ namespace tarnel {
 struct ArchiveLimits {
   size_t bytes = 16U << 20U;  // of the archive; of all text and data together, each as often as it occurs
   size_t depth = 32;          // nesting of arrays and dictionaries
-  size_t values = 1U << 18U;  // all values and keys together, each as often as it occurs
+  // All values and keys together, each as often as it occurs; and the objects of the table.
+  size_t values = 1U << 18U;
 };
 
 inline constexpr char kArchiveErrorDomain[] = "TarnelArchiveErrorDomain";
@@ -26,7 +27,7 @@ inline constexpr int64_t kArchiveMalformed = 1;  // the archive breaks the rules
 inline constexpr int64_t kArchiveTooLarge = 2;   // archive or value goes beyond one of the limits
 inline constexpr int64_t kArchiveNotText = 3;    // the value holds text or a key that is not UTF-8
 
-// The archive of the value. An error names what cannot be archived and why.
+// The archive of the value. An error names what cannot be archived, and what to do.
 Result<std::string> archiveObject(const Value& root, const ArchiveLimits& limits = {});
 
 // The value in the archive, of which nothing is trusted: an archive that claims, or by many references comes

@@ -69,7 +69,7 @@ class DashboardBackend final : public TarnelBackend {
                           RespCode respCode, EventID eventID);
   // Returns at once; what waits is still delivered, for at most 9.5 seconds from the next tick on.
   void cleanup() override;
-  // Posts the archived array and waits for the answer, on the calling thread.
+  // Posts the archived array and waits for the answer, or for the daemon's end, on the calling thread.
   bool uploadLogData(const Array& logData) override;
 
   // -1 once closed. On the work queue.

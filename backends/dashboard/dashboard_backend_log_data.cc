@@ -2,6 +2,7 @@
 
 #include "backends/dashboard/dashboard_backend.h"
 #include "platform/archive.h"
+#include "util/uploads.h"
 
 // The upload of a client's log records.
 
@@ -38,7 +39,7 @@ bool DashboardBackend::uploadLogData(const Array& logData) {
   request.url = *postURL;
   request.headers = {{"Content-Type", "application/octet-stream"}};
   request.body = std::make_shared<const std::string>(std::move(*archive));
-  const HttpResult result = performAndWait(dependencies().http, std::move(request));
+  const HttpResult result = dependencies().uploads.perform(dependencies().http, std::move(request));
   if (result.error || !result.data) {
     TARNEL_LOG(log, error, "DashboardBackend(uploadLogData): Error uploading log data array (%s)",
                result.error ? result.error->description().c_str() : "(null)");

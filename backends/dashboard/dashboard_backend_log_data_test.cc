@@ -110,9 +110,10 @@ TEST_F(DashboardBackendLogDataTest, RecordsThatCannotBeArchivedAreNotPosted) {
   EXPECT_FALSE(backend->uploadLogData(Array{"\xFF"}));
   expectLog(LogLevel::error,
             "DashboardBackend(uploadLogData): Failed to serialize log data array for upload");
-  expectLog(
-      LogLevel::warning,
-      "DashboardBackend(uploadLogData): dashboard: TarnelArchiveErrorDomain (3): text that is not UTF-8");
+  expectLog(LogLevel::warning,
+            "DashboardBackend(uploadLogData): dashboard: TarnelArchiveErrorDomain (3): text that is not "
+            "UTF-8; give "
+            "it as data");
   EXPECT_TRUE(world.http.requests().empty());
   EXPECT_EQ(EventNumberOf::of(*backend), 0);
 }
@@ -157,6 +158,23 @@ TEST_F(DashboardBackendLogDataTest, HoldsTheCallerUntilTheAnswerAndNobodyElse) {
   world.http.answerOldest(FakeHttpClient::status(200, "late"));
   caller.join();
   EXPECT_TRUE(returned.load());
+}
+
+TEST_F(DashboardBackendLogDataTest, EndOfTheDaemonEndsAWaitThatHangs) {
+  world.http.holdAnswers(true);
+  const auto backend = makeUploading();
+  std::thread caller([&backend, this] { EXPECT_FALSE(backend->uploadLogData(records)); });
+  while (world.http.pendingCount() == 0) std::this_thread::yield();
+  world.uploads.stop();
+  caller.join();
+  expectLog(
+      LogLevel::error,
+      "DashboardBackend(uploadLogData): Error uploading log data array (TarnelHTTPErrorDomain (-1): the "
+      "daemon ends)");
+  EXPECT_EQ(EventNumberOf::of(*backend), 0);
+  // The request goes on by itself, and its answer comes to nobody.
+  world.http.answerOldest(FakeHttpClient::status(200, "late"));
+  EXPECT_EQ(EventNumberOf::of(*backend), 0);
 }
 
 }  // namespace

@@ -24,21 +24,27 @@ class ArchiveReader {
   explicit ArchiveReader(const ArchiveLimits& limits) : limits_(limits) {}
 
   Result<Value> read(std::string_view archive) {
-    // Three levels are the whole of an archive's own nesting: its head, the table, one object's two lists.
-    auto document = parseDocument(archive, {limits_.bytes, 4, documentValues()});
+    if (!archive.starts_with(kArchiveMark)) {
+      return malformed("this is no keyed archive, which begins with the bytes D9 D9 F7; give it unpacked");
+    }
+    // An archive's own nesting is its head, the table, an object, that object's two lists.
+    const auto document = parseDocument(archive, {limits_.bytes, 4, documentValues()});
     if (!document) return documentError(document.error());
-    const auto* head = archive.starts_with(kArchiveMark) ? document->dictionary() : nullptr;
-    if (head == nullptr || findArray(*head, kArchiveObjectsKey) == nullptr) {
-      return malformed("this is no archive");
-    }
-    const auto* version = head->find(kArchiveVersionKey);
+    const auto* head = document->dictionary();
+    const auto* version = head == nullptr ? nullptr : head->find(kArchiveVersionKey);
     if (version == nullptr || !(*version == Value(kArchiveVersion))) {
-      return malformed("the version is not " + std::to_string(kArchiveVersion));
+      return malformed("the version is not " + std::to_string(kArchiveVersion) +
+                       "; take a reader that knows it");
     }
-    const Array& objects = *findArray(*head, kArchiveObjectsKey);
-    objects_.reserve(objects.size());
-    for (const auto& object : objects) {
-      if (!add(object)) return Error(kArchiveErrorDomain, code_, problem_);
+    const auto* objects = findArray(*head, kArchiveObjectsKey);
+    if (objects == nullptr) return malformed("there is no table of objects");
+    if (objects->size() > limits_.values) {
+      return tooLarge("more than " + std::to_string(limits_.values) + " objects");
+    }
+    objects_.reserve(objects->size());
+    for (const auto& object : *objects) {
+      if (add(object)) continue;
+      return code_ == kArchiveTooLarge ? tooLarge(problem_) : malformed(problem_);
     }
     const auto* root = head->find(kArchiveRootKey);
     const auto place = root == nullptr ? std::nullopt : placeIn(*root);
@@ -53,9 +59,12 @@ class ArchiveReader {
   static Error malformed(const std::string& problem) {
     return {kArchiveErrorDomain, kArchiveMalformed, problem};
   }
+  static Error tooLarge(const std::string& problem) {
+    return {kArchiveErrorDomain, kArchiveTooLarge, problem + "; archive less at once"};
+  }
   static Error documentError(const Error& error) {
-    const auto code = error.code() == kDocumentTooLarge ? kArchiveTooLarge : kArchiveMalformed;
-    return {kArchiveErrorDomain, code, error.localizedDescription()};
+    const auto& problem = error.localizedDescription();
+    return error.code() == kDocumentTooLarge ? tooLarge(problem) : malformed(problem);
   }
   bool fail(int64_t code, const std::string& problem) {
     code_ = code;

@@ -74,7 +74,7 @@ class ArchiveWriter {
 
   Result<std::string> write(const Value& root) {
     const Index place = put(root, 0);
-    if (!problem_.empty()) return Error(kArchiveErrorDomain, code_, problem_);
+    if (!problem_.empty()) return error();
     ObjectTable whole;  // only for its writing
     whole.raw(kArchiveMark);
     whole.item(cbor_encode_map_start, size_t{3});
@@ -86,8 +86,8 @@ class ArchiveWriter {
     whole.item(cbor_encode_array_start, table_.count());
     whole.raw(table_.bytes());
     if (whole.bytes().size() > limits_.bytes) {
-      return Error(kArchiveErrorDomain, kArchiveTooLarge,
-                   "more than " + std::to_string(limits_.bytes) + " bytes");
+      failBytes();
+      return error();
     }
     return std::string(whole.bytes());
   }
@@ -98,12 +98,17 @@ class ArchiveWriter {
     code_ = code;
     problem_ = std::move(problem);
   }
+  void failBytes() { fail(kArchiveTooLarge, "more than " + std::to_string(limits_.bytes) + " bytes"); }
+  Error error() const {
+    return {kArchiveErrorDomain, code_,
+            problem_ + (code_ == kArchiveTooLarge ? "; archive less at once" : "; give it as data")};
+  }
   // False as soon as something is wrong: nothing more is written then.
   bool mayGoOn() {
     if (++values_ > limits_.values) {
       fail(kArchiveTooLarge, "more than " + std::to_string(limits_.values) + " values");
     } else if (table_.bytes().size() > limits_.bytes || textBytes_ > limits_.bytes) {
-      fail(kArchiveTooLarge, "more than " + std::to_string(limits_.bytes) + " bytes");
+      failBytes();
     }
     return problem_.empty();
   }
