@@ -1,3 +1,4 @@
+#include <algorithm>
 #include <array>
 
 #include "backends/dashboard/dashboard_backend.h"
@@ -63,6 +64,10 @@ MaybeDictionary profileFrom(const Dependencies& dependencies, const std::string&
 }
 
 }  // namespace
+
+bool TarnelBackend::isBackendName(std::string_view name) {
+  return std::any_of(kRows.begin(), kRows.end(), [name](const Row& row) { return name == row.name; });
+}
 
 std::shared_ptr<TarnelBackend> TarnelBackend::newBackendWithName(const Dependencies& dependencies,
                                                                  const std::string& name,

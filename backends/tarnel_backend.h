@@ -42,6 +42,8 @@ class TarnelBackend : public std::enable_shared_from_this<TarnelBackend> {
                                                            const std::string& name, const Value& profile,
                                                            const MaybeString& productFamily,
                                                            int32_t clientType);
+  // Whether newBackendWithName knows the name, on some machine at least.
+  static bool isBackendName(std::string_view name);
   // initWithName:profile:productFamily:
   static std::shared_ptr<TarnelBackend> initWithName(const Dependencies& dependencies,
                                                      const std::string& name, const MaybeDictionary& profile,

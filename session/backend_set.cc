@@ -6,6 +6,10 @@
 namespace tarnel {
 namespace {
 
+// The factory has a line for each name that it does not know; one document must not fill the log with them at
+// every session's start.
+constexpr size_t kMaxUnknownNames = 256;
+
 // What every backend of one set is told.
 struct Identity {
   uint32_t sessionID;
@@ -80,11 +84,19 @@ std::optional<BackendSet> createBackends(const Dependencies& dependencies, const
   }
   const Identity identity = readIdentity(dependencies, *sessionInfo);
   BackendSet backends;
+  size_t unknown = 0;
   for (const auto& [name, profile] : *storebag) {
+    if (!TarnelBackend::isBackendName(name) && ++unknown > kMaxUnknownNames) continue;
     auto backend = factory(dependencies, name, profile, identity.productFamily, identity.clientType);
     if (backend == nullptr) continue;
     introduce(*backend, identity, userInfo, deviceID);
     backends.append(name, std::move(backend));
+  }
+  if (unknown > kMaxUnknownNames) {
+    TARNEL_LOG(
+        dependencies.log, error,
+        "createBackends: %zu keys of the storebag are no backends, of which only the first %zu are named",
+        unknown, kMaxUnknownNames);
   }
   return backends;
 }

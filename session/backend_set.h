@@ -47,7 +47,8 @@ class BackendSet {
 
 // createBackends
 // One backend per top-level key of the storebag that the factory makes one for, set up with what the session
-// info and the device say; their states are not decided yet. Keys that are no backend are passed over.
+// info and the device say; their states are not decided yet. Keys that are no backend are passed over,
+// the first 256 of them by the factory, which names them in the log; how many there are beyond is one line.
 //
 // deviceID: the device's unique identifier, at most 40 bytes.
 // Returns nothing, logged, without a storebag or without session info.

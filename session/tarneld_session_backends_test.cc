@@ -88,6 +88,31 @@ TEST_F(SessionBackends, AKeyThatIsNoBackendCreatesNothing) {
   EXPECT_TRUE(world.log.startingWith("createBackends: ").empty());
 }
 
+TEST_F(SessionBackends, ManyKeysThatAreNoBackendsAreNotAllNamed) {
+  Dictionary section;
+  const auto addUnknown = [&section](int from, int to) {
+    for (int i = from; i < to; ++i) section.set("unknown" + std::to_string(i), 1);
+  };
+  const auto create = [this, &section] {
+    world.log.clear();
+    return createBackends(world.dependencies, TarnelBackend::newBackendWithName, section, info(7, false),
+                          user(), "");
+  };
+  const auto named = [this] { return world.log.startingWith("TarnelBackend(newBackendWithName): ").size(); };
+  addUnknown(0, 256);
+  EXPECT_TRUE(create()->empty());
+  EXPECT_EQ(named(), 256U);
+  EXPECT_TRUE(world.log.startingWith("createBackends: ").empty());
+  addUnknown(256, 50000);
+  section.set("vesmer", Dictionary());
+  EXPECT_NE(create()->find("vesmer"), nullptr);  // those that are backends are made wherever they stand
+  EXPECT_EQ(named(), 256U);
+  EXPECT_TRUE(
+      logged(LogLevel::error,
+             "createBackends: 50000 keys of the storebag are no backends, of which only the first 256 are "
+             "named"));
+}
+
 TEST_F(SessionBackends, ProfilesOfAnyKindReachTheFactory) {
   offer({"httppost"});
   delegate->storebag = Dictionary{{"httppost", "no dictionary"}};
