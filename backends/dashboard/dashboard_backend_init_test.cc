@@ -239,6 +239,8 @@ TEST_F(DashboardBackendInitTest, WithoutAReadSourceDeliveryStaysReliableAndGives
   backend->cleanup();
   world.workQueues.runUntilIdle();
   EXPECT_EQ(world.workQueues.timers(), 0U);
+  // The end of the reading closes, that of the timer only without reliable delivery.
+  EXPECT_EQ(socket().closes, 0);
   backend.reset();
   EXPECT_TRUE(nothingIsLeft());  // the socket goes with the backend
   EXPECT_EQ(socket().closes, 1);
