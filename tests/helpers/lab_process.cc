@@ -136,6 +136,8 @@ void LabProcess::reset() {
   misbehave("clear=1");
   eventsSeen_ = readWholeFile(text("eventsFile")).size();
   postsSeen_ = readWholeFile(text("postsFile")).size();
+  uploadsSeen_ = readWholeFile(text("uploadsFile")).size();
+  logDataSeen_ = readWholeFile(text("logDataFile")).size();
 }
 
 std::string LabProcess::eventLines() const {
@@ -148,6 +150,14 @@ std::vector<Dictionary> LabProcess::events() const {
 
 std::vector<Dictionary> LabProcess::posts() const {
   return recordsIn(readWholeFile(text("postsFile")).substr(postsSeen_));
+}
+
+std::vector<Dictionary> LabProcess::uploads() const {
+  return recordsIn(readWholeFile(text("uploadsFile")).substr(uploadsSeen_));
+}
+
+std::vector<Dictionary> LabProcess::logData() const {
+  return recordsIn(readWholeFile(text("logDataFile")).substr(logDataSeen_));
 }
 
 bool LabProcess::waitUntil(const std::function<bool(const std::vector<Dictionary>&)>& holds) const {

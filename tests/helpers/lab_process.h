@@ -30,6 +30,8 @@ class LabProcess {
   std::string url() const { return text("url"); }
   std::string eventsURL() const { return text("eventsURL"); }
   std::string realtimeURL() const { return text("realtimeURL"); }
+  std::string uploadURL() const { return text("uploadURL"); }
+  std::string logDataURL() const { return text("logDataURL"); }
   std::string bundle() const { return text("bundle"); }
   std::string authorityPem() const { return readWholeFile(text("caFile")); }
   std::string storebagFolder() const { return text("storebagFolder"); }
@@ -54,6 +56,9 @@ class LabProcess {
   std::vector<Dictionary> events() const;
   // Posts with "problems" and without "event".
   std::vector<Dictionary> posts() const;
+  // Files and log data that arrived since then, a record each.
+  std::vector<Dictionary> uploads() const;
+  std::vector<Dictionary> logData() const;
   // Waits until as many events have arrived; a failure of the test when they do not. What there is then, in
   // the order in which it was posted.
   std::vector<Dictionary> waitForEvents(size_t count) const;
@@ -74,6 +79,8 @@ class LabProcess {
   Dictionary started_;
   size_t eventsSeen_ = 0;  // bytes
   size_t postsSeen_ = 0;
+  size_t uploadsSeen_ = 0;
+  size_t logDataSeen_ = 0;
 };
 
 // The event inside an arrival.

@@ -1,36 +1,86 @@
 #include "tools/lab/arrival_store.h"
 
-#include <algorithm>
-
 namespace tarnel::lab {
+namespace {
+
+// Of an arrival that holds no body: what its texts come to, roughly.
+constexpr uint64_t kDescriptionBytes = 4096;
+
+uint64_t oneIf(bool condition) {
+  return condition ? 1 : 0;
+}
+
+}  // namespace
 
 void ArrivalStore::add(Arrival arrival) {
   const std::lock_guard lock(mutex_);
-  arrival.number = ++number_;
+  arrival.number = ++postNumber_;
   ++counts_.posts;
   counts_.events += arrival.events.size();
-  counts_.postsWithProblems += arrival.problems.empty() ? 0U : 1U;
+  counts_.postsWithProblems += oneIf(!arrival.problems.empty());
   counts_.wireBytes += arrival.wireBytes;
   counts_.plainBytes += arrival.plainBytes;
   for (ArrivalObserver* observer : observers_) observer->arrived(arrival);
-  keptBytes_ += arrival.plainBytes;
-  kept_.push_back(std::move(arrival));
-  while (!kept_.empty() && (kept_.size() > keep_ || keptBytes_ > maxKeptBytes_)) {
-    keptBytes_ -= kept_.front().plainBytes;
-    kept_.pop_front();
-  }
+  const uint64_t bytes = arrival.plainBytes;
+  posts_.add(std::move(arrival), bytes);
+}
+
+void ArrivalStore::addUpload(UploadArrival arrival) {
+  const std::lock_guard lock(mutex_);
+  arrival.number = ++uploadNumber_;
+  ++counts_.uploads;
+  counts_.uploadsWithProblems += oneIf(!arrival.problems.empty());
+  counts_.uploadBytes += arrival.plainBytes;
+  for (ArrivalObserver* observer : observers_) observer->uploadArrived(arrival);
+  uploads_.add(std::move(arrival), kDescriptionBytes);
+}
+
+void ArrivalStore::addLogData(LogDataArrival arrival) {
+  const std::lock_guard lock(mutex_);
+  arrival.number = ++logDataNumber_;
+  ++counts_.logArchives;
+  counts_.logArchivesWithProblems += oneIf(!arrival.problems.empty());
+  counts_.logRecords += arrival.records.size();
+  for (ArrivalObserver* observer : observers_) observer->logDataArrived(arrival);
+  const uint64_t bytes = arrival.plainBytes + kDescriptionBytes;
+  logData_.add(std::move(arrival), bytes);
+}
+
+void ArrivalStore::addDatagram(DatagramArrival arrival) {
+  const std::lock_guard lock(mutex_);
+  arrival.number = ++datagramNumber_;
+  ++counts_.datagrams;
+  counts_.datagramsWithProblems += oneIf(!arrival.problems.empty());
+  for (ArrivalObserver* observer : observers_) observer->datagramArrived(arrival);
+  datagrams_.add(std::move(arrival), kDescriptionBytes);
 }
 
 std::vector<Arrival> ArrivalStore::last(size_t count) const {
   const std::lock_guard lock(mutex_);
-  const auto begin = kept_.end() - static_cast<ptrdiff_t>(std::min(count, kept_.size()));
-  return {begin, kept_.end()};
+  return posts_.last(count);
+}
+
+std::vector<UploadArrival> ArrivalStore::lastUploads(size_t count) const {
+  const std::lock_guard lock(mutex_);
+  return uploads_.last(count);
+}
+
+std::vector<LogDataArrival> ArrivalStore::lastLogData(size_t count) const {
+  const std::lock_guard lock(mutex_);
+  return logData_.last(count);
+}
+
+std::vector<DatagramArrival> ArrivalStore::lastDatagrams(size_t count) const {
+  const std::lock_guard lock(mutex_);
+  return datagrams_.last(count);
 }
 
 void ArrivalStore::clear() {
   const std::lock_guard lock(mutex_);
-  kept_.clear();
-  keptBytes_ = 0;
+  posts_.clear();
+  uploads_.clear();
+  logData_.clear();
+  datagrams_.clear();
   counts_ = {};
 }
 

@@ -13,40 +13,96 @@ struct ArrivalCounts {
   uint64_t posts = 0;
   uint64_t events = 0;
   uint64_t postsWithProblems = 0;
-  uint64_t wireBytes = 0;
-  uint64_t plainBytes = 0;
+  uint64_t wireBytes = 0;   // of posts
+  uint64_t plainBytes = 0;  // of posts
+  uint64_t uploads = 0;
+  uint64_t uploadsWithProblems = 0;
+  uint64_t uploadBytes = 0;  // unpacked
+  uint64_t logArchives = 0;
+  uint64_t logArchivesWithProblems = 0;
+  uint64_t logRecords = 0;
+  uint64_t datagrams = 0;
+  uint64_t datagramsWithProblems = 0;
 };
 
-// Keeps the last arrivals and tells the observers. Threads: any.
+// The newest of one kind: at most so many, and so many bytes of them. Threads: one at a time.
+template <class Item>
+class NewestArrivals {
+ public:
+  NewestArrivals(size_t keep, uint64_t maxBytes) : keep_(keep), maxBytes_(maxBytes) {}
+
+  void add(Item item, uint64_t bytes) {
+    bytes_ += bytes;
+    kept_.emplace_back(std::move(item), bytes);
+    while (!kept_.empty() && (kept_.size() > keep_ || bytes_ > maxBytes_)) {
+      bytes_ -= kept_.front().second;
+      kept_.pop_front();
+    }
+  }
+  // Oldest of them first.
+  std::vector<Item> last(size_t count) const {
+    std::vector<Item> items;
+    const size_t skipped = kept_.size() - std::min(count, kept_.size());
+    for (size_t i = skipped; i < kept_.size(); ++i) items.push_back(kept_[i].first);
+    return items;
+  }
+  void clear() {
+    kept_.clear();
+    bytes_ = 0;
+  }
+
+ private:
+  const size_t keep_;
+  const uint64_t maxBytes_;
+  std::deque<std::pair<Item, uint64_t>> kept_;
+  uint64_t bytes_ = 0;
+};
+
+// Keeps the last arrivals of each kind and tells the observers. Threads: any.
 class ArrivalStore {
  public:
-  // What is kept goes down to the newest `keep` arrivals and to this many bytes of their plain bodies.
+  // What is kept of each kind goes down to the newest `keep` arrivals and to this many bytes of their plain
+  // bodies.
   static constexpr uint64_t kMaxKeptBytes = 64U << 20U;
 
   explicit ArrivalStore(size_t keep, uint64_t maxKeptBytes = kMaxKeptBytes)
-      : keep_(keep), maxKeptBytes_(maxKeptBytes) {}
+      : posts_(keep, maxKeptBytes),
+        uploads_(keep, maxKeptBytes),
+        logData_(keep, maxKeptBytes),
+        datagrams_(keep, maxKeptBytes) {}
   ArrivalStore(const ArrivalStore&) = delete;
   ArrivalStore& operator=(const ArrivalStore&) = delete;
 
   // The observer outlives the store. Before the first arrival.
   void addObserver(ArrivalObserver& observer) { observers_.push_back(&observer); }
 
-  // Numbers the arrival, keeps it and tells every observer.
+  // Each numbers the arrival, keeps it and tells every observer.
   void add(Arrival arrival);
+  void addUpload(UploadArrival arrival);
+  void addLogData(LogDataArrival arrival);
+  void addDatagram(DatagramArrival arrival);
+
   // The newest, oldest of them first.
   std::vector<Arrival> last(size_t count) const;
+  std::vector<UploadArrival> lastUploads(size_t count) const;
+  std::vector<LogDataArrival> lastLogData(size_t count) const;
+  std::vector<DatagramArrival> lastDatagrams(size_t count) const;
+
   // Forgets arrivals and counts; numbers go on.
   void clear();
   ArrivalCounts counts() const;
 
  private:
-  const size_t keep_;
-  const uint64_t maxKeptBytes_;
   std::vector<ArrivalObserver*> observers_;
   mutable std::mutex mutex_;
-  std::deque<Arrival> kept_;
-  uint64_t keptBytes_ = 0;
-  uint64_t number_ = 0;
+  NewestArrivals<Arrival> posts_;
+  NewestArrivals<UploadArrival> uploads_;
+  NewestArrivals<LogDataArrival> logData_;
+  NewestArrivals<DatagramArrival> datagrams_;
+  uint64_t postNumber_ = 0;
+  uint64_t uploadNumber_ = 0;
+  uint64_t logDataNumber_ = 0;
+  uint64_t datagramNumber_ = 0;
   ArrivalCounts counts_;
 };
 

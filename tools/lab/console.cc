@@ -1,47 +1,10 @@
 #include "tools/lab/console.h"
 
 #include "platform/document.h"
+#include "tools/lab/summary.h"
 #include "tools/lab/text.h"
 
 namespace tarnel::lab {
-namespace {
-
-constexpr size_t kMaxMethodsShown = 8;
-
-std::string headerOr(const Arrival& arrival, const char* name, const char* otherwise) {
-  const std::string* value = findHeader(arrival.headers, name);
-  return value == nullptr || value->empty() ? otherwise : printable(*value, 40);
-}
-
-std::string methodsText(const Array& events) {
-  const Dictionary counts = methodCounts(events);
-  std::string text;
-  size_t shown = 0;
-  for (const auto& [method, count] : counts) {
-    if (++shown > kMaxMethodsShown) return text + ", ...";
-    text += (text.empty() ? "" : ", ") + method;
-    if (count.int64Value() != 1) text += " x" + std::to_string(count.int64Value());
-  }
-  return text;
-}
-
-}  // namespace
-
-std::string summaryOf(const Arrival& arrival) {
-  std::string text = headerOr(arrival, "X-TRN-Sender", "unknown sender");
-  const std::string client = headerOr(arrival, "X-TRN-Client-Name", "");
-  const std::string service = headerOr(arrival, "X-TRN-Service-Name", "");
-  if (!client.empty() || !service.empty()) {
-    text += "  " + client + (client.empty() || service.empty() ? "" : " / ") + service;
-  }
-  text += "  " + grouped(arrival.events.size()) + (arrival.events.size() == 1 ? " event" : " events");
-  if (const std::string methods = methodsText(arrival.events); !methods.empty())
-    text += " (method " + methods + ")";
-  text += "  " + byteCount(arrival.wireBytes);
-  if (arrival.gzip) text += arrival.plainBytes == 0 ? " gzip" : " gzip of " + byteCount(arrival.plainBytes);
-  return text;
-}
-
 Console::Console(std::FILE* output, std::FILE* errors, ConsoleStyle style, bool colour, Clock& clock)
     : output_(output), errors_(errors), style_(style), colour_(colour), clock_(clock) {}
 
@@ -66,18 +29,52 @@ void Console::printRecord(const char* kind, Dictionary record) {
 void Console::arrived(const Arrival& arrival) {
   if (style_ == ConsoleStyle::quiet) return;
   if (style_ == ConsoleStyle::json) return printRecord("post", recordOfPost(arrival, true));
-  const bool good = arrival.problems.empty();
-  std::string text = tinted(Tint::dim, clockTime(arrival.arrived)) + "  POST " + arrival.path + "  " +
-                     summaryOf(arrival) + "  ";
-  text += good ? tinted(Tint::good, "ok")
-               : tinted(Tint::bad, std::to_string(arrival.problems.size()) +
-                                       (arrival.problems.size() == 1 ? " problem" : " problems"));
-  if (arrival.answered != "200") text += "  " + tinted(Tint::bad, "answered: " + arrival.answered);
-  text += "\n";
-  for (const std::string& problem : arrival.problems) {
+  printPost(arrival, summaryOf(arrival));
+}
+
+void Console::uploadArrived(const UploadArrival& arrival) {
+  if (style_ == ConsoleStyle::quiet) return;
+  if (style_ == ConsoleStyle::json) return printRecord("upload", recordOfUpload(arrival));
+  printPost(arrival, summaryOf(arrival));
+}
+
+void Console::logDataArrived(const LogDataArrival& arrival) {
+  if (style_ == ConsoleStyle::quiet) return;
+  if (style_ == ConsoleStyle::json) return printRecord("logData", recordOfLogData(arrival, true));
+  printPost(arrival, summaryOf(arrival));
+}
+
+void Console::datagramArrived(const DatagramArrival& arrival) {
+  if (style_ == ConsoleStyle::quiet) return;
+  if (style_ == ConsoleStyle::json) return printRecord("datagram", recordOfDatagram(arrival));
+  std::string text = tinted(Tint::dim, clockTime(arrival.arrived)) + "  UDP  " + arrival.sender + "  " +
+                     summaryOf(arrival) + "  " + verdict(arrival.problems);
+  if (arrival.answered != kNothingAnswered) {
+    const bool good = arrival.answered == kAcknowledged;
+    text += "  " + tinted(good ? Tint::plain : Tint::bad, arrival.answered);
+  }
+  print(output_, text + "\n" + problemLines(arrival.problems));
+}
+
+std::string Console::verdict(const std::vector<std::string>& problems) const {
+  if (problems.empty()) return tinted(Tint::good, "ok");
+  return tinted(Tint::bad,
+                std::to_string(problems.size()) + (problems.size() == 1 ? " problem" : " problems"));
+}
+
+std::string Console::problemLines(const std::vector<std::string>& problems) const {
+  std::string text;
+  for (const std::string& problem : problems) {
     text += "              " + tinted(Tint::bad, "! ") + printable(problem, 300) + "\n";
   }
-  print(output_, text);
+  return text;
+}
+
+void Console::printPost(const HttpArrival& arrival, const std::string& summary) {
+  std::string text = tinted(Tint::dim, clockTime(arrival.arrived)) + "  POST " + arrival.path + "  " +
+                     summary + "  " + verdict(arrival.problems);
+  if (arrival.answered != "200") text += "  " + tinted(Tint::bad, "answered: " + arrival.answered);
+  print(output_, text + "\n" + problemLines(arrival.problems));
 }
 
 void Console::storebagServed(const ServedStorebag& served) {

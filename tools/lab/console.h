@@ -20,6 +20,9 @@ class Console final : public ArrivalObserver, public Notices {
   Console(std::FILE* output, std::FILE* errors, ConsoleStyle style, bool colour, Clock& clock);
 
   void arrived(const Arrival& arrival) override;
+  void uploadArrived(const UploadArrival& arrival) override;
+  void logDataArrived(const LogDataArrival& arrival) override;
+  void datagramArrived(const DatagramArrival& arrival) override;
   void storebagServed(const ServedStorebag& served) override;
   void warning(const std::string& text) override;
 
@@ -31,6 +34,9 @@ class Console final : public ArrivalObserver, public Notices {
   enum class Tint { plain, dim, good, bad };
 
   std::string tinted(Tint tint, const std::string& text) const;
+  std::string verdict(const std::vector<std::string>& problems) const;
+  std::string problemLines(const std::vector<std::string>& problems) const;
+  void printPost(const HttpArrival& arrival, const std::string& summary);
   void print(std::FILE* stream, const std::string& text);
   void printRecord(const char* kind, Dictionary record);
 
@@ -41,8 +47,5 @@ class Console final : public ArrivalObserver, public Notices {
   Clock& clock_;
   std::mutex mutex_;
 };
-
-// "OW  Meetwell / video-call  51 events (2 x32, 1 x19)  3.4 kB gzip of 31.2 kB", without time and colour.
-std::string summaryOf(const Arrival& arrival);
 
 }  // namespace tarnel::lab

@@ -6,6 +6,7 @@
 
 #include "platform/document.h"
 #include "platform/fake/fake_clock.h"
+#include "tools/lab/summary.h"
 #include "tools/lab/test_post.h"
 
 namespace tarnel::lab {

@@ -1,14 +1,22 @@
 #include "tools/lab/control.h"
 
+#include <algorithm>
+#include <array>
+
 #include "platform/document.h"
 #include "tools/lab/listener.h"
 #include "tools/lab/service.h"
+#include "tools/lab/stored_files.h"
 #include "tools/lab/text.h"
 
 namespace tarnel::lab {
 namespace {
 
 constexpr uint64_t kDefaultLast = 20;
+constexpr std::array<std::string_view, 4> kLists = {"/arrivals", "/uploads", "/log-data", "/datagrams"};
+constexpr std::string_view kLogData = "/log-data/";
+// Records of a whole archive with everything escaped.
+constexpr size_t kMaxRecordsBytes = 256U << 20U;
 
 HttpAnswer jsonAnswer(const Dictionary& value, int status = 200) {
   HttpAnswer answer;
@@ -57,14 +65,14 @@ HttpAnswer Control::answer(const HttpRequest& request) {
     return jsonAnswer({{"cleared", true}});
   }
   if (!post && request.path == "/status") return jsonAnswer(parts_.status());
-  if (!post && request.path == "/arrivals") return arrivals(request);
-  return errorAnswer(
-      404,
-      "there is GET /status, GET /arrivals?last=N, GET or POST /misbehave?..., POST /clear and "
-      "POST /stop");
+  if (!post && std::find(kLists.begin(), kLists.end(), request.path) != kLists.end()) return list(request);
+  if (!post && request.path.starts_with(kLogData)) return logRecords(request.path.substr(kLogData.size()));
+  return errorAnswer(404,
+                     "there is GET /status, GET /arrivals, /uploads, /log-data and /datagrams with ?last=N, "
+                     "GET /log-data/NAME, GET or POST /misbehave?..., POST /clear and POST /stop");
 }
 
-HttpAnswer Control::arrivals(const HttpRequest& request) const {
+HttpAnswer Control::list(const HttpRequest& request) const {
   uint64_t last = kDefaultLast;
   if (const std::string* text = findParameter(request.query, "last")) {
     const std::optional<uint64_t> number = parseNumber(*text);
@@ -72,8 +80,33 @@ HttpAnswer Control::arrivals(const HttpRequest& request) const {
     last = *number;
   }
   Array list;
+  if (request.path == "/uploads") {
+    for (const UploadArrival& arrival : parts_.store.lastUploads(last)) list.append(recordOfUpload(arrival));
+    return jsonAnswer({{"uploads", list}});
+  }
+  if (request.path == "/log-data") {
+    for (const LogDataArrival& arrival : parts_.store.lastLogData(last)) {
+      list.append(recordOfLogData(arrival, true));
+    }
+    return jsonAnswer({{"logData", list}});
+  }
+  if (request.path == "/datagrams") {
+    for (const DatagramArrival& arrival : parts_.store.lastDatagrams(last)) {
+      list.append(recordOfDatagram(arrival));
+    }
+    return jsonAnswer({{"datagrams", list}});
+  }
   for (const Arrival& arrival : parts_.store.last(last)) list.append(recordOfPost(arrival, true));
   return jsonAnswer({{"arrivals", list}});
+}
+
+HttpAnswer Control::logRecords(const std::string& name) const {
+  if (!isStoredName(name)) return errorAnswer(404, "no such log data");
+  Result<std::string> text = readFile(descriptionOf(parts_.logDataFolder + "/" + name), kMaxRecordsBytes);
+  if (!text) return errorAnswer(404, text.error().localizedDescription());
+  HttpAnswer answer;
+  answer.body = *std::move(text);
+  return answer;
 }
 
 HttpAnswer Control::misbehave(const HttpRequest& request) {

@@ -15,17 +15,22 @@ class Control final : public HttpHandler {
   struct Parts {
     ArrivalStore& store;
     Misbehaviours& misbehaviours;
+    std::string logDataFolder;
     std::function<Dictionary()> status;
     std::function<void()> stop;
   };
 
   explicit Control(Parts parts) : parts_(std::move(parts)) {}
 
+  size_t maxBodyBytes(const HttpRequest&) const override { return kMaxBodyBytes; }
   HttpAnswer answer(const HttpRequest& request) override;
   void connectionFailed(const std::string&, const std::string&) override {}
 
  private:
-  HttpAnswer arrivals(const HttpRequest& request) const;
+  static constexpr size_t kMaxBodyBytes = 64U << 10U;
+
+  HttpAnswer list(const HttpRequest& request) const;
+  HttpAnswer logRecords(const std::string& name) const;
   HttpAnswer misbehave(const HttpRequest& request);
 
   const Parts parts_;

@@ -28,6 +28,7 @@ class ControlTest : public ::testing::Test {
   int stops_ = 0;
   Control control_{{.store = store_,
                     .misbehaviours = misbehaviours_,
+                    .logDataFolder = ::testing::TempDir(),
                     .status =
                         [] {
                           return Dictionary{{"url", "here"}};
@@ -91,7 +92,7 @@ TEST_F(ControlTest, PagesOfOtherSitesAreRefused) {
 TEST_F(ControlTest, UnknownPathsNameWhatThereIs) {
   const HttpAnswer answer = ask("GET", "/");
   EXPECT_EQ(answer.status, 404);
-  EXPECT_THAT(answer.body, HasSubstr("GET /arrivals?last=N"));
+  EXPECT_THAT(answer.body, HasSubstr("GET /arrivals, /uploads, /log-data and /datagrams with ?last=N"));
 }
 
 }  // namespace

@@ -24,9 +24,10 @@ struct HttpRequest {
   std::string method;  // GET, HEAD or POST
   std::string path;    // decoded, without the query
   NameValues query;
-  NameValues headers;  // in alphabetical order, as they came
-  std::string sender;  // "127.0.0.1:50312"
-  std::string body;    // as it came, not unpacked
+  std::string rawQuery;  // as it came, without the question mark
+  NameValues headers;    // in alphabetical order, as they came
+  std::string sender;    // "127.0.0.1:50312"
+  std::string body;      // as it came, not unpacked
   BodyState bodyState = BodyState::complete;
 };
 
@@ -51,6 +52,8 @@ class HttpHandler {
   HttpHandler& operator=(const HttpHandler&) = delete;
   virtual ~HttpHandler() = default;
 
+  // The largest body that a POST may have; its body is not there yet.
+  virtual size_t maxBodyBytes(const HttpRequest& request) const = 0;
   // Called on many threads at once.
   virtual HttpAnswer answer(const HttpRequest& request) = 0;
   // A connection that never came to a request; text says why, with the remedy where one is known.

@@ -82,6 +82,8 @@ HttpRequest requestFrom(const httplib::Request& from, const Connection& connecti
   request.method = from.method;
   request.path = from.path;
   for (const auto& [name, value] : from.params) request.query.emplace_back(name, value);
+  const size_t mark = from.target.find('?');
+  if (mark != std::string::npos) request.rawQuery = from.target.substr(mark + 1);
   const bool lengthAdded = from.has_header(kAddedLength);
   for (const auto& [name, value] : from.headers) {
     if (lengthAdded && (name == kAddedLength || name == "Content-Length")) continue;
@@ -170,12 +172,14 @@ class Protocol final : private httplib::Server {
                       const httplib::ContentReader& reader) {
     HttpRequest request = requestFrom(from, *current_);
     HeldBytes held(heldBytes_, options_.maxHeldBytes);
-    bool tooLarge = false;
-    const bool complete = reader([this, &request, &held, &tooLarge](const char* bytes, size_t size) {
-      tooLarge = request.body.size() + size > options_.maxBodyBytes || !held.add(size);
-      if (!tooLarge) request.body.append(bytes, size);
-      return !tooLarge;
-    });
+    const size_t limit = std::min(options_.maxBodyBytes, handler_.maxBodyBytes(request));
+    bool tooLarge = from.get_header_value<uint64_t>("Content-Length") > limit;
+    const bool complete =
+        !tooLarge && reader([&request, &held, &tooLarge, limit](const char* bytes, size_t size) {
+          tooLarge = request.body.size() + size > limit || !held.add(size);
+          if (!tooLarge) request.body.append(bytes, size);
+          return !tooLarge;
+        });
     if (!complete) {
       // The library has set 413 when the announced length alone is too much.
       request.bodyState = tooLarge || to.status == 413 ? BodyState::tooLarge : BodyState::cutOff;

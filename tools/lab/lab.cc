@@ -11,9 +11,12 @@
 #include "tools/lab/http_server.h"
 #include "tools/lab/lab_directory.h"
 #include "tools/lab/listener.h"
+#include "tools/lab/log_data_receiver.h"
 #include "tools/lab/ndjson_writer.h"
 #include "tools/lab/service.h"
+#include "tools/lab/stored_files.h"
 #include "tools/lab/text.h"
+#include "tools/lab/upload_receiver.h"
 
 namespace tarnel::lab {
 namespace {
@@ -41,6 +44,9 @@ class RunningLab final : public Lab {
         store_(options.keep),
         writer_(directory_.paths.arrivals, console),
         posts_(store_, misbehaviours_, clock),
+        uploadedFiles_(directory_.paths.uploads, console, {}),
+        logDataFiles_(directory_.paths.logData, console, {}),
+        uploads_(uploadedFiles_, options.maxUploadMiB << 20U, store_, misbehaviours_, clock),
         started_(clock.timeOfDay().seconds) {}
   ~RunningLab() override { stop(); }
 
@@ -70,9 +76,13 @@ class RunningLab final : public Lab {
   NdjsonWriter writer_;
   Misbehaviours misbehaviours_;
   PostReceiver posts_;
+  StoredFiles uploadedFiles_;
+  StoredFiles logDataFiles_;
+  UploadReceiver uploads_;
   const int64_t started_;
   uint16_t port_ = 0;
   uint16_t controlPort_ = 0;
+  std::unique_ptr<LogDataReceiver> logData_;
   std::unique_ptr<StorebagSource> storebags_;
   std::unique_ptr<Service> service_;
   std::unique_ptr<Control> control_;
@@ -82,7 +92,11 @@ class RunningLab final : public Lab {
 
 MaybeError RunningLab::begin() {
   if (MaybeError error = writer_.open()) return error;
+  if (MaybeError error = uploadedFiles_.open()) return error;
+  if (MaybeError error = logDataFiles_.open()) return error;
   HttpServerOptions forService;
+  forService.maxBodyBytes = std::max<size_t>(forService.maxBodyBytes, uploads_.maxFileBytes());
+  forService.maxHeldBytes = std::max(forService.maxHeldBytes, 2 * forService.maxBodyBytes);
   Result<std::shared_ptr<ssl_ctx_st>> tls =
       makeServerTlsContext(directory_.paths.certificates.server, directory_.paths.certificates.serverKey);
   if (!tls) return tls.error();
@@ -110,14 +124,19 @@ void RunningLab::makeHandlers() {
   store_.addObserver(console_);
   storebags_ =
       std::make_unique<StorebagSource>(directory_.paths.storebags, directory_.key, baseURL(), started_);
+  logData_ = std::make_unique<LogDataReceiver>(logDataFiles_, controlURL() + "/log-data", store_,
+                                               misbehaviours_, clock_);
   service_ = std::make_unique<Service>(Service::Parts{.storebags = *storebags_,
                                                       .posts = posts_,
+                                                      .uploads = uploads_,
+                                                      .logData = *logData_,
                                                       .misbehaviours = misbehaviours_,
                                                       .notices = console_,
                                                       .clock = clock_},
                                        options_.storebagMaxAge);
   control_ = std::make_unique<Control>(Control::Parts{.store = store_,
                                                       .misbehaviours = misbehaviours_,
+                                                      .logDataFolder = directory_.paths.logData,
                                                       .status = [this] { return status(); },
                                                       .stop = [this] { requestStop(); }});
 }
@@ -136,6 +155,8 @@ Dictionary RunningLab::status() const {
           {"storebagURL", baseURL() + "/storebags"},
           {"eventsURL", baseURL() + "/v1/events"},
           {"realtimeURL", baseURL() + "/v1/realtime"},
+          {"uploadURL", baseURL() + "/v1/uploads"},
+          {"logDataURL", baseURL() + "/v1/log-data"},
           {"controlURL", controlURL()},
           {"directory", directory_.paths.directory},
           {"caFile", directory_.paths.certificates.authority},
@@ -143,6 +164,10 @@ Dictionary RunningLab::status() const {
           {"storebagFolder", directory_.paths.storebags},
           {"eventsFile", directory_.paths.arrivals + "/events.ndjson"},
           {"postsFile", directory_.paths.arrivals + "/posts.ndjson"},
+          {"uploadFolder", directory_.paths.uploads},
+          {"uploadsFile", directory_.paths.arrivals + "/uploads.ndjson"},
+          {"logDataFolder", directory_.paths.logData},
+          {"logDataFile", directory_.paths.arrivals + "/log-data.ndjson"},
           {"process", static_cast<int64_t>(::getpid())},
           {"started", started_},
           {"storebags", names},
@@ -152,6 +177,12 @@ Dictionary RunningLab::status() const {
           {"postsWithProblems", counts.postsWithProblems},
           {"wireBytes", counts.wireBytes},
           {"plainBytes", counts.plainBytes},
+          {"uploads", counts.uploads},
+          {"uploadsWithProblems", counts.uploadsWithProblems},
+          {"uploadBytes", counts.uploadBytes},
+          {"logArchives", counts.logArchives},
+          {"logArchivesWithProblems", counts.logArchivesWithProblems},
+          {"logRecords", counts.logRecords},
           {"misbehaviours", misbehaviours_.description()}};
 }
 
@@ -166,6 +197,7 @@ void RunningLab::tellStart() const {
   text += "  storebags   tarnelctl settings set com.orvane.tarnel tarnel_storebag_url " + baseURL() +
           "/storebags\n";
   text += "  arrivals    " + directory_.paths.arrivals + "/events.ndjson\n";
+  text += "  uploads     " + directory_.paths.uploads + ", log data in " + directory_.paths.logData + "\n";
   text += "  serves      ";
   if (names.empty()) {
     text += "no storebag yet: put inner documents into " + directory_.paths.storebags + "/NAME.json";

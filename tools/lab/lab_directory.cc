@@ -50,7 +50,10 @@ Result<StorebagKey> ensureKey(const LabPaths& paths, std::vector<std::string>& m
 MaybeError makeFolders(const LabPaths& paths) {
   if (MaybeError error = makeDirectory(paths.directory, kPublic)) return error;
   if (MaybeError error = makeDirectory(paths.storebags, kPublic)) return error;
-  return makeDirectory(paths.arrivals, kPrivate);
+  for (const std::string& folder : {paths.arrivals, paths.uploads, paths.logData}) {
+    if (MaybeError error = makeDirectory(folder, kPrivate)) return error;
+  }
+  return std::nullopt;
 }
 
 }  // namespace
@@ -64,7 +67,9 @@ LabPaths::LabPaths(const std::string& given)
       storebagKey(directory + "/storebag-key.pem"),
       bundle(directory + "/bundle"),
       storebags(directory + "/storebags"),
-      arrivals(directory + "/arrivals") {}
+      arrivals(directory + "/arrivals"),
+      uploads(directory + "/uploads"),
+      logData(directory + "/log-data") {}
 
 Result<LabDirectory> openLabDirectory(const std::string& directory, const std::vector<std::string>& names,
                                       const std::string& bundleVersion, std::time_t now) {

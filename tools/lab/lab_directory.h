@@ -21,6 +21,8 @@ struct LabPaths {
   std::string bundle;
   std::string storebags;
   std::string arrivals;
+  std::string uploads;
+  std::string logData;
 };
 
 // The folder, ready for use and taken by this process until the object goes.

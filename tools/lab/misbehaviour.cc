@@ -24,12 +24,15 @@ bool isFieldName(const std::string& name) {
 }
 
 MaybeError setTarget(Misbehaviour& misbehaviour, const std::string& value) {
-  if (value != "storebags" && value != "events" && value != "all") {
-    return parameterError("for", value, "storebags, events or all");
-  }
-  misbehaviour.forStorebags = value != "events";
-  misbehaviour.forPosts = value != "storebags";
-  return std::nullopt;
+  const bool all = value == "all";
+  misbehaviour.forStorebags = all || value == "storebags";
+  misbehaviour.forPosts = all || value == "events";
+  misbehaviour.forUploads = all || value == "uploads";
+  misbehaviour.forLogData = all || value == "log-data";
+  const bool known = misbehaviour.forStorebags || misbehaviour.forPosts || misbehaviour.forUploads ||
+                     misbehaviour.forLogData;
+  if (known) return std::nullopt;
+  return parameterError("for", value, "storebags, events, uploads, log-data, datagrams or all");
 }
 
 MaybeError setSwitch(const std::string& name, const std::string& value, bool& target) {
@@ -82,6 +85,7 @@ MaybeError setParameter(Misbehaviour& misbehaviour, const std::string& name, con
   }
   if (name == "empty") return setSwitch(name, value, misbehaviour.empty);
   if (name == "break-signature") return setSwitch(name, value, misbehaviour.breakSignature);
+  if (name == "refuse") return setSwitch(name, value, misbehaviour.refuse);
   if (name == "endless") return setSwitch(name, value, misbehaviour.endless);
   if (name == "header") return addHeader(misbehaviour, value);
   if (name == "body") {
@@ -99,13 +103,14 @@ MaybeError setParameter(Misbehaviour& misbehaviour, const std::string& name, con
   return Error(
       kToolErrorDomain, -1,
       "unknown parameter " + printable(name, 60) +
-          "; there are: for, count, status, delay, hang, empty, break-signature, reset, reset-after, "
-          "endless, body, header, clear");
+          "; there are: for, count, status, delay, hang, empty, break-signature, refuse, reset, "
+          "reset-after, endless, body, header, clear, and for datagrams drop, drop-acknowledgements, seed");
 }
 
 std::string targetName(const Misbehaviour& misbehaviour) {
   if (misbehaviour.forStorebags) return misbehaviour.forPosts ? "all" : "storebags";
-  return "events";
+  if (misbehaviour.forPosts) return "events";
+  return misbehaviour.forUploads ? "uploads" : "log-data";
 }
 
 bool doesAnything(const Misbehaviour& misbehaviour) {
@@ -114,6 +119,20 @@ bool doesAnything(const Misbehaviour& misbehaviour) {
 
 }  // namespace
 
+bool Misbehaviour::isFor(RequestKind kind) const {
+  switch (kind) {
+    case RequestKind::storebag:
+      return forStorebags;
+    case RequestKind::post:
+      return forPosts;
+    case RequestKind::upload:
+      return forUploads;
+    case RequestKind::logData:
+      return forLogData;
+  }
+  return false;
+}
+
 std::string Misbehaviour::description() const {
   std::string text;
   const auto add = [&text](const std::string& part) { text += (text.empty() ? "" : ", ") + part; };
@@ -121,6 +140,7 @@ std::string Misbehaviour::description() const {
   if (delay.count() > 0) add("after " + grouped(static_cast<uint64_t>(delay.count())) + " ms");
   if (empty) add("empty body");
   if (breakSignature) add("broken signature");
+  if (refuse) add("refused");
   if (endless) add("body without end");
   if (body) add("another body of " + byteCount(body->size()));
   if (!headers.empty()) add(std::to_string(headers.size()) + " header field(s)");
@@ -155,7 +175,11 @@ Result<Misbehaviour> misbehaviourFromQuery(const NameValues& query) {
         "say what to do, for example status=503&count=3, delay=2000, empty=1, break-signature=1, reset=1");
   }
   if (misbehaviour.breakSignature && !misbehaviour.forStorebags) {
-    return Error(kToolErrorDomain, -1, "break-signature: only storebags are signed: leave out for=events");
+    return Error(kToolErrorDomain, -1,
+                 "break-signature: only storebags are signed: leave out for=" + targetName(misbehaviour));
+  }
+  if (misbehaviour.refuse && !misbehaviour.forUploads) {
+    return Error(kToolErrorDomain, -1, "refuse: only uploads are taken or refused: add for=uploads");
   }
   return misbehaviour;
 }
@@ -177,9 +201,8 @@ void Misbehaviours::clear() {
 
 std::optional<Misbehaviour> Misbehaviours::take(RequestKind kind) {
   const std::lock_guard lock(mutex_);
-  const auto found = std::find_if(entries_.begin(), entries_.end(), [kind](const Entry& entry) {
-    return kind == RequestKind::storebag ? entry.misbehaviour.forStorebags : entry.misbehaviour.forPosts;
-  });
+  const auto found = std::find_if(entries_.begin(), entries_.end(),
+                                  [kind](const Entry& entry) { return entry.misbehaviour.isFor(kind); });
   if (found == entries_.end()) return std::nullopt;
   Misbehaviour taken = found->misbehaviour;
   if (taken.count != 0 && --found->left == 0) entries_.erase(found);

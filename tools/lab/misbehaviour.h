@@ -13,31 +13,37 @@
 
 namespace tarnel::lab {
 
-enum class RequestKind { storebag, post };
+enum class RequestKind { storebag, post, upload, logData };
 
 // One way to answer other than well.
 struct Misbehaviour {
   bool forStorebags = true;
   bool forPosts = true;
+  bool forUploads = true;
+  bool forLogData = true;
   uint64_t count = 1;  // requests that are answered this way; 0: until cleared
 
   std::optional<int> status;
   std::chrono::milliseconds delay{0};
   bool empty = false;
   bool breakSignature = false;  // storebags only
+  bool refuse = false;          // uploads only
   bool endless = false;
   std::optional<uint64_t> resetAfter;  // bytes of the answer
   std::optional<std::string> body;
   NameValues headers;
 
+  bool isFor(RequestKind kind) const;
   // "status 503, after 200 ms"
   std::string description() const;
-  // Changes an answer that would have been good. breakSignature is left to who signs.
+  // Changes an answer that would have been good. breakSignature and refuse are left to
+  // who answers.
   void applyTo(HttpAnswer& answer) const;
 };
 
 // From the query of the control address: status=N, delay=MS, hang=1, empty=1, break-signature=1, reset=1,
-// reset-after=BYTES, endless=1, body=TEXT, header=NAME:VALUE, for=storebags|events|all, count=N.
+// reset-after=BYTES, endless=1, body=TEXT, header=NAME:VALUE, refuse=1,
+// for=storebags|events|uploads|log-data|all, count=N.
 // The error names the parameter and what it takes.
 Result<Misbehaviour> misbehaviourFromQuery(const NameValues& query);
 

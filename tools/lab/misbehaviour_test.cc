@@ -41,13 +41,16 @@ TEST(MisbehaviourQuery, WhatItDoesNotTakeIsNamed) {
   EXPECT_EQ(problem({{"status", "199"}}), "status=199: status takes a number from 200 to 999");
   EXPECT_EQ(problem({{"delay", "600001"}}), "delay=600001: delay takes a number from 0 to 600000");
   EXPECT_EQ(problem({{"empty", "yes"}}), "empty=yes: empty takes 1 or 0");
-  EXPECT_EQ(problem({{"for", "me"}, {"empty", "1"}}), "for=me: for takes storebags, events or all");
+  EXPECT_EQ(problem({{"for", "me"}, {"empty", "1"}}),
+            "for=me: for takes storebags, events, uploads, log-data, datagrams or all");
   EXPECT_THAT(problem({{"reset-after", "-1"}}), HasSubstr("reset-after takes a number"));
   EXPECT_THAT(problem({{"header", "no colon"}}), HasSubstr("header takes NAME:VALUE"));
   EXPECT_THAT(problem({{"header", "A: b\r\nC: d"}}), HasSubstr("header takes NAME:VALUE"));
   EXPECT_THAT(problem({{"statsu", "503"}}),
               HasSubstr("unknown parameter statsu; there are: for, count, status"));
   EXPECT_THAT(problem({{"break-signature", "1"}, {"for", "events"}}), HasSubstr("only storebags are signed"));
+  EXPECT_THAT(problem({{"refuse", "1"}, {"for", "log-data"}}),
+              HasSubstr("only uploads are taken or refused: add for=uploads"));
   EXPECT_THAT(problem({{"body", std::string(65537, 'x')}, {"for", "all"}}), HasSubstr("at most 65536"));
 }
 
@@ -60,6 +63,23 @@ TEST(MisbehaviourList, CountsDownForTheKindThatIsMeant) {
   EXPECT_FALSE(list.take(RequestKind::storebag));
   EXPECT_EQ(list.take(RequestKind::post)->status, 599);
   EXPECT_FALSE(list.take(RequestKind::post));
+}
+
+TEST(MisbehaviourList, EveryKindCanBeMeantByItself) {
+  for (const auto& [name, meant] :
+       std::vector<std::pair<std::string, RequestKind>>{{"storebags", RequestKind::storebag},
+                                                        {"events", RequestKind::post},
+                                                        {"uploads", RequestKind::upload},
+                                                        {"log-data", RequestKind::logData}}) {
+    Misbehaviours list;
+    ASSERT_FALSE(list.add(*misbehaviourFromQuery({{"empty", "1"}, {"for", name}, {"count", "0"}})));
+    EXPECT_EQ(*findString(*list.description()[0].dictionary(), "for"), name);
+    for (const RequestKind kind :
+         {RequestKind::storebag, RequestKind::post, RequestKind::upload, RequestKind::logData}) {
+      EXPECT_EQ(list.take(kind).has_value(), kind == meant) << name;
+      EXPECT_TRUE(misbehaviourFromQuery({{"empty", "1"}, {"for", "all"}})->isFor(kind));
+    }
+  }
 }
 
 TEST(MisbehaviourList, TheFirstThatFitsActsAndZeroCountsStayUntilCleared) {

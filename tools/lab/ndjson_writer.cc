@@ -14,12 +14,17 @@ namespace tarnel::lab {
 NdjsonWriter::NdjsonWriter(std::string folder, Notices& notices, uint64_t maxFileBytes)
     : notices_(notices), maxFileBytes_(maxFileBytes) {
   events_.path = folder + "/events.ndjson";
-  posts_.path = std::move(folder) + "/posts.ndjson";
+  posts_.path = folder + "/posts.ndjson";
+  uploads_.path = folder + "/uploads.ndjson";
+  logData_.path = folder + "/log-data.ndjson";
+  datagrams_.path = std::move(folder) + "/datagrams.ndjson";
 }
 
 MaybeError NdjsonWriter::open() {
-  if (MaybeError error = openFile(events_)) return error;
-  return openFile(posts_);
+  for (File* file : {&events_, &posts_, &uploads_, &logData_, &datagrams_}) {
+    if (MaybeError error = openFile(*file)) return error;
+  }
+  return std::nullopt;
 }
 
 MaybeError NdjsonWriter::openFile(File& file) {
@@ -55,6 +60,26 @@ void NdjsonWriter::arrived(const Arrival& arrival) {
   for (const Value& event : arrival.events) lines += writeTextDocument(recordOfEvent(arrival, event)) + "\n";
   MaybeError error = append(events_, lines);
   if (!error) error = append(posts_, writeTextDocument(recordOfPost(arrival, false)) + "\n");
+  told(error);
+}
+
+void NdjsonWriter::uploadArrived(const UploadArrival& arrival) {
+  appendRecord(uploads_, recordOfUpload(arrival));
+}
+
+void NdjsonWriter::logDataArrived(const LogDataArrival& arrival) {
+  appendRecord(logData_, recordOfLogData(arrival, false));
+}
+
+void NdjsonWriter::datagramArrived(const DatagramArrival& arrival) {
+  appendRecord(datagrams_, recordOfDatagram(arrival));
+}
+
+void NdjsonWriter::appendRecord(File& file, const Dictionary& record) {
+  told(append(file, writeTextDocument(record) + "\n"));
+}
+
+void NdjsonWriter::told(const MaybeError& error) {
   if (error && !failing_) {
     notices_.warning(error->localizedDescription() + "; what arrives is not kept on disk meanwhile");
   }

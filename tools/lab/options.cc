@@ -22,7 +22,10 @@ void addOptions(CLI::App& app, LabOptions& options) {
   app.add_option("--control-port", options.controlPort, "port of the control address, 0 for any free one")
       ->check(CLI::Range(0, 65535))
       ->capture_default_str();
-  app.add_option("--keep", options.keep, "arrivals kept in memory")
+  app.add_option("--max-upload", options.maxUploadMiB, "largest file taken, in MiB, packed and unpacked")
+      ->check(CLI::Range(1, 1024))
+      ->capture_default_str();
+  app.add_option("--keep", options.keep, "arrivals of each kind kept in memory")
       ->check(CLI::Range(0, 1'000'000))
       ->capture_default_str();
   app.add_option("--storebag-max-age", options.storebagMaxAge, "seconds for which clients keep a storebag")
@@ -43,7 +46,7 @@ void addOptions(CLI::App& app, LabOptions& options) {
 
 ParsedOptions parseOptions(int argc, const char* const* argv) {
   ParsedOptions parsed;
-  CLI::App app("Development server: serves signed storebags and receives what the service posts",
+  CLI::App app("Development server: serves signed storebags and receives what the service sends",
                "tarnel-lab");
   app.footer(kFooter);
   addOptions(app, parsed.options);

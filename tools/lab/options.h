@@ -11,7 +11,8 @@ struct LabOptions {
   std::string listen = "127.0.0.1";  // numeric address
   uint16_t port = 8443;              // 0: any free one
   uint16_t controlPort = 8444;       // 0: any free one; always on 127.0.0.1
-  size_t keep = 1000;                // arrivals in memory
+  size_t keep = 1000;                // arrivals of each kind in memory
+  uint64_t maxUploadMiB = 64;        // of one file, packed and unpacked
   int storebagMaxAge = 60;           // seconds, for "Cache-Control"
   std::string bundleVersion = "8.0";
   std::string readyFile;  // empty: none

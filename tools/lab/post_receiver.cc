@@ -3,12 +3,11 @@
 #include "platform/document.h"
 #include "tools/lab/event_check.h"
 #include "tools/lab/gunzip.h"
+#include "tools/lab/http_arrival.h"
 #include "tools/lab/text.h"
 
 namespace tarnel::lab {
 namespace {
-
-constexpr size_t kMaxHeaderText = 1024;
 
 struct Refusal {
   int status;
@@ -41,23 +40,11 @@ std::optional<Refusal> readBody(const HttpRequest& request, Arrival& arrival, Va
   return std::nullopt;
 }
 
-Arrival arrivalFrom(const HttpRequest& request, double now) {
-  Arrival arrival;
-  arrival.arrived = now;
-  arrival.path = printable(request.path);
-  arrival.sender = request.sender;
-  for (const auto& [name, value] : request.headers) {
-    arrival.headers.emplace_back(printable(name, kMaxHeaderText), printable(value, kMaxHeaderText));
-  }
-  arrival.wireBytes = request.body.size();
-  arrival.plainBytes = request.body.size();
-  return arrival;
-}
-
 }  // namespace
 
 HttpAnswer PostReceiver::receive(const HttpRequest& request) {
-  Arrival arrival = arrivalFrom(request, secondsFromTimeValue(clock_.timeOfDay()));
+  Arrival arrival;
+  describeRequest(request, secondsFromTimeValue(clock_.timeOfDay()), arrival);
   Problems problems;
   Value document;
   HttpAnswer answer;
@@ -76,9 +63,9 @@ HttpAnswer PostReceiver::receive(const HttpRequest& request) {
     if (document.dictionary() == nullptr) answer.status = 400;
   }
   arrival.problems = problems.take();
-  Array list;
-  for (const std::string& problem : arrival.problems) list.append(problem);
-  answer.body = writeTextDocument(Dictionary{{"received", arrival.events.size()}, {"problems", list}}) + "\n";
+  answer.body = writeTextDocument(
+                    Dictionary{{"received", arrival.events.size()}, {"problems", listOf(arrival.problems)}}) +
+                "\n";
   arrival.answered = std::to_string(answer.status);
   if (const auto misbehaviour = misbehaviours_.take(RequestKind::post)) {
     misbehaviour->applyTo(answer);

@@ -26,22 +26,43 @@ HttpAnswer plainAnswer(int status, const std::string& text) {
   return answer;
 }
 
+PostKind kindOfPost(const HttpRequest& request) {
+  const std::string* type = findHeader(request.headers, "Content-Type");
+  if (type == nullptr || !type->starts_with("application/octet-stream")) return PostKind::events;
+  const bool packed = findHeader(request.headers, "Content-Encoding") != nullptr;
+  return packed || findParameter(request.query, "filename") != nullptr ? PostKind::file : PostKind::logData;
+}
+
+size_t Service::maxBodyBytes(const HttpRequest& request) const {
+  switch (kindOfPost(request)) {
+    case PostKind::events:
+      return PostReceiver::kMaxPlainBytes;
+    case PostKind::file:
+      return parts_.uploads.maxFileBytes();
+    case PostKind::logData:
+      return LogDataReceiver::kMaxArchiveBytes;
+  }
+  return 0;
+}
+
 HttpAnswer Service::answer(const HttpRequest& request) {
   if (request.method == "POST") {
-    const std::string* type = findHeader(request.headers, "Content-Type");
-    if (type != nullptr && type->starts_with("application/octet-stream")) {
-      parts_.notices.warning(request.sender + " uploads to " + printable(request.path) +
-                             ": uploads are not received, answered 501");
-      return plainAnswer(501, "uploads are not received here");
+    switch (kindOfPost(request)) {
+      case PostKind::events:
+        return parts_.posts.receive(request);
+      case PostKind::file:
+        return parts_.uploads.receive(request);
+      case PostKind::logData:
+        return parts_.logData.receive(request);
     }
-    return parts_.posts.receive(request);
   }
   const std::string name = storebagNameInPath(request.path);
   if (!name.empty()) return answerStorebag(request, name);
   if (request.path == "/") {
-    return plainAnswer(200, "tarnel-lab: storebags at /storebags/NAME, event posts at any other path");
+    return plainAnswer(
+        200, "tarnel-lab: storebags at /storebags/NAME; events, files and log data are posted to any path");
   }
-  return plainAnswer(404, "nothing here; storebags are at /storebags/NAME, event posts go to any path");
+  return plainAnswer(404, "nothing here; storebags are at /storebags/NAME, posts go to any path");
 }
 
 HttpAnswer Service::answerStorebag(const HttpRequest& request, const std::string& name) {

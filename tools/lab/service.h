@@ -4,19 +4,24 @@
 
 #include "platform/clock.h"
 #include "tools/lab/http_message.h"
+#include "tools/lab/log_data_receiver.h"
 #include "tools/lab/misbehaviour.h"
 #include "tools/lab/notices.h"
 #include "tools/lab/post_receiver.h"
 #include "tools/lab/storebag_source.h"
+#include "tools/lab/upload_receiver.h"
 
 namespace tarnel::lab {
 
-// What stands behind the HTTPS address: GET of storebags, POST of events. Threads: any.
+// What stands behind the HTTPS address: GET of storebags, POST of events, files and log records. Threads:
+// any.
 class Service final : public HttpHandler {
  public:
   struct Parts {
     StorebagSource& storebags;
     PostReceiver& posts;
+    UploadReceiver& uploads;
+    LogDataReceiver& logData;
     Misbehaviours& misbehaviours;
     Notices& notices;
     Clock& clock;
@@ -25,6 +30,7 @@ class Service final : public HttpHandler {
   // maxAge: seconds for "Cache-Control" of storebags.
   Service(const Parts& parts, int maxAge) : parts_(parts), maxAge_(maxAge) {}
 
+  size_t maxBodyBytes(const HttpRequest& request) const override;
   HttpAnswer answer(const HttpRequest& request) override;
   void connectionFailed(const std::string& sender, const std::string& text) override;
 
@@ -40,6 +46,12 @@ class Service final : public HttpHandler {
   const int maxAge_;
   std::atomic<uint64_t> storebagsServed_ = 0;
 };
+
+enum class PostKind { events, file, logData };
+
+// What is posted: anything but "application/octet-stream" is events; of that, what is packed or has a file
+// name in its query is a file, and everything else log data. Whatever the path.
+PostKind kindOfPost(const HttpRequest& request);
 
 // The storebag name in "/storebags/NAME", "/bags/alder/NAME" and "/storebags/alder/NAME"; empty for other
 // paths.

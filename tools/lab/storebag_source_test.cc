@@ -9,6 +9,7 @@
 #include "platform/document.h"
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/service.h"
+#include "tools/lab/test_post.h"
 #include "tools/lab/text.h"
 #include "tools/storebag/signed_storebag.h"
 
@@ -169,8 +170,13 @@ class ServiceTest : public StorebagSourceTest, public Notices {
   Misbehaviours misbehaviours_;
   fake::FakeClock clock_;
   PostReceiver posts_{store_, misbehaviours_, clock_};
+  StoredFiles files_{folder_, *this, {}};
+  UploadReceiver uploads_{files_, 50U << 20U, store_, misbehaviours_, clock_};
+  LogDataReceiver logData_{files_, "http://127.0.0.1:8/log-data", store_, misbehaviours_, clock_};
   Service service_{{.storebags = source_,
                     .posts = posts_,
+                    .uploads = uploads_,
+                    .logData = logData_,
                     .misbehaviours = misbehaviours_,
                     .notices = *this,
                     .clock = clock_},
@@ -224,13 +230,30 @@ TEST_F(ServiceTest, FindingsAreToldOncePerChange) {
 TEST_F(ServiceTest, OtherRequests) {
   EXPECT_EQ(get("/").status, 200);
   EXPECT_EQ(get("/favicon.ico").status, 404);
-  HttpRequest upload;
-  upload.method = "POST";
-  upload.path = "/upload";
-  upload.headers = {{"Content-Type", "application/octet-stream"}};
-  EXPECT_EQ(service_.answer(upload).status, 501);
-  EXPECT_THAT(warnings_, ElementsAre(HasSubstr("uploads are not received")));
-  EXPECT_EQ(store_.counts().posts, 0U);
+}
+
+TEST_F(ServiceTest, WhatIsPostedIsToldByItsHeadersWhateverThePath) {
+  HttpRequest request = goodRequest(goodMessage({goodEvent(1)}), true);
+  EXPECT_EQ(kindOfPost(request), PostKind::events);
+  EXPECT_EQ(service_.maxBodyBytes(request), 16U << 20U);
+  service_.answer(request);
+  EXPECT_EQ(store_.counts().posts, 1U);
+
+  request = goodUpload("x.gz", "text");
+  EXPECT_EQ(kindOfPost(request), PostKind::file);
+  EXPECT_EQ(service_.maxBodyBytes(request), 50U << 20U);
+  service_.answer(request);
+  EXPECT_EQ(store_.counts().uploads, 1U);
+  setHeader(request, "Content-Encoding", "");
+  EXPECT_EQ(kindOfPost(request), PostKind::logData);
+  request.query = {{"filename", "x.gz"}};
+  EXPECT_EQ(kindOfPost(request), PostKind::file) << "a file that is not packed is told as that";
+
+  request.query.clear();
+  service_.answer(request);
+  EXPECT_EQ(service_.maxBodyBytes(request), 16U << 20U);
+  EXPECT_EQ(store_.counts().logArchives, 1U);
+  EXPECT_EQ(store_.counts().posts, 1U);
 }
 
 }  // namespace

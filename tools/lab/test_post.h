@@ -70,6 +70,23 @@ inline HttpRequest goodRequest(const Value& message, bool gzip = false) {
   return request;
 }
 
+// filename: as it stands in the query.
+inline HttpRequest goodUpload(const std::string& filename, std::string_view contents) {
+  HttpRequest request;
+  request.method = "POST";
+  request.path = "/v1/uploads";
+  request.rawQuery =
+      "uuid=0123456789abcdef0123456789abcdef01234567&sequence=77"
+      "&description=Lumora%20AFRC%20log%20(Uploaded%20by%20QMX)&filename=" +
+      filename + "&raw=true";
+  request.sender = "127.0.0.1:50000";
+  request.body = gzipped(contents);
+  request.headers = {{"Content-Type", "application/octet-stream"},
+                     {"Content-Encoding", "gzip"},
+                     {"Content-Length", std::to_string(request.body.size())}};
+  return request;
+}
+
 inline void setHeader(HttpRequest& request, const std::string& name, const std::string& value) {
   std::erase_if(request.headers, [&name](const auto& header) { return header.first == name; });
   if (!value.empty()) request.headers.emplace_back(name, value);
