@@ -71,9 +71,9 @@ void cutToWholeCharacters(std::string& text, size_t size) {
   text.resize(end);
 }
 
-// Text of a fixed field, up to its first zero byte.
+// Text of a field, for %s, which takes it up to its first zero byte.
 std::string fieldText(std::span<const uint8_t> field) {
-  return {field.begin(), std::find(field.begin(), field.end(), uint8_t{0})};
+  return {field.begin(), field.end()};
 }
 
 }  // namespace

@@ -98,6 +98,9 @@ TEST(DashboardDatagramTest, DeviceIdentifierIsFortyBytes) {
   EXPECT_EQ(std::count(bytes.begin() + 25, bytes.begin() + 60, 0), 35);
   header.udid = "0123456789abcdef0123456789abcdef01234567and more";
   EXPECT_EQ(written(header), written(sampleHeader()));
+  const std::string endless = "0123456789abcdef0123456789abcdef01234567" + std::string(1U << 16U, 'x');
+  header.udid = endless;
+  EXPECT_EQ(written(header), written(sampleHeader()));
   header.udid = "";
   EXPECT_EQ(written(header)[20], 0);
 }
@@ -126,9 +129,10 @@ TEST(DashboardTextTest, OrderGoesByTheDescriptionBeforeItIsSanitized) {
 }
 
 TEST(DashboardTextTest, LengthCountsUtf16CodeUnits) {
-  // Two bytes, one unit; four bytes, two units.
-  EXPECT_EQ(dashboardText({{"two", "ab"}, {"one", "ü"}}), " one=ü two=ab");
+  // Two and three bytes, one unit; four bytes, two units.
+  EXPECT_EQ(dashboardText({{"two", "ab"}, {"one", "ü"}, {"also", "€"}}), " one=ü also=€ two=ab");
   EXPECT_EQ(dashboardText({{"three", "abc"}, {"two", "😀"}, {"also", "ab"}}), " two=😀 also=ab three=abc");
+  EXPECT_EQ(dashboardText({{"two", "ab"}, {"also", "😀"}, {"one", "a"}}), " one=a two=ab also=😀");
 }
 
 TEST(DashboardTextTest, ManyEntriesOfEqualLengthKeepTheirOrder) {
@@ -162,14 +166,15 @@ TEST(DashboardTextTest, WhatComesAfterTheCutIsLeftOut) {
 
 TEST(DashboardTextTest, CutNeverGoesThroughACharacter) {
   for (const std::string character : {"ü", "€", "😀"}) {
-    std::string value;
-    while (value.size() < 2000) value += character;
-    const std::string text = dashboardText({{"k", value}});
-    EXPECT_TRUE(isValidUtf8(text)) << character;
-    EXPECT_LE(text.size(), 1023U);
-    EXPECT_GT(text.size(), 1023U - character.size());
-    // Nothing fills the gap.
-    EXPECT_EQ(dashboardText({{"k", value}, {"z", std::string(3000, 'z')}}), text);
+    for (const std::string key : {"k", "kk", "kkk", "kkkk"}) {  // the end falls on each of its bytes
+      std::string value;
+      while (value.size() < 2000) value += character;
+      const size_t room = 1023 - key.size() - 2;
+      const std::string text = dashboardText({{key, value}});
+      EXPECT_EQ(text, " " + key + "=" + value.substr(0, room / character.size() * character.size()));
+      // Nothing fills the gap.
+      EXPECT_EQ(dashboardText({{key, value}, {"z", std::string(3000, 'z')}}), text);
+    }
   }
   // Bytes that are no text at all are cut too.
   EXPECT_GE(dashboardText({{"k", std::string(2000, '\x80')}}).size(), 1020U);
@@ -265,6 +270,18 @@ TEST(DashboardLogLineTest, LongestLineIsWhole) {
   const std::string text(1023, 'x');
   const std::string line = writeLocalLog(written(header, text));
   EXPECT_TRUE(line.ends_with(" " + text));
+}
+
+TEST(DashboardLogLineTest, BufferHolds1152BytesWithTheirEnd) {
+  auto datagram = written(sampleHeader());
+  datagram.resize(64 + 5000, 'x');  // longer than any of ours
+  const std::string line = writeLocalLog(datagram);
+  EXPECT_EQ(line.size(), 1151U);
+  EXPECT_EQ(line.back(), 'x');
+}
+
+TEST(DashboardLogLineTest, TextEndsAtAZeroByte) {
+  EXPECT_TRUE(writeLocalLog(written(sampleHeader(), std::string(" a=1\0b", 6))).ends_with("  a=1"));
 }
 
 TEST(DashboardLogLineTest, PercentSignsAreText) {

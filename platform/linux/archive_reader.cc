@@ -27,8 +27,7 @@ class ArchiveReader {
     if (!archive.starts_with(kArchiveMark)) {
       return malformed("this is no keyed archive, which begins with the bytes D9 D9 F7; give it unpacked");
     }
-    // An archive's own nesting is its head, the table, an object, that object's two lists.
-    const auto document = parseDocument(archive, {limits_.bytes, 4, documentValues()});
+    const auto document = parseDocument(archive, {.bytes = limits_.bytes, .values = documentValues()});
     if (!document) return documentError(document.error());
     const auto* head = document->dictionary();
     const auto* version = head == nullptr ? nullptr : head->find(kArchiveVersionKey);

@@ -241,6 +241,17 @@ TEST(ArchiveTest, ReferencesMustPointBackwards) {
   }
 }
 
+TEST(ArchiveTest, ListsHoldPlacesAndNothingElse) {
+  const std::string problem = "object 1: a reference that is no earlier place in the table";
+  for (const Value& entry : {Value(Array{0}), Value(Dictionary()), Value(nested(20))}) {
+    expectProblem(unarchiveObject(archiveOf({"a", Array{entry}}, 1)), kArchiveMalformed, problem);
+    expectProblem(unarchiveObject(archiveOf({"a", dictionaryObject({0}, {entry})}, 1)), kArchiveMalformed,
+                  problem);
+  }
+  const std::string deep = std::string(kArchiveMark) + std::string(1U << 20U, '\x81');
+  EXPECT_EQ(unarchiveObject(deep).error().code(), kArchiveTooLarge);
+}
+
 TEST(ArchiveTest, DictionaryIsTwoListsOfEqualLength) {
   const std::string problem = "object 1: a dictionary is two lists of equal length, keys and values";
   const Array wrong{Dictionary(),
