@@ -105,10 +105,14 @@ TEST_F(SessionUploads, LogDataThatNoBackendTakesFailsWithoutAnError) {
 
 TEST_F(SessionUploads, SingleMessageWantsClientTypeAndSessionId) {
   const std::string line = "sendMessageWithSessionInfo: Could not retrieve identifiers from sessionInfo";
-  EXPECT_FALSE(single(std::nullopt));
-  EXPECT_FALSE(single(Dictionary{{kTarnelSessionInfoClientType, 8}}));
-  EXPECT_FALSE(single(Dictionary{{kTarnelSessionInfoSessionID, 7}}));
+  const std::vector<MaybeDictionary> incomplete{std::nullopt, Dictionary{{kTarnelSessionInfoClientType, 8}},
+                                                Dictionary{{kTarnelSessionInfoSessionID, 7}}};
+  for (const auto& sessionInfo : incomplete) {
+    session->sendMessageWithSessionInfo(sessionInfo, std::nullopt, 3, 4, std::nullopt,
+                                        [](const MaybeString&) { ADD_FAILURE() << "there is no reply"; });
+  }
   EXPECT_EQ(world.log.count(LogLevel::error, line), 3U);
+  EXPECT_EQ(session->sessionID(), 0U);
   EXPECT_THAT(backends.journal.lines(), IsEmpty());
 }
 
@@ -118,6 +122,8 @@ TEST_F(SessionUploads, SingleMessageWithoutAStorebagSaysSo) {
   EXPECT_EQ(session->sessionInfo(), info(9));
   EXPECT_TRUE(
       logged(LogLevel::debug, "sendMessageWithSessionInfo: Sending message with session info for session 9"));
+  EXPECT_FALSE(
+      logged(LogLevel::debug, "sendMessageWithSessionInfo: Sending single message with sessionID 9"));
 }
 
 TEST_F(SessionUploads, SingleMessageGoesThroughABackendSetOfItsOwn) {

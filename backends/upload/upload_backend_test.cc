@@ -99,6 +99,7 @@ TEST_F(UploadBackendTest, TheRequestIsExactlyThis) {
   EXPECT_TRUE(
       logged(LogLevel::debug,
              "UploadBackend(uploadFileAtPath): sending to |https://files.example/up|, Json output: ok"));
+  for (const auto& line : world.log.lines()) EXPECT_EQ(line.level, LogLevel::debug) << line.text;
 }
 
 TEST_F(UploadBackendTest, TheNameOfTheFileIsItsLastComponent) {
