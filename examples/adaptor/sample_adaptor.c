@@ -6,6 +6,9 @@
  * SAMPLE_ADAPTOR_FILE in the daemon's environment and must lie where the daemon may write, below its state or
  * logs directory. */
 
+#define _POSIX_C_SOURCE 200809L /* with -std=c11 the system's headers show nothing of their own without it \
+                                 */
+
 #include <fcntl.h>
 #include <inttypes.h>
 #include <stdatomic.h>

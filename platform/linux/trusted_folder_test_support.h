@@ -16,7 +16,10 @@ namespace tarnel {
 // below the directory for temporary files, which everybody can write to.
 class TrustedFolder {
  public:
-  TrustedFolder() {
+  enum class For { owner, everybody };
+
+  // For everybody: programs of other users may read what is in it.
+  explicit TrustedFolder(For readers = For::owner) : readers_(readers) {
     for (const char* variable : {"TARNEL_TEST_TRUSTED_FOLDER", "HOME", "XDG_RUNTIME_DIR"}) {
       const char* base = std::getenv(variable);
       if (base != nullptr && make(base)) return;
@@ -57,14 +60,16 @@ class TrustedFolder {
     for (std::filesystem::path part = folder; !error; part = part.parent_path()) {
       struct stat status {};
       if (::stat(part.c_str(), &status) != 0 || distrust(part, status, "it")) return false;
+      if (readers_ == For::everybody && (status.st_mode & S_IXOTH) == 0) return false;
       if (part == part.root_path()) break;
     }
     std::string pattern = folder + "/.tarnel-test-XXXXXX";
     if (error || ::mkdtemp(pattern.data()) == nullptr) return false;
     path_ = pattern;
-    return true;
+    return readers_ == For::owner || ::chmod(path_.c_str(), 0755) == 0;
   }
 
+  const For readers_;
   std::string path_;
 };
 

@@ -44,10 +44,30 @@ TEST_F(TrustedPathTest, WhatOnlyItsOwnersCanWriteIsTrusted) {
   EXPECT_EQ(outcome(file), "trusted");
 }
 
+TEST_F(TrustedPathTest, SpecialBitsAloneChangeNothing) {
+  for (const mode_t mode : {01755, 02755, 04755, 06711}) {
+    ::chmod(folder.path("a").c_str(), mode);
+    ::chmod(file.c_str(), mode);
+    EXPECT_EQ(outcome(file), "trusted") << std::oct << mode;
+  }
+}
+
+// Whoever made the link, the file is the same: its owner and mode say who can write to it.
+TEST_F(TrustedPathTest, AHardLinkIsTheFileItself) {
+  folder.makeDirectory("elsewhere");
+  ::chmod(folder.path("elsewhere").c_str(), 0777);
+  ASSERT_EQ(::link(file.c_str(), folder.path("elsewhere/file").c_str()), 0);
+  EXPECT_EQ(outcome(file), "trusted");
+  EXPECT_THAT(outcome(folder.path("elsewhere/file")), HasSubstr("can be written by its group or by others"));
+  ::chmod(folder.path("elsewhere/file").c_str(), 0666);
+  EXPECT_EQ(outcome(file),
+            refused + "it can be written by its group or by others; change that with: chmod go-w " + file);
+}
+
 TEST_F(TrustedPathTest, WhatOthersCanWriteIsRefusedAtEveryStep) {
   for (const std::string name : {"", "a", "a/b"}) {
     const std::string directory = name.empty() ? folder.path() : folder.path(name);
-    for (const mode_t mode : {0775, 0757, 01777, 02770}) {
+    for (const mode_t mode : {0775, 0757, 01777, 01757, 02770, 02775}) {
       ::chmod(directory.c_str(), mode);
       EXPECT_EQ(outcome(file),
                 refused + "its directory " + directory +

@@ -17,9 +17,10 @@
  * - tarnel_adaptor_class_named is called by one thread at a time.
  * - create, find_method, the methods and destroy of one instance are called by one thread at a time, in the
  *   order in which things happened, though not always by the same thread.
- * - There is an instance for each session, and different instances are called on different threads at the
- *   same time: what instances share, the adaptor guards.
- * - A call that takes long delays its own session's client, and nobody else.
+ * - There is an instance for each session, and one for each message that is sent without a session; different
+ *   instances are called on different threads at the same time: what instances share, the adaptor guards.
+ * - A call that takes long delays its own session's client, and nobody else; only tarnel_adaptor_class_named,
+ *   and what runs when the library is loaded, delay all sessions that want an instance meanwhile.
  *
  * Lifetime
  * - What a method is given (the dictionary and all that is read out of it: keys, texts, bytes, values) is
