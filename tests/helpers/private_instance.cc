@@ -99,6 +99,7 @@ ProcessOptions PrivateInstance::daemonOptions() const {
   ProcessOptions options;
   options.program = kTarneld;
   options.environment = environment();
+  options.environment.insert(options.environment.end(), variables_.begin(), variables_.end());
   options.environment.push_back("NOTIFY_SOCKET=" + folder_.path("notify"));
   options.environment.push_back("TARNEL_LOG_LEVEL=" + logLevel_);
   options.account = unprivilegedAccount();

@@ -33,6 +33,8 @@ class PrivateInstance {
   void setEntitlements(std::string_view toml) const { folder_.write("config/entitlements.d/10.toml", toml); }
   // A folder with version and publicKey.der; without it the instance has no bundle.
   void setBundle(std::string folder) { bundle_ = std::move(folder); }
+  // "NAME=value", for the daemon alone.
+  void addVariable(std::string variable) { variables_.push_back(std::move(variable)); }
   void trust(std::string_view pem) const { folder_.write("config/trust.d/test.pem", pem); }
 
   // Also while it runs. A setting of com.orvane.tarnel, in the administrator's layer.
@@ -73,6 +75,7 @@ class PrivateInstance {
   TestFolder folder_;
   std::string logLevel_ = "debug";
   std::string bundle_;
+  std::vector<std::string> variables_;
   std::map<std::string, Value> settings_;
   UniqueFd notifications_;
   std::unique_ptr<ChildProcess> daemon_;

@@ -111,6 +111,15 @@ TEST_F(TarnelctlTest, SingleSendsOneMessage) {
   EXPECT_EQ(textIn(eventOf(lab.waitForEvents(1)[0]), "k"), "v");
 }
 
+TEST_F(TarnelctlTest, SingleWithoutAStorebagFailsAndSaysWhereToLook) {
+  lab.withdraw("moldaro");
+  ASSERT_TRUE(instance.start());
+  const auto sent = run({"single", "--client-type", "9", "--category", "1", "--type", "2"});
+  EXPECT_EQ(sent.end.status, 1);
+  EXPECT_EQ(sent.output, "single: storebag not available\n");
+  EXPECT_THAT(sent.errors, HasSubstr("no storebag is available for client type 9: see the daemon's log"));
+}
+
 TEST_F(TarnelctlTest, ExitStatusSaysWhetherADaemonServesUs) {
   const auto none = send();
   EXPECT_EQ(none.end.status, 3);
