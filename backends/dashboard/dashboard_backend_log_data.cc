@@ -1,6 +1,7 @@
 #include <utility>
 
 #include "backends/dashboard/dashboard_backend.h"
+#include "backends/dashboard/log_data_announcement.h"
 #include "platform/archive.h"
 #include "util/uploads.h"
 
@@ -49,10 +50,10 @@ bool DashboardBackend::uploadLogData(const Array& logData) {
   const MaybeString location = isValidUtf8(*result.data) ? MaybeString(*result.data) : std::nullopt;
   TARNEL_LOG(log, debug, "DashboardBackend(uploadLogData): Log data uploaded to %s",
              printable(logText(location)));
-  Dictionary payload;
-  if (location) payload.set("LogDataUploadLocation", *location);
+  const LogDataAnnouncement message(location);
   // Through the flagged send, which for this backend ends in the base's default: no datagram is made.
-  sendMessage(payload, dependencies().clock.timeOfDay(), Method{0}, RespCode{2}, Flag::normal);
+  sendMessage(message.payload, dependencies().clock.timeOfDay(), message.method, message.respCode,
+              message.flag);
   return true;
 }
 

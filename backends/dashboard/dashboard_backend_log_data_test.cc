@@ -1,6 +1,8 @@
+#include <algorithm>
 #include <thread>
 
 #include "backends/dashboard/dashboard_backend_fixture.h"
+#include "backends/dashboard/log_data_announcement.h"
 #include "platform/archive.h"
 
 // The upload of log records.
@@ -56,6 +58,16 @@ TEST_F(DashboardBackendLogDataTest, AnnouncesTheLocationThroughTheFlaggedSendWhi
   EXPECT_TRUE(world.files.files.empty());  // nor is there a line in the message log
 }
 
+TEST_F(DashboardBackendLogDataTest, AnnouncementNamesTheLocation) {
+  const LogDataAnnouncement message("https://logs.example/17");
+  EXPECT_EQ(message.payload, (Dictionary{{"LogDataUploadLocation", "https://logs.example/17"}}));
+  EXPECT_EQ(message.method, Method{0});
+  EXPECT_EQ(message.respCode, RespCode{2});
+  EXPECT_EQ(message.flag, Flag::normal);
+  EXPECT_EQ(LogDataAnnouncement("").payload, (Dictionary{{"LogDataUploadLocation", ""}}));
+  EXPECT_EQ(LogDataAnnouncement(std::nullopt).payload, Dictionary());
+}
+
 TEST_F(DashboardBackendLogDataTest, EmptyArrayIsPostedLikeAnyOther) {
   const auto backend = makeUploading();
   EXPECT_TRUE(backend->uploadLogData(Array()));
@@ -85,6 +97,16 @@ TEST_F(DashboardBackendLogDataTest, AnswerThatIsNoTextNamesNoLocation) {
   EXPECT_TRUE(backend->uploadLogData(records));
   expectLog(LogLevel::debug, "DashboardBackend(uploadLogData): Log data uploaded to (null)");
   EXPECT_EQ(EventNumberOf::of(*backend), 1);
+}
+
+TEST_F(DashboardBackendLogDataTest, AnswerIsLoggedUpTo4096Bytes) {
+  for (const size_t size : {4095U, 4096U, 4097U, 8000U}) {
+    world.log.clear();
+    world.http.setAnswer(FakeHttpClient::status(200, std::string(size, 'x')));
+    EXPECT_TRUE(makeUploading()->uploadLogData(records));
+    expectLog(LogLevel::debug, "DashboardBackend(uploadLogData): Log data uploaded to " +
+                                   std::string(std::min<size_t>(size, 4096), 'x'));
+  }
 }
 
 TEST_F(DashboardBackendLogDataTest, LongAnswerIsCutInTheLogAtAWholeCharacter) {
