@@ -7,7 +7,6 @@
 #include <csignal>
 #include <map>
 #include <mutex>
-#include <set>
 #include <stdexcept>
 #include <system_error>
 #include <thread>
@@ -15,6 +14,7 @@
 
 #include "platform/linux/certificate_store.h"
 #include "platform/linux/curl_transfer.h"
+#include "platform/linux/due_times.h"
 #include "platform/linux/http_request_check.h"
 #include "platform/linux/name_service.h"
 #include "platform/linux/transfer_queue.h"
@@ -77,7 +77,6 @@ class CurlHttpClient::Worker {
   // A request that has not ended, on the wire or waiting for its turn.
   struct Active {
     std::unique_ptr<CurlTransfer> transfer;
-    SteadyTime deadline;
     std::chrono::milliseconds allowed;
   };
 
@@ -90,6 +89,8 @@ class CurlHttpClient::Worker {
   MaybeError start(CurlTransfer& transfer);
   void endHops();
   void endHop(CurlTransfer& transfer, CURLcode code);
+  void watch(uint64_t id);
+  void endStalled();
   void expire();
   int pollTime() const;
   void end(uint64_t id, HttpResult result);
@@ -130,7 +131,8 @@ class CurlHttpClient::Worker {
   detail::TransferContext context_;
   detail::TransferQueue queue_;
   std::map<uint64_t, Active> active_;
-  std::set<std::pair<SteadyTime, uint64_t>> deadlines_;
+  detail::DueTimes deadlines_;
+  detail::DueTimes lookAt_;  // when a request on the wire may have stalled
   uint64_t lastId_ = 0;
   std::vector<CurlEasy> spare_;
 };
@@ -202,6 +204,7 @@ void CurlHttpClient::Worker::run() {
     int running = 0;
     curl_multi_perform(multi_.get(), &running);
     endHops();
+    endStalled();
     expire();
     startWaiting();
     curl_multi_poll(multi_.get(), nullptr, 0, pollTime(), nullptr);
@@ -232,13 +235,17 @@ void CurlHttpClient::Worker::accept(Incoming incoming) {
   auto transfer = std::make_unique<CurlTransfer>(id, std::move(incoming.request),
                                                  std::move(incoming.completion), context_);
   queue_.add(id, transfer->host());
-  deadlines_.emplace(incoming.deadline, id);
-  active_.emplace(id, Active{std::move(transfer), incoming.deadline, allowed});
+  deadlines_.set(id, incoming.deadline);
+  active_.emplace(id, Active{std::move(transfer), allowed});
 }
 
 void CurlHttpClient::Worker::startWaiting() {
   while (const auto id = queue_.next()) {
-    if (auto failure = start(*active_.at(*id).transfer)) fail(*id, std::move(*failure));
+    if (auto failure = start(*active_.at(*id).transfer)) {
+      fail(*id, std::move(*failure));
+    } else {
+      watch(*id);
+    }
   }
 }
 
@@ -270,33 +277,60 @@ void CurlHttpClient::Worker::endHop(CurlTransfer& transfer, CURLcode code) {
   const auto next = transfer.followRedirect();
   if (!next) return fail(id, next.error());
   if (*next == CurlTransfer::Next::finished) return end(id, transfer.result(code));
+  lookAt_.remove(id);
   queue_.remove(id);
   queue_.add(id, transfer.host());
+}
+
+// Sets when the request is looked at next: when it will have stalled unless a byte moves before, and
+// meanwhile often enough to see it begin.
+void CurlHttpClient::Worker::watch(uint64_t id) {
+  constexpr std::chrono::milliseconds kWhileConnecting{1000};
+  const auto moved = active_.at(id).transfer->lastMoved();
+  lookAt_.set(id, moved ? *moved + options_.noProgress
+                        : std::chrono::steady_clock::now() + std::min(kWhileConnecting, options_.noProgress));
+}
+
+// The library's own limit goes by the average of some seconds, and so comes that much later.
+void CurlHttpClient::Worker::endStalled() {
+  const auto now = std::chrono::steady_clock::now();
+  while (const auto id = lookAt_.due(now)) {
+    const auto moved = active_.at(*id).transfer->lastMoved();
+    if (!moved || *moved + options_.noProgress > now) {
+      watch(*id);
+    } else {
+      fail(*id, Error(kHttpErrorDomain, CURLE_OPERATION_TIMEDOUT,
+                      "no byte was sent or received for " + std::to_string(options_.noProgress.count()) +
+                          " milliseconds"));
+    }
+  }
 }
 
 // Time-outs count from the start of a request, so that waiting for its turn is part of them.
 void CurlHttpClient::Worker::expire() {
   const auto now = std::chrono::steady_clock::now();
-  while (!deadlines_.empty() && deadlines_.begin()->first <= now) {
-    const uint64_t id = deadlines_.begin()->second;
-    const auto allowed = active_.at(id).allowed;
-    fail(id, Error(kHttpErrorDomain, CURLE_OPERATION_TIMEDOUT,
-                   "the request timed out after " + std::to_string(allowed.count()) + " milliseconds"));
+  while (const auto id = deadlines_.due(now)) {
+    const auto allowed = active_.at(*id).allowed;
+    fail(*id, Error(kHttpErrorDomain, CURLE_OPERATION_TIMEDOUT,
+                    "the request timed out after " + std::to_string(allowed.count()) + " milliseconds"));
   }
 }
 
 int CurlHttpClient::Worker::pollTime() const {
   constexpr auto kLongest = std::chrono::milliseconds(std::chrono::hours(1));
-  if (deadlines_.empty()) return static_cast<int>(kLongest.count());
-  const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadlines_.begin()->first -
-                                                                 std::chrono::steady_clock::now());
+  // What is on the wire has a deadline, too.
+  const auto deadline = deadlines_.next();
+  if (!deadline) return static_cast<int>(kLongest.count());
+  const auto next = std::min(*deadline, lookAt_.next().value_or(*deadline));
+  const auto left = std::chrono::ceil<std::chrono::milliseconds>(next - std::chrono::steady_clock::now());
   return static_cast<int>(std::clamp(left, std::chrono::milliseconds(0), kLongest).count());
 }
 
 void CurlHttpClient::Worker::end(uint64_t id, HttpResult result) {
   const auto found = active_.find(id);
   const std::unique_ptr<CurlTransfer> transfer = std::move(found->second.transfer);
-  deadlines_.erase({found->second.deadline, id});
+  deadlines_.remove(id);
+  lookAt_.remove(id);
   active_.erase(found);
   queue_.remove(id);
   if (CurlEasy easy = transfer->takeHandle()) {

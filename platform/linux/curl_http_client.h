@@ -20,7 +20,7 @@ struct HttpClientOptions {
   std::vector<std::string> extraCertificates;      // PEM texts
 
   std::chrono::milliseconds connectTimeout{30000};  // name, connection and TLS handshake
-  std::chrono::seconds noProgress{60};              // without a byte in either direction
+  std::chrono::milliseconds noProgress{60000};      // without a byte in either direction, once connected
   std::chrono::milliseconds longestRequest{
       std::chrono::hours(1)};  // of a request without a time-out of its own
 

@@ -137,11 +137,6 @@ TEST(HttpFailureTest, endsARequestWithoutATimeOutOfItsOwn) {
   HttpClientOptions patient = plainOptions();
   patient.longestRequest = 70ms;
   EXPECT_EQ(errorOf(performWith(patient, get(server.url()))), "the request timed out after 70 milliseconds");
-  HttpClientOptions watchful = plainOptions();
-  watchful.noProgress = 1s;
-  const HttpResult result = performWith(watchful, get(server.url()));
-  EXPECT_EQ(result.error->code(), CURLE_OPERATION_TIMEDOUT);
-  EXPECT_THAT(errorOf(result), HasSubstr("too slow"));
 }
 
 TEST(HttpFailureTest, reportsConnectionsThatBreak) {

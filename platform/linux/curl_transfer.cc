@@ -57,6 +57,8 @@ MaybeError CurlTransfer::begin(CurlEasy easy) {
   easy_ = std::move(easy);
   if (easy_ == nullptr) return Error(kHttpErrorDomain, CURLE_OUT_OF_MEMORY, "out of memory");
   curl_easy_reset(easy_.get());
+  moved_.reset();
+  sent_ = 0;
   set(CURLOPT_PRIVATE, this);
   set(CURLOPT_URL, request_.url.c_str());
   setMethodAndBody();
@@ -118,14 +120,17 @@ void CurlTransfer::setConnection() {
   set(CURLOPT_HTTP_CONTENT_DECODING, 0L);
   set(CURLOPT_TCP_KEEPALIVE, 1L);
   set(CURLOPT_CONNECTTIMEOUT_MS, static_cast<long>(options.connectTimeout.count()));
-  set(CURLOPT_LOW_SPEED_LIMIT, 1L);
-  set(CURLOPT_LOW_SPEED_TIME, static_cast<long>(options.noProgress.count()));
   set(CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_2));
   // The certificates were parsed once; the library would read its own file for every connection.
   set(CURLOPT_CAINFO, static_cast<char*>(nullptr));
   set(CURLOPT_CAPATH, static_cast<char*>(nullptr));
   set(CURLOPT_SSL_CTX_FUNCTION, &CurlTransfer::onTls);
   set(CURLOPT_SSL_CTX_DATA, context_.certificates);
+  set(CURLOPT_PREREQFUNCTION, &CurlTransfer::onConnected);
+  set(CURLOPT_PREREQDATA, this);
+  set(CURLOPT_NOPROGRESS, 0L);
+  set(CURLOPT_XFERINFOFUNCTION, &CurlTransfer::onProgress);
+  set(CURLOPT_XFERINFODATA, this);
   set(CURLOPT_WRITEFUNCTION, &CurlTransfer::onBody);
   set(CURLOPT_WRITEDATA, this);
   set(CURLOPT_HEADERFUNCTION, &CurlTransfer::onHeader);
@@ -138,6 +143,20 @@ CURLcode CurlTransfer::onTls(CURL* /*easy*/, void* context, void* certificates) 
   return CURLE_OK;
 }
 
+// Comes before a hop's first byte, on a new connection as on a kept one.
+int CurlTransfer::onConnected(void* self, char* /*remote*/, char* /*local*/, int /*remotePort*/,
+                              int /*localPort*/) {
+  static_cast<CurlTransfer*>(self)->noteMoved();
+  return CURL_PREREQFUNC_OK;
+}
+
+int CurlTransfer::onProgress(void* self, curl_off_t /*downTotal*/, curl_off_t /*down*/,
+                             curl_off_t /*upTotal*/, curl_off_t up) {
+  auto* const transfer = static_cast<CurlTransfer*>(self);
+  if (up != std::exchange(transfer->sent_, up)) transfer->noteMoved();
+  return 0;
+}
+
 size_t CurlTransfer::onBody(char* bytes, size_t size, size_t count, void* self) {
   return static_cast<CurlTransfer*>(self)->receiveBody({bytes, size * count});
 }
@@ -148,6 +167,7 @@ size_t CurlTransfer::onHeader(char* bytes, size_t size, size_t count, void* self
 
 // The callbacks refuse by taking fewer bytes than they were offered.
 size_t CurlTransfer::receiveBody(std::string_view bytes) {
+  noteMoved();
   const HttpClientOptions& options = context_.options;
   if (bytes.size() > options.maxAnswerBytes - data_.size()) {
     refusal_ = Error(kHttpErrorDomain, CURLE_FILESIZE_EXCEEDED,
@@ -166,6 +186,7 @@ size_t CurlTransfer::receiveBody(std::string_view bytes) {
 }
 
 size_t CurlTransfer::receiveHeader(std::string_view line) {
+  noteMoved();
   headerBytes_ += line.size();
   if (headerBytes_ > context_.options.maxHeaderBytes) {
     refusal_ = Error(

@@ -8,6 +8,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -45,6 +46,8 @@ class CurlTransfer {
   // Prepares a handle for the request as it stands; comes before every hop.
   MaybeError begin(CurlEasy easy);
   CURL* handle() const { return easy_.get(); }
+  // When a byte of the hop last moved in either direction; nothing while it waits for its connection.
+  std::optional<std::chrono::steady_clock::time_point> lastMoved() const { return moved_; }
 
   // After a hop ended well by the library's account: whether its headers came whole. The library takes a
   // connection that closes between two headers for a complete answer.
@@ -76,6 +79,9 @@ class CurlTransfer {
 
   size_t receiveBody(std::string_view bytes);
   size_t receiveHeader(std::string_view line);
+  void noteMoved() { moved_ = std::chrono::steady_clock::now(); }
+  static int onConnected(void* self, char* remote, char* local, int remotePort, int localPort);
+  static int onProgress(void* self, curl_off_t downTotal, curl_off_t down, curl_off_t upTotal, curl_off_t up);
   static size_t onBody(char* bytes, size_t size, size_t count, void* self);
   static size_t onHeader(char* bytes, size_t size, size_t count, void* self);
   static CURLcode onTls(CURL* easy, void* context, void* certificates);
@@ -90,6 +96,8 @@ class CurlTransfer {
   CURLcode setUp_ = CURLE_OK;
   std::array<char, CURL_ERROR_SIZE> errorText_{};
   size_t redirects_ = 0;
+  std::optional<std::chrono::steady_clock::time_point> moved_;
+  curl_off_t sent_ = 0;
 
   std::vector<HttpHeader> headers_;
   size_t headerBytes_ = 0;
