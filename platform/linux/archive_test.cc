@@ -184,6 +184,19 @@ TEST(ArchiveTest, WhatIsWrittenCanBeReadUnderTheSameLimits) {
   EXPECT_EQ(*back, Value(dictionaries));
 }
 
+TEST(ArchiveTest, WhoStoresEqualObjectsOftenIsReadUnderTheSameLimits) {
+  Array objects;
+  Array all;
+  for (int i = 0; i < 999; ++i) {
+    objects.append(dictionaryObject({}, {}));
+    all.append(i);
+  }
+  objects.append(all);
+  const auto back = unarchiveObject(archiveOf(objects, 999), {.values = 1000});
+  ASSERT_TRUE(static_cast<bool>(back)) << back.error().description();
+  EXPECT_EQ(back->array()->size(), 999U);
+}
+
 // --- what cannot be read ---
 
 TEST(ArchiveTest, ForeignBytesAreNoArchive) {
