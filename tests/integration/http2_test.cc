@@ -1,0 +1,111 @@
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <condition_variable>
+#include <map>
+#include <mutex>
+#include <sstream>
+
+#include "platform/fake/fake_log.h"
+#include "platform/linux/curl_http_client.h"
+#include "tests/helpers/child_process.h"
+#include "tests/helpers/programs.h"
+#include "tests/helpers/test_certificates.h"
+
+// The daemon's HTTP client against a server that speaks HTTP/2.
+
+namespace tarnel::test {
+namespace {
+
+class Http2Test : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    const TlsIdentity identity = authority_.issue();
+    folder_.write("certificate.pem", identity.certificatePem);
+    folder_.write("key.pem", identity.keyPem);
+    ProcessOptions options;
+    options.program = "/usr/bin/python3";  // the one that has the system's packages
+    options.arguments = {std::string(kSourceDirectory) + "/tests/integration/http2_server.py",
+                         folder_.path("certificate.pem"), folder_.path("key.pem")};
+    server_ = std::make_unique<ChildProcess>(options);
+    ASSERT_TRUE(server_->waitForOutput("\n")) << server_->errors() << "\nscripts/setup installs python3-h2";
+    std::istringstream(server_->output()) >> port_;
+    HttpClientOptions client;
+    client.extraCertificates = {authority_.certificatePem()};
+    client.longestRequest = std::chrono::seconds(30);
+    client_ = std::make_unique<CurlHttpClient>(log_, client);
+  }
+
+  HttpRequest post(const std::string& path, std::string body) const {
+    HttpRequest request;
+    request.method = "POST";
+    request.url = "https://127.0.0.1:" + std::to_string(port_) + path;
+    request.body = std::make_shared<const std::string>(std::move(body));
+    return request;
+  }
+  // Starts all of them at once; the results in their order.
+  std::vector<HttpResult> perform(const std::vector<HttpRequest>& requests) {
+    std::mutex mutex;
+    std::condition_variable changed;
+    std::map<size_t, HttpResult> results;
+    for (size_t i = 0; i < requests.size(); ++i) {
+      client_->startDataTask(requests[i], [&mutex, &changed, &results, i](HttpResult result) {
+        const std::lock_guard lock(mutex);
+        results.emplace(i, std::move(result));
+        changed.notify_all();
+      });
+    }
+    std::unique_lock lock(mutex);
+    changed.wait(lock, [&results, &requests] { return results.size() == requests.size(); });
+    std::vector<HttpResult> inOrder;
+    for (auto& [i, result] : results) inOrder.push_back(std::move(result));
+    return inOrder;
+  }
+  static void expectAnswer(const HttpResult& result, const std::string& body) {
+    ASSERT_FALSE(result.error) << result.error->description();
+    EXPECT_EQ(result.response->statusCode, 202);
+    ASSERT_NE(result.response->header("X-Connection"), nullptr);
+    EXPECT_EQ(*result.response->header("X-Connection"), "1");
+    EXPECT_TRUE(result.data == "answer to " + body);
+  }
+
+  const TestAuthority authority_{"Test authority"};
+  const TestFolder folder_;
+  fake::FakeLog log_;
+  std::unique_ptr<ChildProcess> server_;
+  unsigned port_ = 0;
+  std::unique_ptr<CurlHttpClient> client_;
+};
+
+TEST_F(Http2Test, PostsShareOneConnectionAndEachGetsItsAnswer) {
+  expectAnswer(perform({post("/", "first")})[0], "first");
+  std::vector<HttpRequest> together;
+  // One answers when all are there, which they only are if they share the connection.
+  for (int i = 0; i < 6; ++i) together.push_back(post("/together/6", "post " + std::to_string(i)));
+  const auto results = perform(together);
+  for (size_t i = 0; i < results.size(); ++i) expectAnswer(results[i], "post " + std::to_string(i));
+}
+
+TEST_F(Http2Test, BodiesOfManyFramesAreCarriedWhole) {
+  expectAnswer(perform({post("/", "")})[0], "");
+  std::vector<HttpRequest> together;
+  std::vector<std::string> bodies;
+  for (const char letter : {'a', 'b', 'c'}) {
+    bodies.emplace_back(300000, letter);
+    together.push_back(post("/together/3", bodies.back()));
+  }
+  const auto results = perform(together);
+  for (size_t i = 0; i < results.size(); ++i) expectAnswer(results[i], bodies[i]);
+}
+
+TEST_F(Http2Test, AStreamThatFailsCostsNoOther) {
+  expectAnswer(perform({post("/", "first")})[0], "first");
+  const auto results =
+      perform({post("/together/2", "one"), post("/reset", "lost"), post("/together/2", "two")});
+  expectAnswer(results[0], "one");
+  EXPECT_TRUE(results[1].error);
+  expectAnswer(results[2], "two");
+}
+
+}  // namespace
+}  // namespace tarnel::test
