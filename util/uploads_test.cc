@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <barrier>
 #include <thread>
 
 #include "platform/fake/fake_client_files.h"
@@ -58,6 +59,24 @@ TEST_F(UploadsTest, WhoWaitsGetsItsTurnInOrder) {
   small.join();
   EXPECT_EQ(turns, 2);
   EXPECT_EQ(uploads.waiting(), 0U);
+}
+
+TEST_F(UploadsTest, ThoseBehindComeInAsSoonAsThereIsRoomForAll) {
+  Uploads uploads(files, limits(std::chrono::hours(1)));
+  for (int round = 0; round < 50; ++round) {
+    auto all = uploads.enter(10);
+    std::barrier bothAreIn(2);
+    const auto enter = [&uploads, &bothAreIn] {
+      const auto place = uploads.enter(5);
+      bothAreIn.arrive_and_wait();
+    };
+    std::thread first(enter);
+    std::thread second(enter);
+    while (uploads.waiting() < 2) std::this_thread::yield();
+    all.reset();
+    first.join();
+    second.join();
+  }
 }
 
 TEST_F(UploadsTest, OneThatGivesUpLetsTheNextGo) {
