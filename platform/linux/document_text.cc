@@ -1,7 +1,12 @@
+#include <algorithm>
+#include <charconv>
 #include <cmath>
+#include <cstdint>
 #include <limits>
+#include <optional>
 #include <string>
 #include <string_view>
+#include <system_error>
 
 #include "platform/cryptography.h"
 #include "platform/document.h"
@@ -19,6 +24,37 @@ namespace {
 constexpr std::string_view kDateKey = "$date";
 constexpr std::string_view kDataKey = "$data";
 
+// Whether a number that no double holds is too large, as opposed to too close to zero.
+bool isTooLarge(std::string_view number) {
+  const size_t end = std::min(number.find_first_of("eE"), number.size());
+  const std::string_view digits = number.substr(0, end);
+  const size_t point = std::min(digits.find('.'), digits.size());
+  const size_t first = digits.find_first_of("123456789");  // not being zero, it has one
+  std::string_view exponent = number.substr(std::min(end + 1, number.size()));
+  const bool isNegative = exponent.starts_with('-');
+  if (isNegative || exponent.starts_with('+')) exponent.remove_prefix(1);
+  uint32_t power = 0;
+  const auto result = std::from_chars(exponent.data(), exponent.data() + exponent.size(), power);
+  if (result.ec == std::errc::result_out_of_range) power = std::numeric_limits<uint32_t>::max();
+  const auto place = static_cast<int64_t>(point) - static_cast<int64_t>(first);
+  return place + (isNegative ? -int64_t{power} : int64_t{power}) > 0;
+}
+
+// A number in JSON's own notation; nothing when no double is as large.
+std::optional<Value> numberOf(std::string_view text) {
+  const char* const end = text.data() + text.size();
+  if (text.find_first_of(".eE") == std::string_view::npos) {
+    int64_t number = 0;
+    if (std::from_chars(text.data(), end, number).ec == std::errc()) return number;
+    uint64_t large = 0;
+    if (std::from_chars(text.data(), end, large).ec == std::errc()) return large;
+  }
+  double real = 0;
+  if (std::from_chars(text.data(), end, real).ec == std::errc()) return real;
+  if (isTooLarge(text)) return std::nullopt;
+  return text.starts_with('-') ? -0.0 : 0.0;
+}
+
 // What the reader calls for every item of the text; false ends the reading.
 class TextHandler {
  public:
@@ -26,12 +62,17 @@ class TextHandler {
 
   bool Null() { return builder_.add(Value()); }
   bool Bool(bool value) { return builder_.add(value); }
-  bool Int(int value) { return builder_.add(value); }
-  bool Uint(unsigned value) { return builder_.add(value); }
-  bool Int64(int64_t value) { return builder_.add(value); }
-  bool Uint64(uint64_t value) { return builder_.add(value); }
-  bool Double(double value) { return builder_.add(value); }
-  bool RawNumber(const char*, rapidjson::SizeType, bool) { return false; }
+  // Never called: numbers come as their texts.
+  bool Int(int) { return false; }
+  bool Uint(unsigned) { return false; }
+  bool Int64(int64_t) { return false; }
+  bool Uint64(uint64_t) { return false; }
+  bool Double(double) { return false; }
+  bool RawNumber(const char* text, rapidjson::SizeType length, bool) {
+    auto number = numberOf({text, length});
+    if (!number) return builder_.fail(kDocumentMalformed, "Number too big to be stored in double");
+    return builder_.add(*std::move(number));
+  }
   bool String(const char* text, rapidjson::SizeType length, bool) {
     return builder_.add(std::string(text, length));
   }
@@ -134,7 +175,8 @@ Result<Value> parseTextDocument(std::string_view bytes, const DocumentLimits& li
   rapidjson::Reader reader;
   DocumentBuilder builder(limits);
   TextHandler handler(builder);
-  constexpr unsigned kFlags = rapidjson::kParseIterativeFlag | rapidjson::kParseFullPrecisionFlag;
+  // Numbers are read here: the library makes large ones of 0e308 and 1.8e308.
+  constexpr unsigned kFlags = rapidjson::kParseIterativeFlag | rapidjson::kParseNumbersAsStringsFlag;
   const auto result = reader.Parse<kFlags>(stream, handler);
   if (result.IsError()) {
     if (!builder.failed()) {

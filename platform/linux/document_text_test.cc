@@ -73,6 +73,22 @@ TEST(TextDocumentTest, keepsIntegersThatFitAndMakesTheRestDoubles) {
   EXPECT_THAT(refusal("1e999"), HasSubstr("at byte 0"));
 }
 
+TEST(TextDocumentTest, readsNumbersAtTheEndsOfTheRange) {
+  for (const char* zero :
+       {"0e308", "0.0E116", "0e-999", "1e-400", "2e-324", "0.0001e-321", "10e-99999999999999999999"}) {
+    EXPECT_EQ(parsed(zero), Value(0.0)) << zero;
+    const auto negative = parsed("-" + std::string(zero));
+    ASSERT_NE(negative.real(), nullptr) << zero;
+    EXPECT_TRUE(*negative.real() == 0 && std::signbit(*negative.real())) << zero;
+  }
+  EXPECT_EQ(parsed("0." + std::string(400, '0') + "1e5"), Value(0.0));
+  EXPECT_EQ(parsed("3e-324"), Value(5e-324));
+  EXPECT_EQ(parsed("1.7976931348623157e308"), Value(std::numeric_limits<double>::max()));
+  for (const std::string large : {"1.8e308", "1.7976931348623159e+308", "1000e306", "-2E308"}) {
+    EXPECT_EQ(refusal("[1, " + large + "]"), "Number too big to be stored in double at byte 4") << large;
+  }
+}
+
 TEST(TextDocumentTest, letsTheLastOfEqualKeysWin) {
   EXPECT_EQ(parsed(R"({"a": 1, "b": 2, "a": 3})"), Value(Dictionary{{"a", 3}, {"b", 2}}));
 }

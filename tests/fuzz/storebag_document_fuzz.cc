@@ -92,6 +92,10 @@ bool isPlainJson(const Value& value) {
   return plain;
 }
 
+void requireFinite(const Value& leaf) {
+  require(leaf.real() == nullptr || std::isfinite(*leaf.real()), "the text form has finite numbers alone");
+}
+
 // Dates and data are dictionaries in the text form, one level deeper and two items more.
 constexpr DocumentLimits kRoomy{.bytes = 64U << 20U, .depth = 40, .values = 4U << 20U};
 
@@ -149,7 +153,9 @@ std::optional<Value> checkedDocument(std::string_view bytes) {
     reached("malformed");
     return std::nullopt;
   }
-  reached(static_cast<uint8_t>(bytes.front()) < 0x80 ? "text document" : "binary document");
+  const bool isText = static_cast<uint8_t>(bytes.front()) < 0x80 || bytes.front() == '\xEF';
+  if (isText) visitLeaves(*whole, requireFinite);
+  reached(isText ? "text document" : "binary document");
   const auto depth = depthOf(*whole);
   require(depth <= DocumentLimits().depth, "no deeper than allowed");
   if (depth > 16) reached("deep");
@@ -322,8 +328,9 @@ void checkWithoutServer(const Fetched& fetched, const Serving& serving) {
   if (expected) reached("built-in storebag");
 }
 
-void checkHeaders(const Fetched& fetched, const Serving& serving) {
-  const bool expected = serving.mode == 'n' && serving.lastModified;
+void checkHeaders(const Fetched& fetched, const Serving& serving, std::string_view document) {
+  const bool isEmpty = serving.mode == 'n' || (serving.mode == 'o' && document.empty());
+  const bool expected = isEmpty && serving.lastModified;
   require(fetched.notModified == expected, "not modified is an empty body with the header");
   if (fetched.notModified) {
     reached("not modified");
@@ -369,7 +376,7 @@ void checkFetch(const Serving& serving, std::string_view document, const std::op
   }
   // A refresh cycle or an exception's record stands in for the header's age.
   if (fetched.section && findNumber(*parsed->dictionary(), "refresh_cycle") != nullptr) return;
-  checkHeaders(fetched, serving);
+  checkHeaders(fetched, serving, document);
 }
 
 }  // namespace
@@ -378,7 +385,14 @@ void runOne(std::span<const uint8_t> input) {
   InputReader reader(input);
   const Serving serving(reader);
   const auto document = reader.rest();
-  checkFetch(serving, document, checkedDocument(document));
+  const auto parsed = checkedDocument(document);
+  // Signing takes longer than all the rest; of what is no storebag anyway, a part is enough.
+  const bool isStorebag = parsed && parsed->dictionary() != nullptr;
+  constexpr std::string_view kWithoutSigning = "eno";
+  if (isStorebag || document.size() % 8 == 0 ||
+      kWithoutSigning.find(serving.mode) != std::string_view::npos) {
+    checkFetch(serving, document, parsed);
+  }
 }
 
 }  // namespace tarnel::fuzz
