@@ -29,23 +29,26 @@ Dictionary dictionaryFrom(InputReader& input, size_t depth) {
 
 }  // namespace
 
-bool same(const Value& a, const Value& b) {
+bool same(const Value& a, const Value& b, double tolerance) {
   if (a.type() != b.type()) return false;
   if (a.real() != nullptr) return sameReal(*a.real(), *b.real());
   if (a.date() != nullptr) {
     const double one = a.date()->seconds;
     const double other = b.date()->seconds;
-    return one == other || (std::isnan(one) && std::isnan(other));
+    return one == other || std::fabs(one - other) <= tolerance || (std::isnan(one) && std::isnan(other));
   }
   if (const auto* array = a.array()) {
-    return std::equal(array->begin(), array->end(), b.array()->begin(), b.array()->end(), same);
+    return std::equal(
+        array->begin(), array->end(), b.array()->begin(), b.array()->end(),
+        [tolerance](const Value& one, const Value& other) { return same(one, other, tolerance); });
   }
   if (const auto* dictionary = a.dictionary()) {
     return dictionary->size() == b.dictionary()->size() &&
-           std::all_of(dictionary->begin(), dictionary->end(), [&b](const Dictionary::Entry& entry) {
-             const auto* other = b.dictionary()->find(entry.first);
-             return other != nullptr && same(entry.second, *other);
-           });
+           std::all_of(dictionary->begin(), dictionary->end(),
+                       [&b, tolerance](const Dictionary::Entry& entry) {
+                         const auto* other = b.dictionary()->find(entry.first);
+                         return other != nullptr && same(entry.second, *other, tolerance);
+                       });
   }
   return a == b;
 }

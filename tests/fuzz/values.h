@@ -9,8 +9,9 @@
 
 namespace tarnel::fuzz {
 
-// Equal in kind and content: unlike with ==, not-a-number is the same as itself, and -0.0 is not 0.0.
-bool same(const Value& a, const Value& b);
+// Equal in kind and content: unlike with ==, not-a-number is the same as itself, and -0.0 is not 0.0. Dates
+// may be so many seconds apart.
+bool same(const Value& a, const Value& b, double tolerance = 0);
 
 // All values and keys, each as often as it occurs.
 size_t countOf(const Value& value);
