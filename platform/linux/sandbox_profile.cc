@@ -21,6 +21,17 @@ struct Family {
 constexpr std::array kFamilies{Family{"unix", AF_UNIX}, Family{"inet", AF_INET}, Family{"inet6", AF_INET6},
                                Family{"netlink", AF_NETLINK}};
 
+// A path with such a part opens more than it seems to.
+bool hasDots(std::string_view path) {
+  for (size_t start = 0; start <= path.size();) {
+    const size_t end = std::min(path.find('/', start), path.size());
+    const std::string_view part = path.substr(start, end - start);
+    if (part == "." || part == "..") return true;
+    start = end + 1;
+  }
+  return false;
+}
+
 class ProfileReader {
  public:
   ProfileReader(const std::string& path, const SandboxVariables& variables)
@@ -28,7 +39,7 @@ class ProfileReader {
 
   Result<SandboxProfile> read(const TomlNode& document) {
     for (const auto& [section, table] : document.entries) {
-      if (table.kind != TomlNode::Kind::table) {
+      if (table.kind != TomlNode::Kind::table || !isSection(section)) {
         refuse(table, "unknown key " + section);
         continue;
       }
@@ -52,6 +63,10 @@ class ProfileReader {
     if (name == "network.connect_tcp") profile_.connectTcp.emplace();
     for (const TomlNode& element : node.elements) readElement(name, element);
     if (!isKnown(name)) refuse(node, "unknown key " + name);
+  }
+
+  static bool isSection(std::string_view name) {
+    return name == "files" || name == "network" || name == "calls";
   }
 
   static bool isKnown(std::string_view name) {
@@ -83,6 +98,14 @@ class ProfileReader {
     const std::string* text = element.scalar.string();
     if (text == nullptr) {
       refuse(element, "a path must be a text");
+      return;
+    }
+    if (text->find('\0') != std::string::npos) {
+      refuse(element, "a path must hold no zero character");
+      return;
+    }
+    if (hasDots(*text)) {
+      refuse(element, "\"" + *text + "\" must have no \".\" and no \"..\" between slashes");
       return;
     }
     std::string path = *text;
