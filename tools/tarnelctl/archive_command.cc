@@ -64,11 +64,10 @@ std::string problem(const std::string& bytes, const Error& error) {
            "as it was received";
   }
   if (error.code() == kArchiveTooLarge) {
-    return "it comes to more than a log data upload may hold (" + error.localizedDescription() +
-           "): it is none of the daemon's";
+    return "it is more than a log data upload may hold: " + error.localizedDescription();
   }
   return "the archive is incomplete, damaged or of another version (" + error.localizedDescription() +
-         "): fetch it anew";
+         "): fetch it anew if it was cut short";
 }
 
 }  // namespace

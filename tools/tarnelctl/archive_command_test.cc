@@ -139,7 +139,7 @@ TEST_F(ArchiveCommandTest, EveryTruncationIsSaidToBeDamage) {
     EXPECT_EQ(show(file(whole.substr(0, length))), ExitStatus::failed) << length;
     EXPECT_THAT(err_.str(), HasSubstr("the archive is incomplete, damaged or of another version ("))
         << length;
-    EXPECT_THAT(err_.str(), EndsWith("): fetch it anew\n")) << length;
+    EXPECT_THAT(err_.str(), EndsWith("): fetch it anew if it was cut short\n")) << length;
   }
   EXPECT_EQ(show(file(whole + "x")), ExitStatus::failed);
   EXPECT_THAT(err_.str(), HasSubstr("bytes after the document"));
@@ -149,8 +149,8 @@ TEST_F(ArchiveCommandTest, AnArchiveThatComesToTooMuchIsRefused) {
   Value value = Array{1, 2};
   for (int i = 0; i < 10; ++i) value = Array{value, value};
   EXPECT_EQ(show(file(archive(value)), false, {.values = 100}), ExitStatus::failed);
-  EXPECT_THAT(err_.str(), HasSubstr("it comes to more than a log data upload may hold ("));
-  EXPECT_THAT(err_.str(), EndsWith("100 values): it is none of the daemon's\n"));
+  EXPECT_THAT(err_.str(), HasSubstr(": it is more than a log data upload may hold: "));
+  EXPECT_THAT(err_.str(), HasSubstr("more than 100 values"));
 }
 
 TEST(ReadableTextTest, ScalarsAreTold) {
