@@ -93,6 +93,10 @@ std::string LabProcess::text(std::string_view key) const {
   return textIn(started_, key);
 }
 
+int64_t LabProcess::number(std::string_view key) const {
+  return numberIn(started_, key);
+}
+
 uint16_t LabProcess::controlPort() const {
   const std::string control = text("controlURL");
   return static_cast<uint16_t>(std::stoul(control.substr(control.rfind(':') + 1)));
@@ -138,6 +142,7 @@ void LabProcess::reset() {
   postsSeen_ = readWholeFile(text("postsFile")).size();
   uploadsSeen_ = readWholeFile(text("uploadsFile")).size();
   logDataSeen_ = readWholeFile(text("logDataFile")).size();
+  datagramsSeen_ = readWholeFile(text("datagramsFile")).size();
 }
 
 std::string LabProcess::eventLines() const {
@@ -158,6 +163,10 @@ std::vector<Dictionary> LabProcess::uploads() const {
 
 std::vector<Dictionary> LabProcess::logData() const {
   return recordsIn(readWholeFile(text("logDataFile")).substr(logDataSeen_));
+}
+
+std::vector<Dictionary> LabProcess::datagrams() const {
+  return recordsIn(readWholeFile(text("datagramsFile")).substr(datagramsSeen_));
 }
 
 bool LabProcess::waitUntil(const std::function<bool(const std::vector<Dictionary>&)>& holds) const {

@@ -32,6 +32,7 @@ class LabProcess {
   std::string realtimeURL() const { return text("realtimeURL"); }
   std::string uploadURL() const { return text("uploadURL"); }
   std::string logDataURL() const { return text("logDataURL"); }
+  uint16_t datagramPort() const { return static_cast<uint16_t>(number("datagramPort")); }
   std::string bundle() const { return text("bundle"); }
   std::string authorityPem() const { return readWholeFile(text("caFile")); }
   std::string storebagFolder() const { return text("storebagFolder"); }
@@ -56,9 +57,10 @@ class LabProcess {
   std::vector<Dictionary> events() const;
   // Posts with "problems" and without "event".
   std::vector<Dictionary> posts() const;
-  // Files and log data that arrived since then, a record each.
+  // Files, log data and datagrams that arrived since then, a record each.
   std::vector<Dictionary> uploads() const;
   std::vector<Dictionary> logData() const;
+  std::vector<Dictionary> datagrams() const;
   // Waits until as many events have arrived; a failure of the test when they do not. What there is then, in
   // the order in which it was posted.
   std::vector<Dictionary> waitForEvents(size_t count) const;
@@ -72,6 +74,7 @@ class LabProcess {
 
  private:
   std::string text(std::string_view key) const;
+  int64_t number(std::string_view key) const;
   uint16_t controlPort() const;
 
   TestFolder folder_;
@@ -81,6 +84,7 @@ class LabProcess {
   size_t postsSeen_ = 0;
   size_t uploadsSeen_ = 0;
   size_t logDataSeen_ = 0;
+  size_t datagramsSeen_ = 0;
 };
 
 // The event inside an arrival.

@@ -62,6 +62,20 @@ void addMessage(const Arrival& arrival, Dictionary& record) {
 
 }  // namespace
 
+std::string_view nameOf(DatagramAnswer answer) {
+  switch (answer) {
+    case DatagramAnswer::nothing:
+      return "nothing";
+    case DatagramAnswer::acknowledged:
+      return "acknowledged";
+    case DatagramAnswer::dropped:
+      return "dropped";
+    case DatagramAnswer::acknowledgementDropped:
+      return "acknowledgement dropped";
+  }
+  return "";
+}
+
 Array listOf(const std::vector<std::string>& problems) {
   Array list;
   for (const std::string& problem : problems) list.append(problem);
@@ -134,7 +148,7 @@ Dictionary recordOfLogData(const LogDataArrival& arrival, bool withRecords) {
 
 Dictionary recordOfDatagram(const DatagramArrival& arrival) {
   Dictionary record = {{"datagram", arrival.number},       {"arrived", arrival.arrived},
-                       {"sender", arrival.sender},         {"answered", arrival.answered},
+                       {"sender", arrival.sender},         {"answered", std::string(nameOf(arrival.answer))},
                        {"repetition", arrival.repetition}, {"size", arrival.size}};
   if (arrival.content) {
     addContent(*arrival.content, record);

@@ -3,6 +3,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "platform/base/value.h"
@@ -47,20 +48,20 @@ struct LogDataArrival : HttpArrival {
   Array records;
 };
 
-inline constexpr char kAcknowledged[] = "acknowledged";
-inline constexpr char kNothingAnswered[] = "nothing";
+// What was done about a datagram; the last two on purpose.
+enum class DatagramAnswer { nothing, acknowledged, dropped, acknowledgementDropped };
 
 // One datagram.
 struct DatagramArrival {
   uint64_t number = 0;
   double arrived = 0;
   std::string sender;
-  std::vector<uint8_t> bytes;                // as they came; at most a few more than may be
-  uint64_t size = 0;                         // of what came
+  std::vector<uint8_t> bytes;                // its first kMaxDatagramBytes + 1
+  uint64_t size = 0;                         // of the whole one
   std::optional<DashboardDatagram> content;  // nothing when it is malformed
   uint64_t repetition = 1;                   // how often this message has come, with this time
   std::vector<std::string> problems;
-  std::string answered;  // one of the two above, or what was done on purpose
+  DatagramAnswer answer = DatagramAnswer::nothing;
 };
 
 // Is told of every arrival, in their order. Threads: one call at a time, on any thread.
@@ -75,6 +76,9 @@ class ArrivalObserver {
   virtual void logDataArrived(const LogDataArrival&) {}
   virtual void datagramArrived(const DatagramArrival&) {}
 };
+
+// "nothing", "acknowledged", "dropped", "acknowledgement dropped".
+std::string_view nameOf(DatagramAnswer answer);
 
 // As texts of an array.
 Array listOf(const std::vector<std::string>& problems);

@@ -51,8 +51,16 @@ void ArrivalStore::addDatagram(DatagramArrival arrival) {
   arrival.number = ++datagramNumber_;
   ++counts_.datagrams;
   counts_.datagramsWithProblems += oneIf(!arrival.problems.empty());
+  counts_.acknowledged += oneIf(arrival.answer == DatagramAnswer::acknowledged);
+  counts_.dropped += oneIf(arrival.answer == DatagramAnswer::dropped);
+  counts_.acknowledgementsDropped += oneIf(arrival.answer == DatagramAnswer::acknowledgementDropped);
   for (ArrivalObserver* observer : observers_) observer->datagramArrived(arrival);
   datagrams_.add(std::move(arrival), kDescriptionBytes);
+}
+
+void ArrivalStore::countDatagramOverLimit() {
+  const std::lock_guard lock(mutex_);
+  ++counts_.datagramsOverLimit;
 }
 
 std::vector<Arrival> ArrivalStore::last(size_t count) const {

@@ -23,6 +23,10 @@ struct ArrivalCounts {
   uint64_t logRecords = 0;
   uint64_t datagrams = 0;
   uint64_t datagramsWithProblems = 0;
+  uint64_t datagramsOverLimit = 0;  // came too fast; not among the datagrams
+  uint64_t acknowledged = 0;
+  uint64_t dropped = 0;                  // on purpose
+  uint64_t acknowledgementsDropped = 0;  // on purpose
 };
 
 // The newest of one kind: at most so many, and so many bytes of them. Threads: one at a time.
@@ -81,6 +85,7 @@ class ArrivalStore {
   void addUpload(UploadArrival arrival);
   void addLogData(LogDataArrival arrival);
   void addDatagram(DatagramArrival arrival);
+  void countDatagramOverLimit();
 
   // The newest, oldest of them first.
   std::vector<Arrival> last(size_t count) const;

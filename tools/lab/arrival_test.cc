@@ -92,6 +92,76 @@ TEST(ArrivalStoreTest, KeepsTheNewestByCountAndByBytes) {
   EXPECT_THAT(none.last(9), SizeIs(0));
 }
 
+TEST(ArrivalStoreTest, KindsAreNumberedKeptAndCountedApart) {
+  ArrivalStore store(2);
+  for (uint64_t i = 1; i <= 3; ++i) {
+    store.add(arrivalOf(1));
+    UploadArrival upload;
+    upload.plainBytes = 10;
+    upload.problems = {"p"};
+    store.addUpload(upload);
+    LogDataArrival logData;
+    logData.records = {1, 2};
+    store.addLogData(logData);
+    DatagramArrival datagram;
+    datagram.answer = i == 1 ? DatagramAnswer::dropped : DatagramAnswer::acknowledgementDropped;
+    store.addDatagram(datagram);
+    EXPECT_EQ(store.last(1).at(0).number, i);
+    EXPECT_EQ(store.lastUploads(1).at(0).number, i);
+    EXPECT_EQ(store.lastLogData(1).at(0).number, i);
+    EXPECT_EQ(store.lastDatagrams(1).at(0).number, i);
+  }
+  EXPECT_THAT(store.lastUploads(9), SizeIs(2));
+  EXPECT_THAT(store.lastLogData(9), SizeIs(2));
+  EXPECT_THAT(store.lastDatagrams(9), SizeIs(2));
+  const ArrivalCounts counts = store.counts();
+  EXPECT_EQ(counts.uploads, 3U);
+  EXPECT_EQ(counts.uploadsWithProblems, 3U);
+  EXPECT_EQ(counts.uploadBytes, 30U);
+  EXPECT_EQ(counts.logArchives, 3U);
+  EXPECT_EQ(counts.logArchivesWithProblems, 0U);
+  EXPECT_EQ(counts.logRecords, 6U);
+  EXPECT_EQ(counts.datagrams, 3U);
+  EXPECT_EQ(counts.dropped, 1U);
+  EXPECT_EQ(counts.acknowledgementsDropped, 2U);
+  store.clear();
+  EXPECT_EQ(store.counts().uploads, 0U);
+  EXPECT_THAT(store.lastUploads(9), SizeIs(0));
+  EXPECT_THAT(store.lastLogData(9), SizeIs(0));
+  EXPECT_THAT(store.lastDatagrams(9), SizeIs(0));
+}
+
+TEST(ArrivalRecords, UploadsAndLogData) {
+  UploadArrival upload;
+  upload.number = 4;
+  upload.arrived = 5.5;
+  upload.path = "/u";
+  upload.sender = "s";
+  upload.query = {.uuid = "id", .filename = "a b.gz"};
+  upload.file = "/lab/uploads/x";
+  upload.gzip = true;
+  upload.wireBytes = 1;
+  upload.plainBytes = 2;
+  upload.answered = "200";
+  EXPECT_EQ(writeTextDocument(recordOfUpload(upload)),
+            "{\"upload\":4,\"arrived\":5.5,\"path\":\"/u\",\"sender\":\"s\",\"answered\":\"200\","
+            "\"headers\":{},\"uuid\":\"id\",\"filename\":\"a b.gz\",\"file\":\"/lab/uploads/x\","
+            "\"wireBytes\":1,\"plainBytes\":2,\"gzip\":true,\"problems\":[]}");
+  LogDataArrival logData;
+  logData.number = 4;
+  logData.arrived = 5.5;
+  logData.path = "/l";
+  logData.location = "there";
+  logData.archiveFile = "a";
+  logData.recordsFile = "a.json";
+  logData.records = {1};
+  EXPECT_EQ(writeTextDocument(recordOfLogData(logData, false)),
+            "{\"logData\":4,\"arrived\":5.5,\"path\":\"/l\",\"sender\":\"\",\"answered\":\"\",\"headers\":{},"
+            "\"location\":\"there\",\"archiveFile\":\"a\",\"recordsFile\":\"a.json\",\"recordCount\":1,"
+            "\"wireBytes\":0,\"problems\":[]}");
+  EXPECT_EQ(*findArray(recordOfLogData(logData, true), "records"), logData.records);
+}
+
 TEST(ArrivalRecords, MethodsAreCountedInNumericOrder) {
   EXPECT_EQ(writeTextDocument(methodCounts(arrivalOf(5).events)), "{\"9\":2,\"10\":3}");
   EXPECT_TRUE(methodCounts(Array{1, Dictionary{{"_method", "x"}}}).empty());
@@ -138,6 +208,28 @@ TEST_F(NdjsonWriterTest, OneLineAnEventAndOneAPostAppended) {
   struct stat status {};
   ASSERT_EQ(::stat((folder_ + "/events.ndjson").c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 0777U, 0600U);
+}
+
+TEST_F(NdjsonWriterTest, OneLineForEachArrivalOfAnotherKind) {
+  NdjsonWriter writer(folder_, notices_);
+  ASSERT_FALSE(writer.open());
+  for (uint64_t i = 1; i <= 2; ++i) {
+    UploadArrival upload;
+    upload.number = i;
+    writer.uploadArrived(upload);
+    LogDataArrival logData;
+    logData.number = i;
+    writer.logDataArrived(logData);
+    DatagramArrival datagram;
+    datagram.number = i;
+    writer.datagramArrived(datagram);
+  }
+  for (const auto& [file, key] : std::vector<std::pair<std::string, std::string>>{
+           {"uploads", "upload"}, {"log-data", "logData"}, {"datagrams", "datagram"}}) {
+    const std::vector<Value> lines = linesOf(folder_ + "/" + file + ".ndjson");
+    ASSERT_THAT(lines, SizeIs(2)) << file;
+    EXPECT_EQ(*lines[1].dictionary()->find(key), Value(2));
+  }
 }
 
 TEST_F(NdjsonWriterTest, AFullFileMakesRoomForTheNext) {

@@ -49,9 +49,9 @@ void Console::datagramArrived(const DatagramArrival& arrival) {
   if (style_ == ConsoleStyle::json) return printRecord("datagram", recordOfDatagram(arrival));
   std::string text = tinted(Tint::dim, clockTime(arrival.arrived)) + "  UDP  " + arrival.sender + "  " +
                      summaryOf(arrival) + "  " + verdict(arrival.problems);
-  if (arrival.answered != kNothingAnswered) {
-    const bool good = arrival.answered == kAcknowledged;
-    text += "  " + tinted(good ? Tint::plain : Tint::bad, arrival.answered);
+  if (arrival.answer != DatagramAnswer::nothing) {
+    const bool good = arrival.answer == DatagramAnswer::acknowledged;
+    text += "  " + tinted(good ? Tint::plain : Tint::bad, std::string(nameOf(arrival.answer)));
   }
   print(output_, text + "\n" + problemLines(arrival.problems));
 }

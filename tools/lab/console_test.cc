@@ -80,11 +80,68 @@ TEST_F(ConsoleTest, WhatIsMissingOrHostileIsStillOneLine) {
   EXPECT_THAT(summaryOf(strange), HasSubstr("(method 0, 1, 2, 3, 4, 5, 6, 7, ...)"));
 }
 
+TEST_F(ConsoleTest, FilesAndLogDataAreOneLineEach) {
+  UploadArrival upload;
+  upload.path = "/v1/uploads";
+  upload.query.filename = "a b.log.gz";
+  upload.query.sequence = "77";
+  upload.file = "/lab/uploads/20261120-142501-0001-a_b.log";
+  upload.gzip = true;
+  upload.wireBytes = 797;
+  upload.plainBytes = 17'200;
+  upload.answered = "refused";
+  LogDataArrival logData;
+  logData.path = "/v1/log-data";
+  logData.records = {Dictionary(), Dictionary()};
+  logData.wireBytes = 340;
+  logData.archiveFile = "/lab/log-data/20261120-142501-0002-records.archive";
+  logData.problems = {"record 2: must be a dictionary"};
+  logData.answered = "200";
+  Console text = console(ConsoleStyle::text);
+  text.uploadArrived(upload);
+  text.logDataArrived(logData);
+  const std::string printed = read(output_);
+  EXPECT_THAT(printed,
+              HasSubstr("  POST /v1/uploads  file \"a b.log.gz\"  session 77  797 B gzip of 17.2 kB  "
+                        "in 20261120-142501-0001-a_b.log  ok  answered: refused\n"));
+  EXPECT_THAT(printed, HasSubstr("  POST /v1/log-data  log data  2 records  340 B  "
+                                 "in 20261120-142501-0002-records.archive  1 problem\n"
+                                 "              ! record 2: must be a dictionary\n"));
+  EXPECT_EQ(summaryOf(UploadArrival()), "file without a name  0 B");
+}
+
+TEST_F(ConsoleTest, DatagramsAreOneLineEach) {
+  DatagramArrival datagram;
+  datagram.sender = "127.0.0.1:5";
+  datagram.size = 68;
+  datagram.content = DashboardDatagram{
+      .clientType = 12, .sessionID = 7, .method = 1, .status = 8, .event = 3, .text = " a=1 b=\033[2J"};
+  datagram.answer = DatagramAnswer::acknowledged;
+  Console text = console(ConsoleStyle::text);
+  text.datagramArrived(datagram);
+  datagram.repetition = 3;
+  datagram.answer = DatagramAnswer::dropped;
+  text.datagramArrived(datagram);
+  datagram.content.reset();
+  datagram.problems = {"no datagram: has 68 bytes, but names 70"};
+  datagram.answer = DatagramAnswer::nothing;
+  text.datagramArrived(datagram);
+  const std::string printed = read(output_);
+  EXPECT_THAT(printed, HasSubstr("  UDP  127.0.0.1:5  client type 12  session 7  event 3  method 1  status 8"
+                                 "  a=1 b=?[2J  ok  acknowledged\n"));
+  EXPECT_THAT(printed, HasSubstr("?[2J  again (3)  ok  dropped\n"));
+  EXPECT_THAT(printed, HasSubstr("  UDP  127.0.0.1:5  68 B  1 problem\n"
+                                 "              ! no datagram: has 68 bytes, but names 70\n"));
+}
+
 TEST_F(ConsoleTest, JsonIsOneObjectALine) {
   Console json = console(ConsoleStyle::json);
   json.started("text", {{"url", "https://127.0.0.1:7"}});
   json.arrived(arrival());
   json.storebagServed({.time = 1, .sender = "s", .name = "a\xff", .version = "1", .status = 200, .bytes = 5});
+  json.uploadArrived({});
+  json.logDataArrived({});
+  json.datagramArrived({});
   json.warning("careful");
   json.ended("bye");
   std::string text = read(output_);
@@ -95,7 +152,8 @@ TEST_F(ConsoleTest, JsonIsOneObjectALine) {
     kinds.push_back(*findString(*line->dictionary(), "kind"));
     text.erase(0, end + 1);
   }
-  EXPECT_THAT(kinds, ::testing::ElementsAre("started", "post", "storebag", "warning", "ended"));
+  EXPECT_THAT(kinds, ::testing::ElementsAre("started", "post", "storebag", "upload", "logData", "datagram",
+                                            "warning", "ended"));
   EXPECT_EQ(read(errors_), "");
 }
 
@@ -103,6 +161,9 @@ TEST_F(ConsoleTest, QuietSaysWarningsOnly) {
   Console quiet = console(ConsoleStyle::quiet);
   quiet.started("text", {});
   quiet.arrived(arrival());
+  quiet.uploadArrived({});
+  quiet.logDataArrived({});
+  quiet.datagramArrived({});
   quiet.storebagServed({});
   quiet.ended("bye");
   quiet.warning("careful");

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <array>
+#include <cerrno>
 
 #include "platform/document.h"
 #include "tools/lab/listener.h"
@@ -112,14 +113,32 @@ HttpAnswer Control::logRecords(const std::string& name) const {
 HttpAnswer Control::misbehave(const HttpRequest& request) {
   if (findParameter(request.query, "clear") != nullptr) {
     parts_.misbehaviours.clear();
+    parts_.datagramFaults.clear();
   } else if (!request.query.empty()) {
-    Result<Misbehaviour> misbehaviour = misbehaviourFromQuery(request.query);
-    if (!misbehaviour) return errorAnswer(400, misbehaviour.error().localizedDescription());
-    if (MaybeError error = parts_.misbehaviours.add(*std::move(misbehaviour))) {
-      return errorAnswer(409, error->localizedDescription());
+    if (MaybeError error = setMisbehaviour(request.query)) {
+      return errorAnswer(error->code() == EBUSY ? 409 : 400, error->localizedDescription());
     }
   }
-  return jsonAnswer({{"misbehaviours", parts_.misbehaviours.description()}});
+  return jsonAnswer({{"misbehaviours", misbehaviours()}});
+}
+
+MaybeError Control::setMisbehaviour(const NameValues& query) {
+  const std::string* target = findParameter(query, "for");
+  if (target != nullptr && *target == "datagrams") {
+    const Result<DatagramFaults::Shares> shares = DatagramFaults::sharesFromQuery(query);
+    if (!shares) return shares.error();
+    parts_.datagramFaults.set(*shares);
+    return std::nullopt;
+  }
+  Result<Misbehaviour> misbehaviour = misbehaviourFromQuery(query);
+  if (!misbehaviour) return misbehaviour.error();
+  return parts_.misbehaviours.add(*std::move(misbehaviour));
+}
+
+Array Control::misbehaviours() const {
+  Array list = parts_.misbehaviours.description();
+  for (const Value& one : parts_.datagramFaults.description()) list.append(one);
+  return list;
 }
 
 }  // namespace tarnel::lab

@@ -3,6 +3,7 @@
 #include <functional>
 
 #include "tools/lab/arrival_store.h"
+#include "tools/lab/datagram_faults.h"
 #include "tools/lab/http_message.h"
 #include "tools/lab/misbehaviour.h"
 
@@ -15,6 +16,7 @@ class Control final : public HttpHandler {
   struct Parts {
     ArrivalStore& store;
     Misbehaviours& misbehaviours;
+    DatagramFaults& datagramFaults;
     std::string logDataFolder;
     std::function<Dictionary()> status;
     std::function<void()> stop;
@@ -24,6 +26,8 @@ class Control final : public HttpHandler {
 
   size_t maxBodyBytes(const HttpRequest&) const override { return kMaxBodyBytes; }
   HttpAnswer answer(const HttpRequest& request) override;
+  // What is set, datagrams with it.
+  Array misbehaviours() const;
   void connectionFailed(const std::string&, const std::string&) override {}
 
  private:
@@ -32,6 +36,7 @@ class Control final : public HttpHandler {
   HttpAnswer list(const HttpRequest& request) const;
   HttpAnswer logRecords(const std::string& name) const;
   HttpAnswer misbehave(const HttpRequest& request);
+  MaybeError setMisbehaviour(const NameValues& query);
 
   const Parts parts_;
 };

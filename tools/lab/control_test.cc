@@ -1,9 +1,11 @@
 #include "tools/lab/control.h"
 
 #include <gmock/gmock.h>
+#include <unistd.h>
 
 #include "platform/document.h"
 #include "tools/lab/test_post.h"
+#include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {
 namespace {
@@ -25,9 +27,11 @@ class ControlTest : public ::testing::Test {
 
   ArrivalStore store_{10};
   Misbehaviours misbehaviours_;
+  DatagramFaults faults_;
   int stops_ = 0;
   Control control_{{.store = store_,
                     .misbehaviours = misbehaviours_,
+                    .datagramFaults = faults_,
                     .logDataFolder = ::testing::TempDir(),
                     .status =
                         [] {
@@ -49,6 +53,53 @@ TEST_F(ControlTest, StatusAndArrivals) {
   EXPECT_EQ(*list[1].dictionary()->find("post"), Value(3));
   EXPECT_EQ(*findArray(*list[1].dictionary(), "events"), (Array{goodEvent(2)}));
   EXPECT_EQ(ask("GET", "/arrivals", {{"last", "x"}}).status, 400);
+}
+
+TEST_F(ControlTest, EveryKindOfArrivalHasItsList) {
+  UploadArrival upload;
+  upload.file = "/lab/uploads/x";
+  store_.addUpload(upload);
+  LogDataArrival logData;
+  logData.records = {Dictionary{{"level", 3}}};
+  store_.addLogData(logData);
+  DatagramArrival datagram;
+  datagram.size = 5;
+  store_.addDatagram(datagram);
+  const auto first = [this](const char* path, const char* key) {
+    const Dictionary answer = document(ask("GET", path, {{"last", "9"}}));
+    const Array& list = *findArray(answer, key);
+    EXPECT_EQ(list.size(), 1U) << path;
+    return *list[0].dictionary();
+  };
+  EXPECT_EQ(*findString(first("/uploads", "uploads"), "file"), "/lab/uploads/x");
+  EXPECT_EQ(*findArray(first("/log-data", "logData"), "records"), logData.records);
+  EXPECT_EQ(*first("/datagrams", "datagrams").find("size"), Value(5));
+  EXPECT_EQ(ask("GET", "/datagrams", {{"last", "x"}}).status, 400);
+  EXPECT_EQ(ask("POST", "/datagrams").status, 404);
+}
+
+TEST_F(ControlTest, LogDataIsShownUnderNamesOfTheLabAlone) {
+  const std::string name = "20261120-142501-0001-records.archive";
+  const std::string path = ::testing::TempDir() + "/" + name + ".json";
+  ASSERT_FALSE(writeFile(path, "[1]", 0600));
+  EXPECT_EQ(ask("GET", "/log-data/" + name).body, "[1]");
+  ::unlink(path.c_str());
+  EXPECT_EQ(ask("GET", "/log-data/" + name).status, 404);
+  for (const char* other : {"", "x", "..", "../posts", "20261120-142501-0001-../x"}) {
+    EXPECT_EQ(ask("GET", std::string("/log-data/") + other).status, 404) << other;
+  }
+}
+
+TEST_F(ControlTest, DatagramsAreLostOnRequest) {
+  const NameValues query = {{"for", "datagrams"}, {"drop", "100"}};
+  EXPECT_EQ(ask("GET", "/misbehave", query).status, 200);
+  EXPECT_EQ(faults_.fateOf("x", 1), DatagramFate::drop);
+  const Array list = *findArray(document(ask("GET", "/misbehave")), "misbehaviours");
+  ASSERT_EQ(list.size(), 1U);
+  EXPECT_EQ(*findString(*list[0].dictionary(), "what"), "100 % dropped");
+  EXPECT_EQ(ask("GET", "/misbehave", {{"for", "datagrams"}, {"status", "503"}}).status, 400);
+  EXPECT_EQ(ask("GET", "/misbehave", {{"clear", "1"}}).status, 200);
+  EXPECT_EQ(faults_.fateOf("x", 1), DatagramFate::deliver);
 }
 
 TEST_F(ControlTest, ClearAndStopTakePostOnly) {

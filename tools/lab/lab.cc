@@ -8,6 +8,7 @@
 #include "platform/document.h"
 #include "tools/lab/arrival_store.h"
 #include "tools/lab/control.h"
+#include "tools/lab/datagram_server.h"
 #include "tools/lab/http_server.h"
 #include "tools/lab/lab_directory.h"
 #include "tools/lab/listener.h"
@@ -24,6 +25,7 @@ namespace {
 constexpr char kControlAddress[] = "127.0.0.1";
 constexpr size_t kControlConnections = 16;
 constexpr size_t kControlBodyBytes = 64U << 10U;
+constexpr uint16_t kDatagramPort = 8445;
 
 std::vector<std::string> servedNames(const std::string& listen) {
   std::vector<std::string> names = {"localhost", "127.0.0.1", "::1"};
@@ -46,6 +48,7 @@ class RunningLab final : public Lab {
         posts_(store_, misbehaviours_, clock),
         uploadedFiles_(directory_.paths.uploads, console, {}),
         logDataFiles_(directory_.paths.logData, console, {}),
+        datagrams_(store_, datagramFaults_, console, clock),
         uploads_(uploadedFiles_, options.maxUploadMiB << 20U, store_, misbehaviours_, clock),
         started_(clock.timeOfDay().seconds) {}
   ~RunningLab() override { stop(); }
@@ -56,6 +59,7 @@ class RunningLab final : public Lab {
   void stop() override {
     if (https_) https_->stop();
     if (controlServer_) controlServer_->stop();
+    if (datagramServer_) datagramServer_->stop();
   }
 
  private:
@@ -78,16 +82,20 @@ class RunningLab final : public Lab {
   PostReceiver posts_;
   StoredFiles uploadedFiles_;
   StoredFiles logDataFiles_;
+  DatagramFaults datagramFaults_;
+  DatagramReceiver datagrams_;
   UploadReceiver uploads_;
   const int64_t started_;
   uint16_t port_ = 0;
   uint16_t controlPort_ = 0;
+  uint16_t datagramPort_ = 0;
   std::unique_ptr<LogDataReceiver> logData_;
   std::unique_ptr<StorebagSource> storebags_;
   std::unique_ptr<Service> service_;
   std::unique_ptr<Control> control_;
   std::unique_ptr<HttpServer> https_;
   std::unique_ptr<HttpServer> controlServer_;
+  std::unique_ptr<DatagramServer> datagramServer_;
 };
 
 MaybeError RunningLab::begin() {
@@ -104,16 +112,21 @@ MaybeError RunningLab::begin() {
   HttpServerOptions forControl;
   forControl.maxConnections = kControlConnections;
   forControl.maxBodyBytes = kControlBodyBytes;
-  // Both are bound before anything is answered: what is served holds the lab's own address.
+  // All are bound before anything is answered: what is served holds the lab's own address.
   Result<ListeningSocket> service = listenOn(options_.listen, options_.port, "--port");
   if (!service) return service.error();
   Result<ListeningSocket> control = listenOn(kControlAddress, options_.controlPort, "--control-port");
   if (!control) return control.error();
+  Result<ListeningSocket> datagrams =
+      receiveOn(options_.listen, effectiveDatagramPort(options_), "--datagram-port");
+  if (!datagrams) return datagrams.error();
+  datagramPort_ = datagrams->port;
   port_ = service->port;
   controlPort_ = control->port;
   makeHandlers();
   https_ = HttpServer::start(forService, *std::move(service), *service_);
   controlServer_ = HttpServer::start(forControl, *std::move(control), *control_);
+  datagramServer_ = DatagramServer::start(*std::move(datagrams), datagrams_, console_);
   tellStart();
   if (options_.readyFile.empty()) return std::nullopt;
   return writeFile(options_.readyFile, writeTextDocument(status(), true) + "\n", 0644);
@@ -136,6 +149,7 @@ void RunningLab::makeHandlers() {
                                        options_.storebagMaxAge);
   control_ = std::make_unique<Control>(Control::Parts{.store = store_,
                                                       .misbehaviours = misbehaviours_,
+                                                      .datagramFaults = datagramFaults_,
                                                       .logDataFolder = directory_.paths.logData,
                                                       .status = [this] { return status(); },
                                                       .stop = [this] { requestStop(); }});
@@ -157,6 +171,8 @@ Dictionary RunningLab::status() const {
           {"realtimeURL", baseURL() + "/v1/realtime"},
           {"uploadURL", baseURL() + "/v1/uploads"},
           {"logDataURL", baseURL() + "/v1/log-data"},
+          {"datagramAddress", ipv4Address(options_.listen)},
+          {"datagramPort", datagramPort_},
           {"controlURL", controlURL()},
           {"directory", directory_.paths.directory},
           {"caFile", directory_.paths.certificates.authority},
@@ -168,6 +184,7 @@ Dictionary RunningLab::status() const {
           {"uploadsFile", directory_.paths.arrivals + "/uploads.ndjson"},
           {"logDataFolder", directory_.paths.logData},
           {"logDataFile", directory_.paths.arrivals + "/log-data.ndjson"},
+          {"datagramsFile", directory_.paths.arrivals + "/datagrams.ndjson"},
           {"process", static_cast<int64_t>(::getpid())},
           {"started", started_},
           {"storebags", names},
@@ -183,7 +200,13 @@ Dictionary RunningLab::status() const {
           {"logArchives", counts.logArchives},
           {"logArchivesWithProblems", counts.logArchivesWithProblems},
           {"logRecords", counts.logRecords},
-          {"misbehaviours", misbehaviours_.description()}};
+          {"datagrams", counts.datagrams},
+          {"datagramsWithProblems", counts.datagramsWithProblems},
+          {"datagramsOverLimit", counts.datagramsOverLimit},
+          {"acknowledged", counts.acknowledged},
+          {"dropped", counts.dropped},
+          {"acknowledgementsDropped", counts.acknowledgementsDropped},
+          {"misbehaviours", control_->misbehaviours()}};
 }
 
 void RunningLab::tellStart() const {
@@ -198,6 +221,8 @@ void RunningLab::tellStart() const {
           "/storebags\n";
   text += "  arrivals    " + directory_.paths.arrivals + "/events.ndjson\n";
   text += "  uploads     " + directory_.paths.uploads + ", log data in " + directory_.paths.logData + "\n";
+  text +=
+      "  datagrams   UDP " + ipv4Address(options_.listen) + " port " + std::to_string(datagramPort_) + "\n";
   text += "  serves      ";
   if (names.empty()) {
     text += "no storebag yet: put inner documents into " + directory_.paths.storebags + "/NAME.json";
@@ -211,6 +236,10 @@ void RunningLab::tellStart() const {
 }
 
 }  // namespace
+
+uint16_t effectiveDatagramPort(const LabOptions& options) {
+  return options.datagramPort.value_or(options.port == 0 ? 0 : kDatagramPort);
+}
 
 Result<std::unique_ptr<Lab>> Lab::start(const LabOptions& options, Console& console, Clock& clock) {
   Result<LabDirectory> directory = openLabDirectory(options.directory, servedNames(options.listen),

@@ -28,12 +28,11 @@ Error listenError(const std::string& address, uint16_t port, const std::string& 
   return Error(kToolErrorDomain, errorNumber, text);
 }
 
-}  // namespace
-
-Result<ListeningSocket> listenOn(const std::string& address, uint16_t port, const std::string& portOption) {
+Result<ListeningSocket> bindTo(const std::string& address, uint16_t port, const std::string& portOption,
+                               int type) {
   addrinfo hints{};
   hints.ai_flags = AI_NUMERICHOST | AI_NUMERICSERV | AI_PASSIVE;
-  hints.ai_socktype = SOCK_STREAM;
+  hints.ai_socktype = type;
   addrinfo* found = nullptr;
   if (::getaddrinfo(address.c_str(), std::to_string(port).c_str(), &hints, &found) != 0 || found == nullptr) {
     return Error(kToolErrorDomain, EINVAL,
@@ -41,13 +40,14 @@ Result<ListeningSocket> listenOn(const std::string& address, uint16_t port, cons
   }
   const std::unique_ptr<addrinfo, decltype(&::freeaddrinfo)> guard(found, ::freeaddrinfo);
   ListeningSocket listening;
-  listening.socket =
-      FileDescriptor(::socket(found->ai_family, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  listening.socket = FileDescriptor(::socket(found->ai_family, type | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
   const int on = 1;
+  const bool stream = type == SOCK_STREAM;
   if (!listening.socket ||
-      ::setsockopt(listening.socket.get(), SOL_SOCKET, SO_REUSEADDR, &on, sizeof on) != 0 ||
+      // For datagrams it would let two programs share the port.
+      (stream && ::setsockopt(listening.socket.get(), SOL_SOCKET, SO_REUSEADDR, &on, sizeof on) != 0) ||
       ::bind(listening.socket.get(), found->ai_addr, found->ai_addrlen) != 0 ||
-      ::listen(listening.socket.get(), kBacklog) != 0) {
+      (stream && ::listen(listening.socket.get(), kBacklog) != 0)) {
     return listenError(address, port, portOption, errno);
   }
   sockaddr_storage bound{};
@@ -58,6 +58,27 @@ Result<ListeningSocket> listenOn(const std::string& address, uint16_t port, cons
   listening.port = ntohs(bound.ss_family == AF_INET6 ? reinterpret_cast<sockaddr_in6*>(&bound)->sin6_port
                                                      : reinterpret_cast<sockaddr_in*>(&bound)->sin_port);
   return listening;
+}
+
+}  // namespace
+
+Result<ListeningSocket> listenOn(const std::string& address, uint16_t port, const std::string& portOption) {
+  return bindTo(address, port, portOption, SOCK_STREAM);
+}
+
+Result<ListeningSocket> receiveOn(const std::string& address, uint16_t port, const std::string& portOption) {
+  Result<ListeningSocket> bound = bindTo(ipv4Address(address), port, portOption, SOCK_DGRAM);
+  if (!bound) return bound;
+  // Room for a burst; as much as the system allows.
+  const int bytes = 1 << 20;
+  ::setsockopt(bound->socket.get(), SOL_SOCKET, SO_RCVBUF, &bytes, sizeof bytes);
+  return bound;
+}
+
+std::string ipv4Address(const std::string& address) {
+  in6_addr v6{};
+  if (::inet_pton(AF_INET6, address.c_str(), &v6) != 1) return address;
+  return IN6_IS_ADDR_UNSPECIFIED(&v6) ? "0.0.0.0" : "127.0.0.1";
 }
 
 bool isLoopbackAddress(const std::string& address) {

@@ -68,7 +68,9 @@ int main(int argc, char** argv) {
   waitForEnd(signals.get(), (*lab)->stopRequestedFd());
   (*lab)->stop();
   const Dictionary status = (*lab)->status();
-  console.ended("ended: " + std::to_string(status.find("posts")->int64Value()) + " posts with " +
-                std::to_string(status.find("events")->int64Value()) + " events received");
+  const auto count = [&status](const char* key) { return std::to_string(status.find(key)->int64Value()); };
+  console.ended("ended: received " + count("events") + " events in " + count("posts") + " posts, " +
+                count("uploads") + " files, " + count("logArchives") + " log archives and " +
+                count("datagrams") + " datagrams");
   return EXIT_SUCCESS;
 }

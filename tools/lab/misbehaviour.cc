@@ -1,6 +1,7 @@
 #include "tools/lab/misbehaviour.h"
 
 #include <algorithm>
+#include <cerrno>
 
 #include "tools/lab/text.h"
 #include "tools/storebag/file_io.h"
@@ -187,7 +188,7 @@ Result<Misbehaviour> misbehaviourFromQuery(const NameValues& query) {
 MaybeError Misbehaviours::add(Misbehaviour misbehaviour) {
   const std::lock_guard lock(mutex_);
   if (entries_.size() >= kLimit) {
-    return Error(kToolErrorDomain, -1, "64 misbehaviours wait already: clear them with clear=1");
+    return Error(kToolErrorDomain, EBUSY, "64 misbehaviours wait already: clear them with clear=1");
   }
   const uint64_t count = misbehaviour.count;
   entries_.push_back({std::move(misbehaviour), count});

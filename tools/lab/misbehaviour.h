@@ -52,7 +52,7 @@ class Misbehaviours {
  public:
   static constexpr size_t kLimit = 64;
 
-  // The error says that kLimit is reached.
+  // The error, EBUSY, says that kLimit is reached.
   MaybeError add(Misbehaviour misbehaviour);
   void clear();
   // The first that is meant for the kind, counted down.

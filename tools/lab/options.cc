@@ -22,6 +22,9 @@ void addOptions(CLI::App& app, LabOptions& options) {
   app.add_option("--control-port", options.controlPort, "port of the control address, 0 for any free one")
       ->check(CLI::Range(0, 65535))
       ->capture_default_str();
+  app.add_option("--datagram-port", options.datagramPort,
+                 "UDP port for datagrams, 0 for any free one [8445, or any free one with --port 0]")
+      ->check(CLI::Range(0, 65535));
   app.add_option("--max-upload", options.maxUploadMiB, "largest file taken, in MiB, packed and unpacked")
       ->check(CLI::Range(1, 1024))
       ->capture_default_str();

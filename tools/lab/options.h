@@ -8,17 +8,21 @@ namespace tarnel::lab {
 
 struct LabOptions {
   std::string directory = "tarnel-lab";
-  std::string listen = "127.0.0.1";  // numeric address
-  uint16_t port = 8443;              // 0: any free one
-  uint16_t controlPort = 8444;       // 0: any free one; always on 127.0.0.1
-  size_t keep = 1000;                // arrivals of each kind in memory
-  uint64_t maxUploadMiB = 64;        // of one file, packed and unpacked
-  int storebagMaxAge = 60;           // seconds, for "Cache-Control"
+  std::string listen = "127.0.0.1";      // numeric address
+  uint16_t port = 8443;                  // 0: any free one
+  uint16_t controlPort = 8444;           // 0: any free one; always on 127.0.0.1
+  std::optional<uint16_t> datagramPort;  // 0: any free one; nothing: see effectiveDatagramPort
+  size_t keep = 1000;                    // arrivals of each kind in memory
+  uint64_t maxUploadMiB = 64;            // of one file, packed and unpacked
+  int storebagMaxAge = 60;               // seconds, for "Cache-Control"
   std::string bundleVersion = "8.0";
   std::string readyFile;  // empty: none
   bool json = false;
   bool quiet = false;
 };
+
+// 8445 unless told otherwise, and any free one beside a free HTTPS port.
+uint16_t effectiveDatagramPort(const LabOptions& options);
 
 struct ParsedOptions {
   LabOptions options;
