@@ -120,8 +120,9 @@ ExitStatus uploadFile(const SendOptions& options, const std::string& path, const
            "daemon's log says which\n";
   } else if (!isDeleted) {
     terminal.err
-        << "tarnelctl: the file is still there: the server did not say that it took it, or this user "
-           "may not delete it; the daemon's log says which\n";
+        << "tarnelctl: the file is still there: the server was not reached or did not say that it "
+           "took it, the file changed meanwhile, or this user may not delete it from its folder; the "
+           "daemon's log says more, with TARNEL_LOG_LEVEL=debug also the server's reply\n";
   }
   return finish(session, options, json, reply.success && isDeleted ? ExitStatus::ok : ExitStatus::failed,
                 terminal);

@@ -3,8 +3,13 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <array>
+#include <filesystem>
 #include <fstream>
+#include <functional>
 #include <latch>
+#include <tuple>
+#include <vector>
 
 #include "platform/linux/ipc/ipc_test_support.h"
 
@@ -131,6 +136,50 @@ TEST_F(IpcFilesTest, WhatChangedMeanwhileIsKept) {
   EXPECT_TRUE(deletions(client).empty());
   EXPECT_TRUE(service.log().contains(
       LogLevel::warning, "ClientFiles: /x was uploaded and is kept: it changed while it was uploaded"));
+}
+
+// Size and time of the last change each tell, down to the nanosecond.
+TEST_F(IpcFilesTest, EverySignOfAChangeKeepsTheFile) {
+  const auto path = write("x", "before");
+  const timespec before{1000, 500};
+  std::function<void()> change;
+  onFile([&change](ClientFile& file) {
+    change();
+    file.requestDeletion();
+  });
+  const auto setTime = [&path](timespec time) {
+    const std::array<timespec, 2> times{timespec{0, UTIME_OMIT}, time};
+    EXPECT_EQ(utimensat(AT_FDCWD, path.c_str(), times.data(), 0), 0);
+  };
+  BusClient client(service.path());
+  for (const auto& [size, time, isKept] : std::vector<std::tuple<off_t, timespec, bool>>{
+           {6, {1000, 500}, false}, {6, {1001, 500}, true}, {6, {1000, 501}, true}, {5, {1000, 500}, true}}) {
+    EXPECT_EQ(truncate(path.c_str(), 6), 0);
+    setTime(before);
+    change = [&path, &setTime, size = size, time = time] {
+      EXPECT_EQ(truncate(path.c_str(), size), 0);
+      setTime(time);
+    };
+    EXPECT_EQ(upload(client, "/x", open(path)), true);
+    EXPECT_EQ(deletions(client).empty(), isKept) << size << ' ' << time.tv_sec << ' ' << time.tv_nsec;
+  }
+}
+
+// A program that the process starts inherits nothing of it.
+TEST_F(IpcFilesTest, NoDescriptorOfAFileIsInheritable) {
+  const auto path = write("x", "x");
+  onFile([&path](ClientFile&) {
+    size_t count = 0;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+      std::error_code gone;
+      if (std::filesystem::read_symlink(entry, gone) != path) continue;
+      ++count;
+      EXPECT_EQ(fcntl(std::stoi(entry.path().filename()), F_GETFD) & FD_CLOEXEC, FD_CLOEXEC);
+    }
+    EXPECT_GE(count, 2U) << "the client's and the daemon's";
+  });
+  BusClient client(service.path());
+  EXPECT_EQ(upload(client, "/x", open(path)), true);
 }
 
 TEST_F(IpcFilesTest, WhatShrinksIsReadAsFarAsItGoes) {
