@@ -95,6 +95,11 @@ class GrantReader {
       refuse(node, key + " must be a text that is not empty");
       return nullptr;
     }
+    // The system would take what stands before it for the whole name.
+    if (text->find('\0') != std::string::npos) {
+      refuse(node, key + " must hold no zero character");
+      return nullptr;
+    }
     return text;
   }
 

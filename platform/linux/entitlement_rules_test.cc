@@ -147,6 +147,8 @@ TEST_F(EntitlementRulesTest, AGrantThatCannotBeUsedIsNamedWithItsLine) {
       {"[[grant]]\nuser = 1\n", ":1: the grant has no entitlement = \"...\""},
       {"[[grant]]\nentitlement = \"\"\nuser = 1\n", ":2: entitlement must be a text that is not empty"},
       {"[[grant]]\nentitlement = \"e\"\nuser = -1\n", ":3: user is no valid number"},
+      {"[[grant]]\nentitlement = \"e\"\ngroup = \"root\\u0000x\"\n", ":3: group must hold no zero character"},
+      {"[[grant]]\nentitlement = \"e\\u0000\"\ngroup = 0\n", ":2: entitlement must hold no zero character"},
       {"[[grant]]\nentitlement = \"e\"\ngroup = \"no such group\"\n",
        ":3: there is no group \"no such group\" on this system; create it and restart the daemon"},
       {"[[grant]]\nentitlement = \"e\"\nuser = 1\nexecutabel = \"/x\"\n", ":4: unknown key executabel"},

@@ -107,7 +107,7 @@ class Run {
     message_ = input.line();
     message_ = message_.substr(0, message_.find('\0'));
     if (!fails('d')) fakes().directories.insert(directory());
-    while (!input.atEnd() && fakes().files.size() < kMostEntries) addEntry(input.line());
+    while (!fails('d') && !input.atEnd() && fakes().files.size() < kMostEntries) addEntry(input.line());
     const Error refused(kFileErrorDomain, EIO, "refused");
     if (fails('l')) fakes().listingError = refused;
     if (fails('c')) fakes().createError = refused;
