@@ -3,6 +3,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <random>
 
 #include "platform/archive.h"
 #include "platform/document.h"
@@ -82,6 +83,20 @@ TEST_F(LabRoadsTest, AFileArrivesUnpackedAndIsDeletedAtTheClient) {
   ASSERT_TRUE(beside);
   EXPECT_EQ(textIn(*beside->dictionary(), "filename"), "a b&c.log.gz");
   instance.expectAlive();
+}
+
+TEST_F(LabRoadsTest, AFileThatHardlyShrinksArrivesWhole) {
+  std::minstd_rand random(1);
+  std::string contents(6U << 20U, '\0');
+  for (char& byte : contents) byte = static_cast<char>(random());
+  const auto path = write("large.bin", contents);
+  TestSession session(instance, {});
+  EXPECT_TRUE(session.session.uploadFileAndWait(path, kDeadline).success);
+  EXPECT_FALSE(exists(path));
+  const auto uploads = lab.uploads();
+  ASSERT_THAT(uploads, SizeIs(1));
+  EXPECT_GT(numberIn(uploads[0], "wireBytes"), 5 << 20);
+  EXPECT_TRUE(readWholeFile(textIn(uploads[0], "file")) == contents);
 }
 
 TEST_F(LabRoadsTest, AFileThatTheLabRefusesStaysAndMayBeSentAgain) {

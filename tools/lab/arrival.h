@@ -40,7 +40,7 @@ struct UploadArrival : HttpArrival {
   std::string file;   // where it lies; empty when it was not taken
 };
 
-// One array of log records.
+// One array of log records. Its plain bytes are those of the records as JSON.
 struct LogDataArrival : HttpArrival {
   std::string location;     // the address that was answered; empty when nothing was taken
   std::string archiveFile;  // as it came

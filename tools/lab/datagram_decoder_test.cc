@@ -2,6 +2,8 @@
 
 #include <gmock/gmock.h>
 
+#include <random>
+
 #include "tools/lab/test_datagram.h"
 
 namespace tarnel::lab {
@@ -123,6 +125,24 @@ TEST(DatagramDecoderTest, NoBytesAreReadBeyondTheEnd) {
   for (size_t size = 0; size <= bytes.size(); ++size) {
     const Bytes cut(bytes.begin(), bytes.begin() + static_cast<ptrdiff_t>(size));
     EXPECT_EQ(problemsOf(cut).empty(), size == bytes.size());
+  }
+}
+
+TEST(DatagramDecoderTest, WhateverComesIsSurvived) {
+  std::minstd_rand random(1);
+  const std::string letters = " =\\ab";
+  for (int round = 0; round < 20'000; ++round) {
+    std::string text(random() % 40, ' ');
+    for (char& letter : text) letter = letters[random() % letters.size()];
+    Bytes bytes = sampleDatagram(text);
+    if (round % 4 == 0) bytes[random() % bytes.size()] = static_cast<uint8_t>(random());
+    Problems problems;
+    const auto datagram = readDatagram(bytes, problems);
+    size_t entryBytes = 0;
+    if (datagram) {
+      for (const auto& [key, value] : datagram->entries) entryBytes += key.size() + value.size() + 2;
+      EXPECT_LE(entryBytes, datagram->text.size());
+    }
   }
 }
 

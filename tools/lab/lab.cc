@@ -171,7 +171,7 @@ Dictionary RunningLab::status() const {
           {"realtimeURL", baseURL() + "/v1/realtime"},
           {"uploadURL", baseURL() + "/v1/uploads"},
           {"logDataURL", baseURL() + "/v1/log-data"},
-          {"datagramAddress", ipv4Address(options_.listen)},
+          {"datagramAddress", urlHost(ipv4Address(options_.listen))},
           {"datagramPort", datagramPort_},
           {"controlURL", controlURL()},
           {"directory", directory_.paths.directory},
@@ -221,8 +221,8 @@ void RunningLab::tellStart() const {
           "/storebags\n";
   text += "  arrivals    " + directory_.paths.arrivals + "/events.ndjson\n";
   text += "  uploads     " + directory_.paths.uploads + ", log data in " + directory_.paths.logData + "\n";
-  text +=
-      "  datagrams   UDP " + ipv4Address(options_.listen) + " port " + std::to_string(datagramPort_) + "\n";
+  text += "  datagrams   UDP " + urlHost(ipv4Address(options_.listen)) + " port " +
+          std::to_string(datagramPort_) + "\n";
   text += "  serves      ";
   if (names.empty()) {
     text += "no storebag yet: put inner documents into " + directory_.paths.storebags + "/NAME.json";

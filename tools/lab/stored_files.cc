@@ -54,7 +54,8 @@ std::string numbered(uint64_t number) {
 }  // namespace
 
 std::string safeFileName(std::string_view name) {
-  std::string safe(name.substr(0, kMaxNameBytes));
+  // The end says what kind of file it is.
+  std::string safe(name.substr(name.size() - std::min(name.size(), kMaxNameBytes)));
   std::replace_if(
       safe.begin(), safe.end(), [](char letter) { return !isPlain(letter); }, '_');
   return safe.empty() ? "file" : safe;

@@ -55,8 +55,8 @@ class StoredFiles {
   // Reads what earlier runs left. The error names the folder.
   MaybeError open();
 
-  // name: of a stranger; what is no letter, digit, "-", "_" or "." in it becomes "_", and it is cut to 100
-  // bytes. now: seconds since 1970.
+  // name: of a stranger; what is no letter, digit, "-", "_" or "." in it becomes "_", and of a long one the
+  // last 100 bytes count. now: seconds since 1970.
   Result<IncomingFile> create(double now, std::string_view name);
   // Gives the file its name, puts the description beside it unless it is empty, and makes room. The error
   // names the file.

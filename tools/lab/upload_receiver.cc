@@ -13,7 +13,8 @@ constexpr char kTakenWord[] = "success";
 constexpr std::string_view kPacked = ".gz";
 
 MaybeString shown(const MaybeString& value) {
-  return value ? MaybeString(printable(*value)) : std::nullopt;
+  constexpr size_t kMaxBytes = 1024;
+  return value ? MaybeString(printable(*value, kMaxBytes)) : std::nullopt;
 }
 
 // Folder, file and whatever else stands in a reason may hold the word as well.
@@ -71,11 +72,11 @@ std::optional<UploadReceiver::Refusal> UploadReceiver::take(const HttpRequest& r
 
 MaybeError UploadReceiver::keep(IncomingFile& file, UploadArrival& arrival, Problems& problems) {
   arrival.file = file.path();
-  arrival.answered = "200";
   arrival.problems = problems.take();
   Dictionary description = recordOfUpload(arrival);
-  // The number comes with the next step; in the folder the name is what tells files apart.
+  // Number and answer are settled later.
   description.remove("upload");
+  description.remove("answered");
   MaybeError error = files_.keep(file, writeTextDocument(description, true) + "\n");
   if (error) arrival.file.clear();
   return error;

@@ -74,6 +74,7 @@ TEST_F(UploadReceiverTest, AFileIsUnpackedAndKeptWithWhatIsKnownAboutIt) {
   EXPECT_EQ(*findString(beside, "description"), "Lumora AFRC log (Uploaded by QMX)");
   EXPECT_EQ(*findString(*findDictionary(beside, "headers"), "Content-Encoding"), "gzip");
   EXPECT_EQ(*findString(beside, "file"), arrival.file);
+  EXPECT_EQ(beside.find("answered"), nullptr) << "not settled when it is written";
 }
 
 TEST_F(UploadReceiverTest, ProblemsAreToldAndDoNotRefuse) {
@@ -157,8 +158,10 @@ TEST_F(UploadReceiverTest, RefusesOnPurpose) {
 }
 
 TEST_F(UploadReceiverTest, WhatStrangersSendIsFitForPrinting) {
-  HttpRequest request = goodUpload("%1B[2J%FF.gz", "text");
-  EXPECT_EQ(receive(request).query.filename, "?[2J?.gz");
+  EXPECT_EQ(receive(goodUpload("%1B[2J%FF.gz", "text")).query.filename, "?[2J?.gz");
+  const std::string longest(255, 'x');
+  EXPECT_EQ(receive(goodUpload(longest, "text")).query.filename, longest)
+      << "what may be a name is kept whole";
 }
 
 }  // namespace
