@@ -270,6 +270,8 @@ TEST(ArchiveTest, DictionaryIsTwoListsOfEqualLength) {
   const Array wrong{Dictionary(),
                     Dictionary{{"keys", Array{0}}},
                     Dictionary{{"values", Array{0}}},
+                    Dictionary{{"keys", Array{0}}, {"other", Array{0}}},
+                    Dictionary{{"other", Array{0}}, {"values", Array{0}}},
                     dictionaryObject({0}, {}),
                     Dictionary{{"keys", 0}, {"values", Array{0}}},
                     Dictionary{{"keys", Array{0}}, {"values", Array{0}}, {"more", 1}}};
