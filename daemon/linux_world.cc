@@ -20,6 +20,7 @@
 #include "platform/linux/dl_code_bundle.h"
 #include "platform/linux/entitlement_rules.h"
 #include "platform/linux/file_consent.h"
+#include "platform/linux/heap_memory.h"
 #include "platform/linux/installed_client_bundle.h"
 #include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/sd_bus_listener.h"
@@ -178,6 +179,7 @@ void LinuxWorld::setUtilityQualityOfService() {
 
 Log& LinuxWorld::startLogging(const char* processName, const char* facility) {
   ::signal(SIGPIPE, SIG_IGN);
+  returnLargeBlocks();
   log_ = TarnelLogging::startLogging(processName, facility);
   return *log_;
 }

@@ -8,7 +8,10 @@
 #include <filesystem>
 #include <fstream>
 #include <future>
+#include <memory>
 #include <mutex>
+#include <random>
+#include <thread>
 
 #include "tests/helpers/lab_process.h"
 #include "tests/helpers/private_instance.h"
@@ -68,6 +71,16 @@ class UploadTest : public ::testing::Test {
     std::string path = instance.folder().path(name);
     std::ofstream(path) << text;
     return path;
+  }
+  // The most memory that the daemon ever held.
+  size_t peakBytes() const {
+    std::ifstream status("/proc/" + std::to_string(instance.daemon().pid()) + "/status");
+    for (std::string word; status >> word;) {
+      size_t kilobytes = 0;
+      if (word == "VmHWM:" && status >> kilobytes) return kilobytes * 1024;
+    }
+    ADD_FAILURE() << "the process does not tell its memory";
+    return 0;
   }
   static bool exists(const std::string& path) { return std::filesystem::exists(path); }
   FinishedProcess run(std::vector<std::string> arguments) const {
@@ -170,6 +183,49 @@ TEST_F(UploadTest, AnUploadThatHangsDelaysNobodyElse) {
   instance.expectAlive();
   instance.stop();
   EXPECT_TRUE(exists(path));
+}
+
+// What is under way at the same time is bounded; the others take turns, and none is lost.
+TEST_F(UploadTest, ManyLargeUploadsTakeTurnsInBoundedMemory) {
+  constexpr size_t kMiB = size_t{1} << 20U;
+  constexpr size_t kUploads = 8;
+  std::promise<void> allHaveCome;
+  auto mayAnswer = allHaveCome.get_future().share();
+  std::atomic<size_t> posts{0};
+  const RawHttpServer server(RawHttpServer::answering([&posts, mayAnswer](const std::string&) {
+    ++posts;
+    mayAnswer.wait();
+    return httpAnswer("200 OK", "success");
+  }));
+  serve(server.url("/up"));
+  instance.setConfiguration("[limits]\nmax_upload_bytes = 4194304\n[http]\nmax_queued_bytes = 8388608\n");
+  ASSERT_TRUE(instance.start());
+  std::mt19937 random(1);
+  std::string contents(3 * kMiB, '\0');
+  std::generate(contents.begin(), contents.end(), [&random] { return static_cast<char>(random()); });
+  std::vector<std::unique_ptr<TestSession>> sessions;
+  std::vector<std::future<bool>> answers;
+  for (uint32_t i = 0; i < kUploads; ++i) {
+    sessions.push_back(std::make_unique<TestSession>(instance, SessionSetup{.sessionID = i}));
+  }
+  const size_t before = peakBytes();
+  for (auto& session : sessions) {
+    const auto told = std::make_shared<std::promise<bool>>();
+    answers.push_back(told->get_future());
+    const auto path = write("large" + std::to_string(answers.size()), contents);
+    EXPECT_TRUE(session->session.uploadFile(
+        path, [told](const client::Reply& reply) { told->set_value(reply.success); }));
+  }
+  const Deadline deadline;
+  const char* const begun = "UploadBackend(uploadFileAtPath): Uploading file";
+  while (instance.countInLog(begun) < kUploads && !deadline.passed()) std::this_thread::yield();
+  EXPECT_LE(posts, 1U);
+  allHaveCome.set_value();
+  for (auto& answer : answers) EXPECT_TRUE(answer.get());
+  EXPECT_EQ(posts, kUploads);
+  if (kMemoryIsMeasurable) {
+    EXPECT_LT(peakBytes() - before, 16 * kMiB);
+  }
 }
 
 TEST_F(UploadTest, AClientThatDiesMeanwhileIsSurvivedAndKeepsItsFile) {
