@@ -2,7 +2,11 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
+#include <condition_variable>
+#include <filesystem>
+#include <fstream>
 #include <future>
+#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
@@ -359,6 +363,44 @@ TEST_F(SessionTest, ACallbackCallsButCannotWait) {
   EXPECT_EQ(waited.status.code, TARNEL_ERROR_WRONG_THREAD);
   EXPECT_TRUE(sent);
   EXPECT_EQ(daemon_.waitFor(2)[1].category, 3);
+}
+
+// Whatever the daemon asks for, only a file that waits for its answer is deleted.
+TEST_F(SessionTest, OnlyAFileThatWasHandedOverAndNotAnsweredForIsDeleted) {
+  const std::string file = folder_.file("file");
+  const std::string other = folder_.file("other");
+  std::ofstream(file) << "x";
+  std::ofstream(other) << "x";
+  std::mutex mutex;
+  std::condition_variable came;
+  int calls = 0;
+  auto aggregating = options();
+  aggregating.onAggregatedMessage = [&](DictionaryView, double, uint16_t, uint16_t, DictionaryView) {
+    const std::lock_guard lock(mutex);
+    ++calls;
+    came.notify_all();
+  };
+  // Returns when the client has done what it was asked.
+  auto ask = [&, this, asked = 0](const std::string& path) mutable {
+    daemon_.askToDelete("file://" + path);
+    daemon_.callClients(std::nullopt, 1.0, 0, 0, std::nullopt);
+    ++asked;
+    std::unique_lock lock(mutex);
+    EXPECT_TRUE(came.wait_for(lock, kLong, [&calls, asked] { return calls == asked; }));
+  };
+  Session session(std::move(aggregating));
+  EXPECT_TRUE(session.uploadFileAndWait(file, kLong).success);
+  ask(file);
+  EXPECT_TRUE(std::filesystem::exists(file));
+  daemon_.isSilent = true;
+  EXPECT_TRUE(session.uploadFile(file));
+  daemon_.waitFor(2);
+  ask(other);
+  EXPECT_TRUE(std::filesystem::exists(file));
+  EXPECT_TRUE(std::filesystem::exists(other));
+  ask(file);
+  EXPECT_FALSE(std::filesystem::exists(file));
+  EXPECT_TRUE(std::filesystem::exists(other));
 }
 
 TEST_F(SessionTest, AggregatedMessagesAndTheirEndReachTheHandlers) {

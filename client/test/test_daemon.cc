@@ -205,6 +205,20 @@ void TestDaemon::callClients(const MaybeDictionary& messageInfo, double timestam
   });
 }
 
+void TestDaemon::askToDelete(const std::string& fileURL) {
+  post([this, &fileURL] {
+    for (Peer& peer : peers_) {
+      sd_bus_message* call = nullptr;
+      sd_bus_message_new_method_call(peer.bus.get(), &call, nullptr, wire::kReplyPath, wire::kReplyInterface,
+                                     wire::kDeleteFile.name);
+      sd_bus_message_append(call, "s", fileURL.c_str());
+      sd_bus_message_set_expect_reply(call, 0);
+      sd_bus_send(peer.bus.get(), call, nullptr);
+      sd_bus_message_unref(call);
+    }
+  });
+}
+
 std::vector<Received> TestDaemon::waitFor(size_t count) {
   std::unique_lock lock(mutex_);
   if (!changed_.wait_for(lock, std::chrono::seconds(30),

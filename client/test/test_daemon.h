@@ -75,6 +75,8 @@ class TestDaemon {
   // Lets the clients aggregate.
   void callClients(const MaybeDictionary& messageInfo, double timestamp, uint16_t category, uint16_t type,
                    const MaybeDictionary& payload);
+  // Asks the clients to delete a file, whether or not they handed it over.
+  void askToDelete(const std::string& fileURL);
   // Ends a wait inside the daemon's thread, after a flag above was changed back.
   void nudge();
 

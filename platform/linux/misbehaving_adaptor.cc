@@ -53,6 +53,11 @@ constexpr tarnel_adaptor_class kThrowingLater{.version = TARNEL_ADAPTOR_VERSION,
                                               .destroy = destroy,
                                               .find_method = findMethod};
 
+[[maybe_unused]] constexpr tarnel_adaptor_class kWithoutCreate{
+    .version = TARNEL_ADAPTOR_VERSION, .create = nullptr, .destroy = destroy, .find_method = findMethod};
+[[maybe_unused]] constexpr tarnel_adaptor_class kWithoutDestroy{
+    .version = TARNEL_ADAPTOR_VERSION, .create = create, .destroy = nullptr, .find_method = findMethod};
+
 }  // namespace
 
 #if ADAPTOR_FAULT != FAULT_NO_EXPORT
@@ -61,6 +66,9 @@ const tarnel_adaptor_class* tarnel_adaptor_class_named(uint32_t /*version*/,
                                                        const char* name) {
   if (ADAPTOR_FAULT == FAULT_THROWING && std::string_view(name) == "Nothing")
     throw std::runtime_error("no class");
+  if (ADAPTOR_FAULT == FAULT_INCOMPLETE && std::string_view(name) == "WithoutCreate") return &kWithoutCreate;
+  if (ADAPTOR_FAULT == FAULT_INCOMPLETE && std::string_view(name) == "WithoutDestroy")
+    return &kWithoutDestroy;
   return std::string_view(name) == "ThrowsLater" ? &kThrowingLater : &kClass;
 }
 #else

@@ -82,6 +82,20 @@ TEST_F(TrustedPathTest, WhatOthersCanWriteIsRefusedAtEveryStep) {
   }
 }
 
+TEST_F(TrustedPathTest, TheRootCountsAsWell) {
+  if (::geteuid() != 0) GTEST_SKIP() << "only root can have another root";
+  const auto inside = [this](mode_t mode) {
+    return runInChild([this, mode]() -> std::string {
+      if (::chroot(folder.path().c_str()) != 0 || ::chmod("/", mode) != 0) return "no other root";
+      return outcome("/a/b/file");
+    });
+  };
+  EXPECT_EQ(inside(0755), "trusted");
+  EXPECT_EQ(inside(0757), refused +
+                              "its directory / can be written by its group or by others; change that with: "
+                              "chmod go-w /");
+}
+
 TEST_F(TrustedPathTest, WhatBelongsToOthersIsRefusedAtEveryStep) {
   if (::geteuid() != 0) GTEST_SKIP() << "only root can give a file away";
   for (const std::string& part : {folder.path("a"), folder.path("a/b"), file}) {
