@@ -16,6 +16,7 @@
 #include "platform/fake/fake_world.h"
 #include "platform/json_writer.h"
 #include "tests/fuzz/fuzz_target.h"
+#include "tests/fuzz/storebag_expectation.h"
 #include "tests/fuzz/values.h"
 #include "util/storebag.h"
 #include "util/test_storebag.h"
@@ -250,45 +251,10 @@ Fetched fetch(fake::FakeWorld& world, int32_t clientType) {
   return fetched;
 }
 
-// What the document says, found without the code under test.
-struct Expected {
-  const Dictionary* section = nullptr;
-  const std::string* version = nullptr;
-  std::optional<int32_t> refreshCycle;
-};
-
-Expected expectationOf(const Dictionary& bag, EnvironmentType environment) {
-  Expected expected;
-  switch (environment) {
-    case EnvironmentType::development:
-      expected.section = findDictionary(bag, "development");
-      break;
-    case EnvironmentType::orvaneInternal:
-      expected.section = findDictionary(bag, "orvane_internal");
-      break;
-    case EnvironmentType::seed:
-      expected.section = findDictionary(bag, "seed");
-      if (expected.section == nullptr) expected.section = findDictionary(bag, "release");
-      break;
-    case EnvironmentType::release:
-      expected.section = findDictionary(bag, "release");
-      break;
-    case EnvironmentType::none:
-      break;
-  }
-  expected.version = findString(bag, "version");
-  if (const auto* cycle = findNumber(bag, "refresh_cycle")) {
-    const double seconds = cycle->type() == Value::Type::unsignedInteger ? 1e18 : cycle->doubleValue();
-    expected.refreshCycle =
-        std::isnan(seconds) ? 0
-                            : static_cast<int32_t>(std::clamp(std::trunc(seconds), -2147483648.0, 86400.0));
-  }
-  return expected;
-}
-
 void checkSigned(const Fetched& fetched, const Serving& serving, const std::optional<Value>& document) {
   const auto* bag = document ? document->dictionary() : nullptr;
-  const auto expected = bag == nullptr ? Expected() : expectationOf(*bag, serving.environment);
+  const auto expected =
+      bag == nullptr ? StorebagExpectation() : storebagExpectation(*bag, serving.environment);
   if (bag == nullptr) reached("no dictionary");
   require(fetched.threw == (expected.section != nullptr && expected.version == nullptr),
           "only a missing version is an invalid argument");
