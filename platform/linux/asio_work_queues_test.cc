@@ -124,21 +124,23 @@ TEST_F(AsioWorkQueuesTest, TimerTicksFromOnePeriodOnUntilItIsCancelledByItsOwnHa
 
 TEST_F(AsioWorkQueuesTest, TicksThatWereMissedAreOne) {
   const auto queue = queues->makeQueue("com.example.one");
-  auto timer = queue->makeTimer(1ms, 0ms);
-  std::atomic<int> ticks{0};
+  auto timer = queue->makeTimer(40ms, 0ms);
+  std::vector<Clock::time_point> ticks;
   std::promise<void> over;
   timer->start(
       [&ticks, &timer] {
-        // Holds the queue for many periods.
-        const test::Deadline deadline(100ms);
-        while (ticks.load() == 0 && !deadline.passed()) std::this_thread::yield();
-        if (++ticks == 2) timer->cancel();
+        ticks.push_back(Clock::now());
+        // Holds the queue for five periods.
+        const test::Deadline deadline(200ms);
+        while (ticks.size() == 1 && !deadline.passed()) std::this_thread::yield();
+        if (ticks.size() == 4) timer->cancel();
       },
       [&over] { over.set_value(); });
-  const auto start = Clock::now();
   expectSoon(over.get_future());
-  EXPECT_GE(Clock::now() - start, 100ms);
-  EXPECT_EQ(ticks.load(), 2);
+  ASSERT_EQ(ticks.size(), 4U);
+  EXPECT_GE(ticks[1] - ticks[0], 200ms);
+  // Made up for one after the other they would come at once.
+  EXPECT_GE(ticks[3] - ticks[1], 20ms);
 }
 
 TEST_F(AsioWorkQueuesTest, LeewayIsHeldToHalfAPeriod) {
