@@ -125,6 +125,8 @@ bool ConnectionLoop::wait() {
   if (!isBusy && inputBegin_ == inputEnd_) {
     buffer_.reset();
     capacity_ = 0;
+    inputBegin_ = 0;
+    inputEnd_ = 0;
   }
   unsigned wanted = outputPending() ? POLLOUT : 0;
   if (isReading && !inputEnded_) wanted |= POLLIN;
@@ -194,14 +196,13 @@ ConnectionLoop::Pump ConnectionLoop::feed() {
   // A send that failed has closed it; nobody reads the pipe any more.
   if (sd_bus_is_open(bus_.get()) <= 0) return Pump::over;
   const auto written =
-      sendWithDescriptors(feed_.get(), unadmitted().substr(0, admitted_), descriptorsToFeed_);
+      ::send(feed_.get(), buffer_.get() + inputBegin_, admitted_, MSG_DONTWAIT | MSG_NOSIGNAL);
   // Parts of messages that the bus has not read yet may fill it.
   if (written < 0 && errno == EAGAIN) {
     isFed_ = true;
     return Pump::progress;
   }
   if (written <= 0) return closing(std::string("its input cannot be passed on: ") + strerror(errno));
-  descriptorsToFeed_.clear();
   inputBegin_ += static_cast<size_t>(written);
   admitted_ -= static_cast<size_t>(written);
   isFed_ = true;
@@ -312,10 +313,10 @@ std::optional<ConnectionLoop::Pump> ConnectionLoop::claimDescriptors(size_t size
                    std::to_string(descriptors_.size()) + " came; at most " +
                    std::to_string(wire::kMaxDescriptors) + " may");
   }
-  announced_ = *announced;
-  const auto end = descriptors_.begin() + static_cast<std::ptrdiff_t>(announced_);
-  descriptorsToFeed_.assign(std::make_move_iterator(descriptors_.begin()), std::make_move_iterator(end));
+  const auto end = descriptors_.begin() + static_cast<std::ptrdiff_t>(*announced);
+  announced_.assign(std::make_move_iterator(descriptors_.begin()), std::make_move_iterator(end));
   descriptors_.erase(descriptors_.begin(), end);
+  announceNoDescriptors({buffer_.get() + inputBegin_, header});
   return admit(std::min(sizeOfMessage, input.size()));
 }
 

@@ -40,7 +40,8 @@ using BusMessage = std::unique_ptr<sd_bus_message, UnrefBusMessage>;
 // messages pass it by, unless something about them is unusual; see send_call.h. One call is carried out
 // at a time, and none while an earlier answer still waits for the client to read, so that a client holds no
 // more of us than a message and an answer. Descriptors that come along go to the message that announces them,
-// at most wire::kMaxDescriptors; only UploadFile takes any, and all others are closed at once.
+// at most wire::kMaxDescriptors; only UploadFile takes any, and all others are closed at once. They pass the
+// bus by: of a message that it finds malformed the library would leave them open.
 //
 // Threads: made, run and destroyed on one.
 class ConnectionLoop {
@@ -149,15 +150,14 @@ class ConnectionLoop {
   size_t inputBegin_ = 0;
   size_t inputEnd_ = 0;
   size_t admitted_ = 0;
-  bool isNew_ = false;                       // what is in the buffer and not admitted has not been looked at
-  bool mayHaveMore_ = false;                 // the socket, since the last read filled the buffer
-  bool isFed_ = false;                       // the bus may have something to read
-  bool mayPassDescriptors_ = false;          // negotiated
-  bool toldOfDescriptors_ = false;           // that nobody asked for
-  std::vector<UniqueFd> descriptors_;        // came with bytes that have not been looked at
-  std::vector<UniqueFd> descriptorsToFeed_;  // with the next bytes
-  size_t announced_ = 0;                     // by the message that the bus reads now
-  uint64_t messages_ = 0;                    // that were read, by the bus or past it
+  bool isNew_ = false;                 // what is in the buffer and not admitted has not been looked at
+  bool mayHaveMore_ = false;           // the socket, since the last read filled the buffer
+  bool isFed_ = false;                 // the bus may have something to read
+  bool mayPassDescriptors_ = false;    // negotiated
+  bool toldOfDescriptors_ = false;     // that nobody asked for
+  std::vector<UniqueFd> descriptors_;  // came with bytes that have not been looked at
+  std::vector<UniqueFd> announced_;    // belong to the message that the bus reads now
+  uint64_t messages_ = 0;              // that were read, by the bus or past it
 
   // The call whose method runs now.
   sd_bus_message* current_ = nullptr;

@@ -16,18 +16,23 @@ namespace tarnel {
 
 int ConnectionLoop::onMessage(sd_bus_message* message) {
   ++messages_;
-  const bool hasDescriptors = std::exchange(announced_, 0) > 0;
+  // What nobody takes is closed at the end.
+  std::vector<UniqueFd> descriptors = std::exchange(announced_, {});
   uint8_t type = 0;
   if (sd_bus_message_get_type(message, &type) < 0 || type != SD_BUS_MESSAGE_METHOD_CALL) return 1;
   const char* interface = sd_bus_message_get_interface(message);
   if (interface != nullptr && std::strcmp(interface, wire::kSessionInterface) == 0 &&
       std::strcmp(sd_bus_message_get_path(message), wire::kSessionPath) == 0) {
     // A call that waits for its answer must not hold descriptors meanwhile.
-    if (hasDescriptors && std::strcmp(sd_bus_message_get_member(message), wire::kUploadFile.name) != 0) {
+    if (!descriptors.empty() &&
+        std::strcmp(sd_bus_message_get_member(message), wire::kUploadFile.name) != 0) {
       refuse(message, wire::kErrorInvalidArguments, "only UploadFile takes a descriptor");
       return 1;
     }
-    carryOut(message, callSessionMethod);
+    carryOut(message, [&descriptors](SessionCall call) {
+      call.descriptors = descriptors;
+      return callSessionMethod(call);
+    });
     return 1;
   }
   if (isPeerGone()) return 1;

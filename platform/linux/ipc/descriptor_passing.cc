@@ -5,7 +5,6 @@
 #include <algorithm>
 #include <array>
 #include <bit>
-#include <cerrno>
 #include <cstdint>
 #include <cstring>
 
@@ -37,6 +36,28 @@ size_t endOfValue(std::string_view header, char type, size_t at) {
   return type == 'u' ? at + 4 : at + 4 + numberAt(header, at) + 1;
 }
 
+// Where the header says how many descriptors belong to the message; 0 when it does not, nothing when it
+// cannot be understood.
+std::optional<size_t> findAnnouncement(std::string_view message) {
+  const auto header = message.substr(0, kFixedHeader + numberAt(message, 12));
+  size_t at = kFixedHeader;
+  while (at < header.size()) {
+    // A field: its code, the signature of its value (here always one type), the value.
+    at = aligned(at, 8);
+    if (at + 4 > header.size() || header[at + 1] != 1 || header[at + 3] != 0) return std::nullopt;
+    const char code = header[at];
+    const char type = header[at + 2];
+    const size_t end = endOfValue(header, type, at + 4);
+    if (end == 0 || end > header.size()) return std::nullopt;
+    if (code == kUnixFds) {
+      if (type != 'u') return std::nullopt;
+      return end - 4;
+    }
+    at = end;
+  }
+  return 0;
+}
+
 }  // namespace
 
 ssize_t receiveWithDescriptors(int socket, char* room, size_t size, std::vector<UniqueFd>& into) {
@@ -61,53 +82,19 @@ ssize_t receiveWithDescriptors(int socket, char* room, size_t size, std::vector<
   return got;
 }
 
-ssize_t sendWithDescriptors(int socket, std::string_view bytes, const std::vector<UniqueFd>& descriptors) {
-  std::array<int, wire::kMaxDescriptors> numbers{};
-  if (descriptors.size() > numbers.size()) {
-    errno = EINVAL;
-    return -1;
-  }
-  std::transform(descriptors.begin(), descriptors.end(), numbers.begin(),
-                 [](const UniqueFd& descriptor) { return descriptor.get(); });
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * wire::kMaxDescriptors)> control{};
-  iovec piece{const_cast<char*>(bytes.data()), bytes.size()};
-  msghdr message{};
-  message.msg_iov = &piece;
-  message.msg_iovlen = 1;
-  if (!descriptors.empty()) {
-    message.msg_control = control.data();
-    message.msg_controllen = CMSG_SPACE(sizeof(int) * descriptors.size());
-    auto* header = CMSG_FIRSTHDR(&message);
-    header->cmsg_level = SOL_SOCKET;
-    header->cmsg_type = SCM_RIGHTS;
-    header->cmsg_len = CMSG_LEN(sizeof(int) * descriptors.size());
-    std::memcpy(control.data() + CMSG_LEN(0), numbers.data(), sizeof(int) * descriptors.size());
-  }
-  return sendmsg(socket, &message, MSG_DONTWAIT | MSG_NOSIGNAL);
-}
-
 size_t headerSize(std::string_view message) {
   return kFixedHeader + aligned(size_t{numberAt(message, 12)}, 8);
 }
 
 std::optional<unsigned> announcedDescriptors(std::string_view message) {
-  const auto header = message.substr(0, kFixedHeader + numberAt(message, 12));
-  size_t at = kFixedHeader;
-  while (at < header.size()) {
-    // A field: its code, the signature of its value (here always one type), the value.
-    at = aligned(at, 8);
-    if (at + 4 > header.size() || header[at + 1] != 1 || header[at + 3] != 0) return std::nullopt;
-    const char code = header[at];
-    const char type = header[at + 2];
-    const size_t end = endOfValue(header, type, at + 4);
-    if (end == 0 || end > header.size()) return std::nullopt;
-    if (code == kUnixFds) {
-      if (type != 'u') return std::nullopt;
-      return numberAt(header, end - 4);
-    }
-    at = end;
-  }
-  return 0;
+  const auto at = findAnnouncement(message);
+  if (!at) return std::nullopt;
+  return *at == 0 ? 0 : numberAt(message, *at);
+}
+
+void announceNoDescriptors(std::span<char> message) {
+  const auto at = findAnnouncement({message.data(), message.size()});
+  if (at && *at != 0) std::fill_n(message.begin() + static_cast<std::ptrdiff_t>(*at), 4, '\0');
 }
 
 }  // namespace tarnel

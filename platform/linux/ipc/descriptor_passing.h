@@ -4,6 +4,7 @@
 
 #include <cstddef>
 #include <optional>
+#include <span>
 #include <string_view>
 #include <vector>
 
@@ -18,9 +19,6 @@ namespace tarnel {
 // kernel closes further ones.
 ssize_t receiveWithDescriptors(int socket, char* room, size_t size, std::vector<UniqueFd>& into);
 
-// send() without waiting. Once anything was sent, the descriptors were, too.
-ssize_t sendWithDescriptors(int socket, std::string_view bytes, const std::vector<UniqueFd>& descriptors);
-
 // Longest header of a message with descriptors that is looked at, bytes.
 inline constexpr size_t kMaxHeaderWithDescriptors = 4096;
 
@@ -28,5 +26,8 @@ inline constexpr size_t kMaxHeaderWithDescriptors = 4096;
 // understood. The bytes must hold the whole header, which headerSize() tells from the first 16.
 std::optional<unsigned> announcedDescriptors(std::string_view message);
 size_t headerSize(std::string_view message);
+
+// Makes a message that announces descriptors one that announces none.
+void announceNoDescriptors(std::span<char> message);
 
 }  // namespace tarnel

@@ -3,13 +3,41 @@
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 
+#include <algorithm>
 #include <array>
+#include <cerrno>
+#include <cstring>
 #include <string>
 
 #include "platform/linux/ipc/ipc_test_support.h"
 
 namespace tarnel {
 namespace {
+
+ssize_t sendWithDescriptors(int socket, std::string_view bytes, const std::vector<UniqueFd>& descriptors) {
+  std::array<int, wire::kMaxDescriptors> numbers{};
+  if (descriptors.size() > numbers.size()) {
+    errno = EINVAL;
+    return -1;
+  }
+  std::transform(descriptors.begin(), descriptors.end(), numbers.begin(),
+                 [](const UniqueFd& descriptor) { return descriptor.get(); });
+  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * wire::kMaxDescriptors)> control{};
+  iovec piece{const_cast<char*>(bytes.data()), bytes.size()};
+  msghdr message{};
+  message.msg_iov = &piece;
+  message.msg_iovlen = 1;
+  if (!descriptors.empty()) {
+    message.msg_control = control.data();
+    message.msg_controllen = CMSG_SPACE(sizeof(int) * descriptors.size());
+    auto* header = CMSG_FIRSTHDR(&message);
+    header->cmsg_level = SOL_SOCKET;
+    header->cmsg_type = SCM_RIGHTS;
+    header->cmsg_len = CMSG_LEN(sizeof(int) * descriptors.size());
+    std::memcpy(control.data() + CMSG_LEN(0), numbers.data(), sizeof(int) * descriptors.size());
+  }
+  return sendmsg(socket, &message, MSG_DONTWAIT | MSG_NOSIGNAL);
+}
 
 TEST(AnnouncedDescriptorsTest, TheHeaderSaysHowMany) {
   for (const uint32_t count : {0U, 1U, 4U, 0xFFFFFFFFU}) {
@@ -41,6 +69,17 @@ TEST(AnnouncedDescriptorsTest, WhateverIsCutOrChangedIsReadWithinItsBounds) {
       static_cast<void>(announcedDescriptors(changed));
     }
   }
+}
+
+TEST(AnnouncedDescriptorsTest, AMessageCanBeMadeToAnnounceNone) {
+  auto call = rawCall("UploadFile", "", "sh", 0, 1, 2);
+  announceNoDescriptors(call);
+  EXPECT_EQ(announcedDescriptors(call), 0U);
+  EXPECT_EQ(headerSize(call), call.size());
+  auto without = rawCall("UploadFile", "", "sh", 0, 1);
+  const auto before = without;
+  announceNoDescriptors(without);
+  EXPECT_EQ(without, before);
 }
 
 TEST(AnnouncedDescriptorsTest, AFieldOfAnotherTypeIsNotUnderstood) {

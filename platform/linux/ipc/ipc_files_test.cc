@@ -345,10 +345,30 @@ TEST_F(IpcFilesTest, ACallWithoutItsDescriptorIsRefused) {
   EXPECT_EQ(client.errorText, "UploadFile takes the arguments \"sh\", not \"s\"");
   const RawClient raw(service.path());
   raw.authenticateForDescriptors();
-  EXPECT_TRUE(raw.writeWith(rawCall("UploadFile", uploadBody("/x", 1), "sh", UINT32_MAX, 1, 1), 0));
+  EXPECT_TRUE(raw.write(rawCall("UploadFile", uploadBody("/x"), "sh")));
+  EXPECT_TRUE(raw.writeWith(rawUpload("/x", 2), 0, 2));
   EXPECT_TRUE(raw.write(rawCall("StartConfig")));
   EXPECT_TRUE(eventually([&] { return service.accepted() == 2 && service.session(1)->count() == 1; }));
   EXPECT_THAT(service.session(1)->calls(), ElementsAre("startConfig"));
+}
+
+// The bus library would leave it open, with nobody to close it.
+TEST_F(IpcFilesTest, TheDescriptorOfAMalformedMessageIsClosed) {
+  onFile([](ClientFile&) {});
+  const auto file = open(write("x", "x"));
+  auto call = rawUpload("/x");
+  const size_t path = call.find("/com/orvane");
+  ASSERT_NE(path, std::string::npos);
+  call[path] = '!';
+  const size_t before = openDescriptors();
+  for (int i = 0; i < 20; ++i) {
+    const RawClient client(service.path());
+    client.authenticateForDescriptors();
+    EXPECT_TRUE(client.writeWith(call, file.get()));
+    EXPECT_TRUE(isClosedByPeer(client.fd()));
+  }
+  EXPECT_TRUE(eventually([&] { return service.invalidations() == 20; }));
+  EXPECT_TRUE(eventually([before] { return openDescriptors() <= before; }));
 }
 
 TEST_F(IpcFilesTest, WithoutNegotiationNoDescriptorIsTaken) {

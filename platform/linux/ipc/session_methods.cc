@@ -1,10 +1,8 @@
 #include "platform/linux/ipc/session_methods.h"
 
-#include <fcntl.h>
 #include <systemd/sd-bus.h>
 
 #include <array>
-#include <cerrno>
 #include <cstring>
 #include <utility>
 
@@ -158,18 +156,18 @@ MaybeError uploadLogData(const SessionCall& call) {
 // The token that the session gets in the place of the descriptor is good for as long as this call runs.
 MaybeError uploadFile(const SessionCall& call) {
   const char* fileURL = nullptr;
-  int descriptor = -1;
-  if (sd_bus_message_read(call.message, "sh", &fileURL, &descriptor) < 0) {
+  if (call.descriptors.size() != 1) {
     return Error(
         wire::kErrorInvalidArguments, -1,
-        "the file's descriptor is missing: it must come with the message, whose header announces it");
+        "UploadFile takes the file's descriptor, one that comes with the message, whose header announces "
+        "it; not " +
+            std::to_string(call.descriptors.size()));
+  }
+  if (sd_bus_message_read(call.message, "s", &fileURL) < 0) {
+    return Error(wire::kErrorInvalidArguments, -1, "the file's URL cannot be read");
   }
   if (call.clientFiles == nullptr) return Error(wire::kErrorFailed, -1, "this service takes no files");
-  UniqueFd file(fcntl(descriptor, F_DUPFD_CLOEXEC, 3));
-  if (!file) {
-    return Error(wire::kErrorFailed, -1, std::string("the file cannot be taken: ") + std::strerror(errno));
-  }
-  const auto offer = call.clientFiles->offer(std::move(file), fileURL, call.link);
+  const auto offer = call.clientFiles->offer(std::move(call.descriptors.front()), fileURL, call.link);
   call.session.uploadFileAtPath(fileURL, offer.token(), replyTo<bool>(call));
   return std::nullopt;
 }

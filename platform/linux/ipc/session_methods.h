@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <span>
 #include <string>
 
 #include "platform/base/error.h"
@@ -9,6 +10,7 @@
 #include "platform/ipc/client_session_interface.h"
 #include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/connection_link.h"
+#include "platform/linux/unique_fd.h"
 
 struct sd_bus_message;
 
@@ -24,7 +26,8 @@ struct SessionCall {
   uint64_t serial;
   const std::string& peer;
   Log& log;
-  ClientFileRegistry* clientFiles;  // null: none are taken
+  ClientFileRegistry* clientFiles;       // null: none are taken
+  std::span<UniqueFd> descriptors = {};  // that came with it; a method takes them by moving
 };
 
 // Decodes the arguments and calls the session's operation; its reply answers the call, from any thread.
