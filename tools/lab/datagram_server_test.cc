@@ -7,6 +7,7 @@
 #include <sys/socket.h>
 
 #include "platform/fake/fake_clock.h"
+#include "tools/lab/options.h"
 #include "tools/lab/test_datagram.h"
 
 namespace tarnel::lab {
@@ -105,6 +106,20 @@ TEST(DatagramListenerTest, AddressesAndPortsInUseAreNamed) {
   EXPECT_EQ(ipv4Address("::1"), "127.0.0.1");
   EXPECT_EQ(ipv4Address("::"), "0.0.0.0");
   EXPECT_TRUE(receiveOn("::1", 0, "--datagram-port"));
+}
+
+TEST(DatagramListenerTest, ThePortFollowsTheHttpsPortUnlessItIsChosen) {
+  LabOptions options;
+  EXPECT_EQ(effectiveDatagramPort(options), 8445);
+  options.port = 9000;
+  EXPECT_EQ(effectiveDatagramPort(options), 8445);
+  options.port = 0;
+  EXPECT_EQ(effectiveDatagramPort(options), 0) << "tests and demos share a machine";
+  options.datagramPort = 7000;
+  EXPECT_EQ(effectiveDatagramPort(options), 7000);
+  options.port = 8443;
+  options.datagramPort = 0;
+  EXPECT_EQ(effectiveDatagramPort(options), 0);
 }
 
 }  // namespace
