@@ -186,6 +186,11 @@ class Run {
     const auto& path = watched_.created.front();
     require(nameOf(path) == "tarneld_" + std::to_string(seconds) + "_messageLog.diag",
             "a new file has the time in its name");
+    const bool hasUsable = std::any_of(before.begin(), before.end(), [this](const auto& entry) {
+      const auto& made = entry.second.creationDate;
+      return isOwnName(nameOf(entry.first)) && (!made || now() - made->seconds <= kDay);
+    });
+    require(!hasUsable || fakes().listingError, "a new file is made only when none can be used");
     if (before.contains(path)) reached("name is taken");
     if (fakes().createError && !before.contains(path)) {
       require(!after.contains(path) && watched_.appended.empty(), "a message without a file is dropped");

@@ -10,6 +10,8 @@
 #include <filesystem>
 #include <map>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "platform/linux/toml.h"
 #include "tests/fuzz/fuzz_target.h"
