@@ -6,8 +6,8 @@
  * SAMPLE_ADAPTOR_FILE in the daemon's environment and must lie where the daemon may write, below its state or
  * logs directory. */
 
-#define _POSIX_C_SOURCE 200809L /* with -std=c11 the system's headers show nothing of their own without it \
-                                 */
+/* With -std=c11 the headers of the system show nothing of their own otherwise. */
+#define _POSIX_C_SOURCE 200809L
 
 #include <fcntl.h>
 #include <inttypes.h>
