@@ -96,7 +96,7 @@ class Handlers {
   Task cancel_;
 };
 
-// A source as the thread sees it. Made on any thread; everything else happens on the executor's.
+// A source as the thread sees it. Made and marked on any thread; everything else happens on the executor's.
 class SourceState : public std::enable_shared_from_this<SourceState> {
  public:
   SourceState(Executor& executor, std::string label) : executor_(executor), label_(std::move(label)) {}
@@ -105,38 +105,38 @@ class SourceState : public std::enable_shared_from_this<SourceState> {
   virtual ~SourceState() = default;
 
   Executor& executor() const noexcept { return executor_; }
+  // No event is handled from now on, not even one that has happened and has its turn before whatever would be
+  // handed over now. True the first time.
+  bool markCancelled() { return !isCancelled_.exchange(true); }
   void begin(std::unique_ptr<Handlers> handlers) {
-    if (isCancelled_) return finish(*handlers);
+    if (isCancelled_.load()) return finish(*handlers);
     wait(std::move(handlers));
   }
-  void cancel() {
-    isCancelled_ = true;
-    stopWaiting();
-  }
+
+  virtual void stopWaiting() = 0;
 
  protected:
   // Waits for the next event, then calls happened().
   virtual void wait(std::unique_ptr<Handlers> handlers) = 0;
-  virtual void stopWaiting() = 0;
   // Lets go of what the source waits on, before the cancel handler.
   virtual void letGo() = 0;
 
   void happened(const std::error_code& error, std::unique_ptr<Handlers> handlers) {
-    if (isCancelled_ || error) return finish(*handlers);
+    if (isCancelled_.load() || error) return finish(*handlers);
     handlers->event(label_);
     begin(std::move(handlers));
   }
 
  private:
   void finish(Handlers& handlers) {
-    isCancelled_ = true;
+    isCancelled_.store(true);
     letGo();
     handlers.cancel(label_);
   }
 
   Executor& executor_;
   const std::string label_;
-  bool isCancelled_ = false;
+  std::atomic<bool> isCancelled_{false};
 };
 
 class TimerState final : public SourceState {
@@ -149,6 +149,7 @@ class TimerState final : public SourceState {
         leeway_(std::min(leeway, period / 2)) {}
 
   void setFirst(SteadyTime now) { due_ = now + period_; }
+  void stopWaiting() override { timer_.cancel(); }
 
  private:
   void wait(std::unique_ptr<Handlers> handlers) override {
@@ -161,7 +162,6 @@ class TimerState final : public SourceState {
       happened(error, std::move(handlers));
     });
   }
-  void stopWaiting() override { timer_.cancel(); }
   void letGo() override {}
 
   // Full multiples of the leeway, which timers with the same leeway have in common.
@@ -188,6 +188,10 @@ class ReadState final : public SourceState {
     descriptor_.assign(descriptor, error);
     return !error;
   }
+  void stopWaiting() override {
+    std::error_code ignored;
+    descriptor_.cancel(ignored);
+  }
 
  private:
   void wait(std::unique_ptr<Handlers> handlers) override {
@@ -195,10 +199,6 @@ class ReadState final : public SourceState {
         asio::posix::stream_descriptor::wait_read,
         [this, self = shared_from_this(), handlers = std::move(handlers)](
             const std::error_code& error) mutable { happened(error, std::move(handlers)); });
-  }
-  void stopWaiting() override {
-    std::error_code ignored;
-    descriptor_.cancel(ignored);
   }
   // The descriptor is somebody else's to close.
   void letGo() override {
@@ -223,13 +223,12 @@ class AsioSource final : public EventSource {
     });
   }
   void cancel() override {
-    if (isCancelled_.exchange(true) || state_->executor().isEnding.load()) return;
-    asio::post(state_->executor().context, [state = state_] { state->cancel(); });
+    if (!state_->markCancelled() || state_->executor().isEnding.load()) return;
+    asio::post(state_->executor().context, [state = state_] { state->stopWaiting(); });
   }
 
  private:
   std::shared_ptr<State> state_;
-  std::atomic<bool> isCancelled_{false};
 };
 
 class AsioWorkQueue final : public WorkQueue {

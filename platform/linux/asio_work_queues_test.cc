@@ -157,6 +157,32 @@ TEST_F(AsioWorkQueuesTest, LeewayIsHeldToHalfAPeriod) {
   settle(*queue);
 }
 
+TEST_F(AsioWorkQueuesTest, TimersWithTheSameLeewayTickOnCommonMarks) {
+  const auto queue = queues->makeQueue("com.example.one");
+  constexpr auto kLeeway = 20ms;
+  const auto nextMark = [](Clock::time_point time) {
+    return Clock::time_point(
+        std::chrono::ceil<std::chrono::duration<int64_t, std::ratio<20, 1000>>>(time.time_since_epoch()));
+  };
+  for (int i = 0; i < 6; ++i) {
+    auto timer = queue->makeTimer(2 * kLeeway, kLeeway);
+    std::promise<Clock::time_point> ticked;
+    const auto earliest = nextMark(Clock::now() + 2 * kLeeway);
+    timer->start(
+        [&ticked, &timer] {
+          timer->cancel();
+          ticked.set_value(Clock::now());
+        },
+        nullptr);
+    auto tick = ticked.get_future();
+    ASSERT_EQ(tick.wait_for(test::kDeadline), std::future_status::ready);
+    EXPECT_GE(tick.get(), earliest);
+    settle(*queue);
+    const test::Deadline elsewhere(std::chrono::milliseconds(3 + i));  // the next begins off the mark
+    while (!elsewhere.passed()) std::this_thread::yield();
+  }
+}
+
 TEST_F(AsioWorkQueuesTest, TimerWithoutAPeriodIsRefused) {
   EXPECT_EQ(queues->makeQueue("com.example.one")->makeTimer(0ms, 0ms), nullptr);
 }
@@ -209,6 +235,80 @@ TEST_F(AsioWorkQueuesTest, CancelHandlerMayCloseTheDescriptorAndRunsOnce) {
   EXPECT_EQ(events.load(), 0);
   EXPECT_FALSE(static_cast<bool>(here));
   EXPECT_EQ(queues->sourcesUnderWay(), 0U);
+}
+
+TEST_F(AsioWorkQueuesTest, EventThatHasHappenedIsNotHandledOnceItsSourceIsCancelledOnTheQueue) {
+  const auto queue = queues->makeQueue("com.example.one");
+  auto one = queue->makeTimer(5ms, 0ms);
+  auto other = queue->makeTimer(5ms, 0ms);
+  std::atomic<int> events{0};
+  const auto tick = [&] {
+    ++events;
+    one->cancel();
+    other->cancel();
+  };
+  std::promise<void> both;
+  std::atomic<int> cancelled{0};
+  const auto end = [&both, &cancelled] {
+    if (++cancelled == 2) both.set_value();
+  };
+  one->start(tick, end);
+  other->start(tick, end);
+  queue->async([] {  // until both are overdue, and their events come in one go
+    const test::Deadline deadline(30ms);
+    while (!deadline.passed()) std::this_thread::yield();
+  });
+  expectSoon(both.get_future());
+  settle(*queue);
+  EXPECT_EQ(events.load(), 1);
+  EXPECT_EQ(cancelled.load(), 2);
+}
+
+TEST_F(AsioWorkQueuesTest, SourceThatIsCancelledBeforeItsStartOnlyEnds) {
+  const auto queue = queues->makeQueue("com.example.one");
+  auto timer = queue->makeTimer(1ms, 0ms);
+  timer->cancel();
+  std::promise<void> cancelled;
+  timer->start([] { ADD_FAILURE() << "an event after the end"; }, [&cancelled] { cancelled.set_value(); });
+  expectSoon(cancelled.get_future());
+  settle(*queue);
+  EXPECT_EQ(queues->sourcesUnderWay(), 0U);
+}
+
+TEST_F(AsioWorkQueuesTest, CancelHandlerMayCloseTheDescriptorForANewOneOfItsNumber) {
+  const auto queue = queues->makeQueue("com.example.one");
+  auto pair = socketPair();
+  const int number = pair.first.get();
+  auto source = queue->makeReadSource(number);
+  ASSERT_NE(source, nullptr);
+  std::pair<UniqueFd, UniqueFd> newPair;
+  std::unique_ptr<EventSource> newSource;
+  std::promise<void> isReadable;
+  std::promise<void> replaced;
+  source->start([] {},
+                [&] {
+                  auto made = socketPair();
+                  pair.first.reset();
+                  EXPECT_EQ(::dup2(made.first.get(), number), number);
+                  newPair = {UniqueFd(number), std::move(made.second)};
+                  newSource = queue->makeReadSource(number);
+                  ASSERT_NE(newSource, nullptr);
+                  newSource->start(
+                      [&isReadable, &newSource] {
+                        newSource->cancel();
+                        isReadable.set_value();
+                      },
+                      nullptr);
+                  replaced.set_value();
+                });
+  source->cancel();
+  expectSoon(replaced.get_future());
+  settle(*queue);
+  source.reset();  // what is left of it must not take the number for its own
+  settle(*queue);
+  EXPECT_EQ(::send(newPair.second.get(), "x", 1, 0), 1);
+  expectSoon(isReadable.get_future());
+  settle(*queue);
 }
 
 TEST_F(AsioWorkQueuesTest, SourceThatIsLetGoLetsGoOfWhatItsHandlersHold) {
