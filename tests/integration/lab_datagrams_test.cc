@@ -5,6 +5,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <set>
 #include <utility>
@@ -120,6 +121,10 @@ TEST(LabDatagramFormatTest, TheLongestTextComesBack) {
 
 class LabDatagramsTest : public ::testing::Test {
  protected:
+  // A lab of their own: one that knew their sessions already would count repetitions.
+  static void SetUpTestSuite() { ownLab() = std::make_unique<LabProcess>(); }
+  static void TearDownTestSuite() { ownLab().reset(); }
+
   LabDatagramsTest() {
     world.workQueues.real = &queues;
     world.datagramSockets.real = &sockets;
@@ -177,7 +182,12 @@ class LabDatagramsTest : public ::testing::Test {
     std::condition_variable().wait_for(lock, std::chrono::milliseconds(5));
   }
 
-  LabProcess& lab = LabProcess::shared();
+  static std::unique_ptr<LabProcess>& ownLab() {
+    static std::unique_ptr<LabProcess> lab;
+    return lab;
+  }
+
+  LabProcess& lab = *ownLab();
   fake::FakeWorld world;
   AsioWorkQueues queues{world.log};
   UdpSockets sockets;
