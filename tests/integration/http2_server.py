@@ -1,11 +1,11 @@
 """A server that speaks HTTP/2 over TLS and nothing else, on a free port of this host.
 
-Usage: http2_server.py CERTIFICATE KEY. The port stands on the first line of the output; the program ends with
-its standard input. What a request's path asks for:
+Usage: http2_server.py CERTIFICATE KEY. The port stands on the first line of the output; each line that follows
+tells the connection and the path of a request. The program ends with its standard input. What a path asks for:
 
   /together/N  no answer until N requests wait on one connection; the last one that came is answered first
   /reset       the stream is ended with an error instead of an answer
-  any other    an answer at once
+  any other    an answer at once, with the status that follows "?status=", else 202
 
 An answer says which connection it came on and repeats the request's body.
 """
@@ -50,7 +50,8 @@ class Connection:
             self.request_ended(event.stream_id)
 
     def request_ended(self, stream):
-        path = self.requests[stream][0]
+        path, _, _ = self.requests[stream][0].partition("?")
+        print(self.number, path, flush=True)
         if path == "/reset":
             self.h2.reset_stream(stream, h2.errors.ErrorCodes.INTERNAL_ERROR)
         elif path.startswith("/together/"):
@@ -62,8 +63,10 @@ class Connection:
             self.answer(stream)
 
     def answer(self, stream):
-        body = b"answer to " + self.requests.pop(stream)[1]
-        self.h2.send_headers(stream, [(":status", "202"), ("x-connection", str(self.number))])
+        path, sent = self.requests.pop(stream)
+        body = b"answer to " + sent
+        status = path.partition("?status=")[2] or "202"
+        self.h2.send_headers(stream, [(":status", status), ("x-connection", str(self.number))])
         size = self.h2.max_outbound_frame_size
         for start in range(0, len(body), size):
             self.h2.send_data(stream, body[start : start + size])

@@ -9,10 +9,14 @@
 #include "platform/fake/fake_log.h"
 #include "platform/linux/curl_http_client.h"
 #include "tests/helpers/child_process.h"
+#include "tests/helpers/lab_process.h"
+#include "tests/helpers/private_instance.h"
 #include "tests/helpers/programs.h"
+#include "tests/helpers/storebags.h"
 #include "tests/helpers/test_certificates.h"
+#include "tests/helpers/test_session.h"
 
-// The daemon's HTTP client against a server that speaks HTTP/2.
+// The HTTP client by itself, and in the daemon, against a server that speaks HTTP/2.
 
 namespace tarnel::test {
 namespace {
@@ -36,10 +40,13 @@ class Http2Test : public ::testing::Test {
     client_ = std::make_unique<CurlHttpClient>(log_, client);
   }
 
+  std::string url(const std::string& path) const {
+    return "https://127.0.0.1:" + std::to_string(port_) + path;
+  }
   HttpRequest post(const std::string& path, std::string body) const {
     HttpRequest request;
     request.method = "POST";
-    request.url = "https://127.0.0.1:" + std::to_string(port_) + path;
+    request.url = url(path);
     request.body = std::make_shared<const std::string>(std::move(body));
     return request;
   }
@@ -105,6 +112,25 @@ TEST_F(Http2Test, AStreamThatFailsCostsNoOther) {
   expectAnswer(results[0], "one");
   EXPECT_TRUE(results[1].error);
   expectAnswer(results[2], "two");
+}
+
+TEST_F(Http2Test, TheDaemonsPostsShareOneConnectionAndItReadsTheirAnswers) {
+  const LabProcess& lab = LabProcess::shared();
+  PrivateInstance instance;
+  lab.connect(instance);
+  instance.folder().write("config/trust.d/http2.pem", authority_.certificatePem());
+  instance.setConsent(true);
+  const Dictionary entry = clientEntry(url("/"), url("/together/6?status=503"));
+  lab.serve("brevan", storebag("1", {{"httppost", profile({entry})}}));
+  ASSERT_TRUE(instance.start());
+  TestSession session(instance, {});
+  ASSERT_TRUE(server_->waitForOutput("1 /\n"));  // the start message
+  for (uint16_t i = 0; i < 6; ++i) {
+    ASSERT_TRUE(session.send(2, i, client::Dictionary().set("i", i), client::Flag::realtime).ok());
+  }
+  // Which comes only once all six are there.
+  EXPECT_TRUE(instance.waitForLog("postJSONMessage: backend httppost disabled by server 503 return code"));
+  EXPECT_EQ(countOf("1 /together/6\n", server_->output()), 6U) << server_->output();
 }
 
 }  // namespace
