@@ -1,11 +1,15 @@
 #include "tests/fuzz/scratch_folder.h"
 
+#include <signal.h>
 #include <stdlib.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
+#include <cerrno>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
+#include <system_error>
 
 #include "tests/fuzz/fuzz_target.h"
 
@@ -14,13 +18,27 @@ namespace {
 
 namespace fs = std::filesystem;
 
+constexpr std::string_view kPrefix = "tarnel-fuzz-";
+
+// A fuzzer mostly ends without destructors; its number stands in its folder's name.
+void removeLeftovers(const fs::path& parent) {
+  std::error_code ignored;
+  for (const auto& entry : fs::directory_iterator(parent, ignored)) {
+    const auto name = entry.path().filename().string();
+    if (!name.starts_with(kPrefix)) continue;
+    const auto process = ::atoi(name.c_str() + kPrefix.size());
+    if (process > 0 && ::kill(process, 0) != 0 && errno == ESRCH) fs::remove_all(entry.path(), ignored);
+  }
+}
+
 }  // namespace
 
 ScratchFolder::ScratchFolder() {
   ::umask(022);  // files that others can write are not trusted
   const fs::path memory("/dev/shm");
-  std::string pattern =
-      (fs::is_directory(memory) ? memory : fs::temp_directory_path()) / "tarnel-fuzz-XXXXXX";
+  const auto parent = fs::is_directory(memory) ? memory : fs::temp_directory_path();
+  removeLeftovers(parent);
+  std::string pattern = parent / (std::string(kPrefix) + std::to_string(::getpid()) + "-XXXXXX");
   require(mkdtemp(pattern.data()) != nullptr, "a folder for files can be made");
   path_ = pattern;
 }
