@@ -118,7 +118,8 @@ LinuxDeviceInformation::LinuxDeviceInformation(const std::string& configurationD
                                                std::string rootDirectory, Log& log)
     : overrides_(configurationDirectory + "/device.toml"),
       root_(std::move(rootDirectory)),
-      problems_("LinuxDeviceInformation(copyAnswer)", log) {}
+      problems_("LinuxDeviceInformation(copyAnswer)", log),
+      missing_("LinuxDeviceInformation(copyAnswer)", log) {}
 
 std::optional<std::string> LinuxDeviceInformation::overridden(std::string_view key) {
   std::vector<ConfigurationProblem> problems;
@@ -161,11 +162,23 @@ std::optional<std::string> LinuxDeviceInformation::copyAnswer(std::string_view k
   }
   if (key == "HWModelStr") return firmware("compatible", "board_name");
   if (key == "SerialNumber") return firmware("serial-number", "product_serial");
-  if (key == "UniqueDeviceID") {
-    const auto machineID = readFirstLine(root_ + "/etc/machine-id");
-    return machineID ? uniqueDeviceID(*machineID) : std::nullopt;
-  }
+  if (key == "UniqueDeviceID") return uniqueDeviceIDOfThisMachine();
   return std::nullopt;
+}
+
+std::optional<std::string> LinuxDeviceInformation::uniqueDeviceIDOfThisMachine() {
+  const std::string path = root_ + "/etc/machine-id";
+  const auto machineID = readFirstLine(path);
+  auto identifier = machineID ? uniqueDeviceID(*machineID) : std::nullopt;
+  std::vector<ConfigurationProblem> problems;
+  if (!identifier) {
+    problems.push_back({LogLevel::warning, path +
+                                               " holds no identifier, so that this device has none: run "
+                                               "systemd-machine-id-setup, or set UniqueDeviceID in " +
+                                               overrides_});
+  }
+  missing_.report(problems);
+  return identifier;
 }
 
 }  // namespace tarnel

@@ -18,7 +18,7 @@ namespace tarnel {
 // of machine-info, else the host name. "HWModelStr": first compatible name of the device tree, else DMI's
 // board name. "SerialNumber": of the device tree, else of DMI, where they may be read. "ReleaseType": only
 // from device.toml. "UniqueDeviceID": 40 lower-case hexadecimal digits that follow from the machine-id, which
-// itself never leaves the machine.
+// itself never leaves the machine. Where there is none (in containers, say), a warning names the remedies.
 //
 // A text in device.toml that is empty says that the device has no answer.
 class LinuxDeviceInformation final : public DeviceInformation {
@@ -33,9 +33,12 @@ class LinuxDeviceInformation final : public DeviceInformation {
   std::optional<std::string> overridden(std::string_view key);
   std::optional<std::string> firmware(const char* deviceTreeName, const char* dmiName) const;
 
+  std::optional<std::string> uniqueDeviceIDOfThisMachine();
+
   const std::string overrides_;
   const std::string root_;
   OnceLog problems_;
+  OnceLog missing_;
 };
 
 // The device's identifier as it follows from the text of /etc/machine-id; nothing when that is no machine-id

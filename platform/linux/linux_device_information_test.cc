@@ -20,8 +20,8 @@ class LinuxDeviceInformationTest : public testing::Test {
 };
 
 TEST_F(LinuxDeviceInformationTest, AMachineThatSaysNothingHasFewAnswers) {
-  for (const char* key : {"ProductVersion", "ProductType", "HWModelStr", "SerialNumber", "ReleaseType",
-                          "UniqueDeviceID", "NoSuchKey", ""}) {
+  for (const char* key :
+       {"ProductVersion", "ProductType", "HWModelStr", "SerialNumber", "ReleaseType", "NoSuchKey", ""}) {
     EXPECT_FALSE(answer(key)) << key;
   }
   utsname names{};
@@ -81,6 +81,22 @@ TEST_F(LinuxDeviceInformationTest, TheUniqueIdentifierHas40DigitsAndHidesTheMach
                            "0123456789ABCDEF0123456789ABCDEF", "00000000000000000000000000000000"}) {
     EXPECT_FALSE(uniqueDeviceID(text)) << text;
   }
+}
+
+TEST_F(LinuxDeviceInformationTest, AMachineWithoutIdentifierIsToldOnceWithItsRemedies) {
+  EXPECT_FALSE(answer("UniqueDeviceID"));
+  EXPECT_FALSE(answer("UniqueDeviceID"));
+  const fake::FakeLog::Line warning{LogLevel::warning,
+                                    "LinuxDeviceInformation(copyAnswer): " + folder_.path("etc/machine-id") +
+                                        " holds no identifier, so that this device has none: run "
+                                        "systemd-machine-id-setup, or set UniqueDeviceID in " +
+                                        folder_.path("config/device.toml")};
+  EXPECT_EQ(log_.lines(), std::vector{warning});
+  folder_.write("config/device.toml", "UniqueDeviceID = \"mine\"\n");
+  EXPECT_EQ(answer("UniqueDeviceID"), "mine");
+  folder_.write("config/device.toml", "UniqueDeviceID = \"\"\n");
+  EXPECT_FALSE(answer("UniqueDeviceID"));
+  EXPECT_EQ(log_.lines(), std::vector{warning});
 }
 
 TEST_F(LinuxDeviceInformationTest, TheAdministratorDecidesKeyByKeyAndAtOnce) {

@@ -57,6 +57,8 @@ PrivateInstance::PrivateInstance() {
   folder_.copyFrom(std::string(kSourceDirectory) + "/packaging/sandbox/com.orvane.tarneld.profile",
                    "config/sandbox.d/com.orvane.tarneld.profile");
   setConfiguration("[locale]\ncountry = \"DE\"\n");
+  // A container may have no machine-id to make one of.
+  folder_.write("config/device.toml", "UniqueDeviceID = \"0123456789abcdef0123456789abcdef01234567\"\n");
   setEntitlements("[[grant]]\nentitlement = \"com.orvane.private.tarneld\"\nuser = " +
                   std::to_string(::geteuid()) + "\n");
   bundle_ = folder_.path("no-bundle");
