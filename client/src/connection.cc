@@ -11,6 +11,7 @@
 #include <string_view>
 #include <utility>
 
+#include "client/src/options.h"
 #include "client/src/request_codec.h"
 #include "platform/ipc/dbus_codec.h"
 #include "platform/ipc/wire.h"
@@ -59,8 +60,10 @@ Dialled dial(const std::string& path) {
   if (error == EAGAIN || error == EINTR || error == EINPROGRESS) {
     dialled.isBusy = true;
   } else if (error == ENOENT || error == ECONNREFUSED || error == ENOTDIR) {
-    dialled.outcome = failure(TARNEL_ERROR_NO_DAEMON, "no daemon is listening at " + path +
-                                                          ": start it with systemctl start tarneld");
+    const char* remedy = path == kDefaultSocketPath
+                             ? ": start it with systemctl start tarneld"
+                             : ": start the daemon of that instance, or name another socket (TARNEL_SOCKET)";
+    dialled.outcome = failure(TARNEL_ERROR_NO_DAEMON, "no daemon is listening at " + path + remedy);
   } else if (error == EACCES || error == EPERM) {
     dialled.isRefused = true;
     dialled.outcome = failure(TARNEL_ERROR_REFUSED, "this user may not connect to " + path + ": " +

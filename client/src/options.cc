@@ -7,7 +7,6 @@
 namespace tarnel::core {
 namespace {
 
-constexpr char kDefaultSocketPath[] = "/run/tarneld/com.orvane.tarneld";
 constexpr size_t kMaxPathBytes = sizeof(sockaddr_un::sun_path) - 1;
 
 Outcome checkRange(const char* name, int64_t value, int64_t lowest, int64_t highest) {

@@ -33,6 +33,8 @@ struct Handlers {
 // Names the first option that is out of its range.
 Outcome check(const Options& options);
 
+inline constexpr char kDefaultSocketPath[] = "/run/tarneld/com.orvane.tarneld";
+
 // `wanted` if it is not empty, else the environment variable TARNEL_SOCKET (unless this is a set-user-id
 // or set-group-id program), else the installed default.
 std::string resolveSocketPath(const std::string& wanted);

@@ -67,8 +67,8 @@ class DisconnectionTest : public ::testing::Test {
 };
 
 TEST_F(DisconnectionTest, AMissingDaemonIsToldWithItsRemedy) {
-  const std::string expected =
-      "no daemon is listening at " + path_ + ": start it with systemctl start tarneld";
+  const std::string expected = "no daemon is listening at " + path_ +
+                               ": start the daemon of that instance, or name another socket (TARNEL_SOCKET)";
   Session session(options());
   const auto seen = watch_.waitFor(1);
   EXPECT_EQ(seen[0].kind, "interrupted");

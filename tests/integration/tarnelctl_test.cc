@@ -124,7 +124,7 @@ TEST_F(TarnelctlTest, ExitStatusSaysWhetherADaemonServesUs) {
   const auto none = send();
   EXPECT_EQ(none.end.status, 3);
   EXPECT_THAT(none.errors,
-              HasSubstr("no daemon is listening at " + instance.socketPath() + ": start it with"));
+              HasSubstr("no daemon is listening at " + instance.socketPath() + ": start the daemon"));
   instance.setEntitlements("# nobody\n");
   ASSERT_TRUE(instance.start());
   const auto refused = send();

@@ -28,6 +28,11 @@ class StandardErrorLog final : public Log {
 
 // Standard output and standard error; on a terminal nothing that is printed can steer it.
 struct StandardStreams {
+  // An answer that came before an error is also shown before it.
+  StandardStreams() { err.tie(&out); }
+  StandardStreams(const StandardStreams&) = delete;
+  StandardStreams& operator=(const StandardStreams&) = delete;
+
   const bool outIsTerminal = isatty(STDOUT_FILENO) == 1;
   const bool errIsTerminal = isatty(STDERR_FILENO) == 1;
   VisibleOutput visibleOut{*std::cout.rdbuf()};

@@ -27,6 +27,39 @@ bool isThere(const std::string& path) {
   return ::lstat(path.c_str(), &status) == 0;
 }
 
+// What can be told before the daemon is asked; the library and the daemon look at all else.
+bool canBeUploaded(const std::string& path, const Terminal& terminal) {
+  struct stat status {};
+  if (::lstat(path.c_str(), &status) != 0) {
+    terminal.err << "tarnelctl: " << path << " cannot be read: " << std::strerror(errno) << '\n';
+    return false;
+  }
+  if (S_ISREG(status.st_mode) && status.st_size == 0) {
+    terminal.err << "tarnelctl: " << path << " is empty: only files that hold something are uploaded\n";
+    return false;
+  }
+  return true;
+}
+
+// Of all levels. The client library's values know none.
+size_t nullsIn(const Value& value) {
+  size_t count = value.isNull() ? 1 : 0;
+  if (const auto* array = value.array()) {
+    for (const auto& element : *array) count += nullsIn(element);
+  } else if (const auto* dictionary = value.dictionary()) {
+    for (const auto& [key, held] : *dictionary) count += nullsIn(held);
+  }
+  return count;
+}
+
+void reportNulls(const Array& records, const Terminal& terminal) {
+  const size_t count = nullsIn(Value(records));
+  if (count == 0) return;
+  terminal.err << "tarnelctl: " << count
+               << (count == 1 ? " null in the records is" : " nulls in the records are")
+               << " left out: there is no such value in a call\n";
+}
+
 Error refusal(std::string text) {
   return {kLogRecordsErrorDomain, -1, std::move(text)};
 }
@@ -101,6 +134,7 @@ Result<Array> readLogRecords(std::istream& input, size_t maxBytes) {
 }
 
 ExitStatus uploadFile(const SendOptions& options, const std::string& path, const Terminal& terminal) {
+  if (!canBeUploaded(path, terminal)) return ExitStatus::failed;
   Dictionary json;
   auto session = makeSession(options);
   if (const auto status = startSession(session, options, json, terminal); status != ExitStatus::ok)
@@ -116,8 +150,8 @@ ExitStatus uploadFile(const SendOptions& options, const std::string& path, const
   if (!reply.success) {
     terminal.err
         << "tarnelctl: the file was not uploaded: the storebag of client type " << options.clientType
-        << " may name no server for files, or the file is empty or above limits.max_upload_bytes; the "
-           "daemon's log says which\n";
+        << " may name no server for files, or the file is above limits.max_upload_bytes; the daemon's log "
+           "says which\n";
   } else if (!isDeleted) {
     terminal.err
         << "tarnelctl: the file is still there: the server was not reached or did not say that it "
@@ -137,6 +171,7 @@ ExitStatus uploadLogRecords(const SendOptions& options, const std::string& path,
                  << records.error().localizedDescription() << '\n';
     return ExitStatus::failed;
   }
+  reportNulls(*records, terminal);
   Dictionary json;
   auto session = makeSession(options);
   if (const auto status = startSession(session, options, json, terminal); status != ExitStatus::ok)
@@ -147,7 +182,8 @@ ExitStatus uploadLogRecords(const SendOptions& options, const std::string& path,
     json.set("upload",
              Dictionary{{"success", reply.success}, {"records", static_cast<int64_t>(records->size())}});
   } else if (reply.success) {
-    terminal.out << "upload: " << records->size() << " records were taken\n";
+    terminal.out << "upload: " << records->size()
+                 << (records->size() == 1 ? " record was taken\n" : " records were taken\n");
   }
   if (!reply.success) {
     terminal.err << "tarnelctl: the records were not uploaded: the storebag of client type "

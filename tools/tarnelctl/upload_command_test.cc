@@ -1,7 +1,10 @@
 #include "tools/tarnelctl/upload_command.h"
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <filesystem>
+#include <fstream>
 #include <sstream>
 
 namespace tarnel::ctl {
@@ -53,6 +56,36 @@ class UnreadableFileTest : public ::testing::Test {
 TEST_F(UnreadableFileTest, TheReasonIsSaid) {
   EXPECT_EQ(refusal("/nonexistent"), "tarnelctl: /nonexistent cannot be read: No such file or directory\n");
   EXPECT_EQ(refusal("/"), "tarnelctl: / cannot be read: Is a directory\n");
+}
+
+TEST_F(UnreadableFileTest, WhatCannotBeUploadedIsToldBeforeTheDaemonIsAsked) {
+  const SendOptions options{.socketPath = "/nonexistent"};
+  EXPECT_EQ(uploadFile(options, "/nonexistent", {out_, err_}), ExitStatus::failed);
+  EXPECT_EQ(err_.str(), "tarnelctl: /nonexistent cannot be read: No such file or directory\n");
+  err_.str("");
+  const std::string path = ::testing::TempDir() + "/tarnelctl-empty-upload";
+  std::ofstream(path).close();
+  EXPECT_EQ(uploadFile(options, path, {out_, err_}), ExitStatus::failed);
+  EXPECT_EQ(err_.str(), "tarnelctl: " + path + " is empty: only files that hold something are uploaded\n");
+  std::filesystem::remove(path);
+  EXPECT_EQ(out_.str(), "");
+}
+
+TEST_F(UnreadableFileTest, NullsThatGetLostAreCounted) {
+  const auto told = [this](const char* text) {
+    const std::string path = ::testing::TempDir() + "/tarnelctl-nulls";
+    std::ofstream(path) << text;
+    err_.str("");
+    uploadLogRecords({.socketPath = "/nonexistent"}, path, {out_, err_});
+    std::filesystem::remove(path);
+    return err_.str();
+  };
+  EXPECT_THAT(told(R"([{"a": null}])"),
+              ::testing::StartsWith("tarnelctl: 1 null in the records is left out: there is no such value in "
+                                    "a call\n"));
+  EXPECT_THAT(told(R"([{"a": [1, null, {"b": null}]}])"),
+              ::testing::StartsWith("tarnelctl: 2 nulls in the records are left out"));
+  EXPECT_THAT(told(R"([{"a": "null"}])"), ::testing::Not(::testing::HasSubstr("left out")));
 }
 
 TEST_F(UnreadableFileTest, AReadThatFailsIsNoEndOfTheFile) {
