@@ -43,7 +43,7 @@ const std::set<std::string_view> kMilestones = {"fetched",
 namespace {
 
 constexpr int kClientTypes = 20;
-constexpr size_t kMostSteps = 100;
+constexpr size_t kMostSteps = 40;
 constexpr char kModified[] = "Tue, 14 Nov 2023 22:13:20 GMT";
 
 // What the agent should know of one storebag.
