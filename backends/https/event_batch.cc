@@ -48,8 +48,23 @@ void EventBatch::append(Dictionary event, size_t bytes) {
   bytes_ += bytes;
 }
 
-void EventBatch::mergeIntoAll(const Dictionary& fields) {
-  for (auto& held : events_) held.event.merge(fields);
+size_t EventBatch::mergeIntoAll(const Dictionary& fields) {
+  if (bytes_ + estimateSize(fields) * events_.size() <= kMaxBytes) {
+    for (auto& held : events_) held.event.merge(fields);
+    return 0;
+  }
+  bytes_ = 0;
+  for (size_t left = events_.size(); left > 0; --left) {
+    Held& held = events_[left - 1];
+    held.event.merge(fields);
+    held.bytes = estimateSize(held.event);
+    if (left < events_.size() && bytes_ + held.bytes > kMaxBytes) {
+      events_.erase(events_.begin(), events_.begin() + static_cast<std::ptrdiff_t>(left));
+      return left;
+    }
+    bytes_ += held.bytes;
+  }
+  return 0;
 }
 
 Array EventBatch::takeEvents() {

@@ -26,8 +26,9 @@ class EventBatch {
   size_t makeRoomFor(size_t bytes);
   void append(Dictionary event, size_t bytes);
 
-  // Every entry of `fields` is set in every event.
-  void mergeIntoAll(const Dictionary& fields);
+  // Every entry of `fields` is set in every event. Where the events would outgrow kMaxBytes by that, the
+  // oldest are dropped, all but the last; returns how many.
+  size_t mergeIntoAll(const Dictionary& fields);
   // Leaves the batch empty.
   Array takeEvents();
 

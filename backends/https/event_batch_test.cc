@@ -27,6 +27,33 @@ TEST(EventBatchTest, MergesIntoEveryEvent) {
   EXPECT_EQ(batch.takeEvents(), (Array{Dictionary{{"a", 2}}, Dictionary{{"b", 1}, {"a", 2}}}));
 }
 
+// What is merged may be much larger than the events, and comes once for each.
+TEST(EventBatchTest, MergingStaysWithinTheBoundByDroppingTheOldest) {
+  EventBatch batch;
+  for (int i = 0; i < 100; ++i) batch.append(numbered(i), EventBatch::estimateSize(numbered(i)));
+  const Dictionary quarter{{"text", std::string(EventBatch::kMaxBytes / 4, 'x')}};
+  EXPECT_EQ(batch.mergeIntoAll(quarter), 97U);
+  EXPECT_FALSE(batch.hasRoomFor(EventBatch::kMaxBytes / 4));
+  EXPECT_TRUE(batch.hasRoomFor(EventBatch::kMaxBytes / 8));
+  // Set once more, it takes no more room.
+  EXPECT_EQ(batch.mergeIntoAll(quarter), 0U);
+  const Array events = batch.takeEvents();
+  ASSERT_EQ(events.size(), 3U);
+  for (size_t i = 0; i < 3; ++i) {
+    EXPECT_EQ(*events[i].dictionary()->find("n"), Value(97 + i));
+    EXPECT_TRUE(events[i].dictionary()->contains("text"));
+  }
+}
+
+TEST(EventBatchTest, TheNewestEventStaysWhateverIsMerged) {
+  EventBatch batch;
+  for (int i = 0; i < 3; ++i) batch.append(numbered(i), 10);
+  EXPECT_EQ(batch.mergeIntoAll({{"text", std::string(EventBatch::kMaxBytes + 1, 'x')}}), 2U);
+  const Array events = batch.takeEvents();
+  ASSERT_EQ(events.size(), 1U);
+  EXPECT_EQ(*events[0].dictionary()->find("n"), Value(2));
+}
+
 TEST(EventBatchTest, BoundsBytesByDroppingTheOldest) {
   EventBatch batch;
   for (int i = 0; i < 4; ++i) batch.append(numbered(i), EventBatch::kMaxBytes / 4);

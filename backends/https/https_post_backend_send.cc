@@ -110,7 +110,13 @@ MaybeString HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion comple
   if (userInfoDict()) {
     auto userInfo = *userInfoDict();
     _filters.filterEvent(userInfo);
-    _batchedEvents->mergeIntoAll(userInfo);
+    if (const size_t dropped = _batchedEvents->mergeIntoAll(userInfo); dropped != 0) {
+      TARNEL_LOG(
+          dependencies().log, warning,
+          "HTTPSPostBackend(flushMessagesWithCompletion): %s: the oldest %zu events are dropped, since with "
+          "the user information all would exceed %zu bytes",
+          name().c_str(), dropped, EventBatch::kMaxBytes);
+    }
   }
   auto events = _batchedEvents->takeEvents();
   MaybeString pretty;

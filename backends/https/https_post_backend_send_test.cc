@@ -357,6 +357,24 @@ TEST_F(HTTPSPostBackendSendTest, FlushDoesNotTouchTheUserInfoItself) {
 
 // --- correlated identifier ---
 
+// A client may keep back a large user information until many events are held.
+TEST_F(HTTPSPostBackendSendTest, UserInfoThatComesLateDoesNotOutgrowTheBound) {
+  const auto late = userInfo;
+  userInfo.reset();
+  const auto backend = makeUpdated();
+  for (int i = 0; i < 40; ++i) send(*backend);
+  userInfo = late;
+  userInfo->set("large", std::string(1U << 20U, 'x'));
+  backend->setUserInfoDict(userInfo);
+  backend->updateState();
+  flush(*backend);
+  EXPECT_EQ(postedEvents().size(), 3U);
+  expectLog(
+      LogLevel::warning,
+      "HTTPSPostBackend(flushMessagesWithCompletion): httppost: the oldest 37 events are dropped, since "
+      "with the user information all would exceed 4194304 bytes");
+}
+
 TEST_F(HTTPSPostBackendSendTest, CorrelatedIdentifierRelabelsTheBatch) {
   const auto backend = makeUpdated();
   backend->setCombinedSessionIDString("own");
