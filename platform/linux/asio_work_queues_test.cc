@@ -266,10 +266,11 @@ TEST_F(AsioWorkQueuesTest, EventThatHasHappenedIsNotHandledOnceItsSourceIsCancel
 
 TEST_F(AsioWorkQueuesTest, SourceThatIsCancelledBeforeItsStartOnlyEnds) {
   const auto queue = queues->makeQueue("com.example.one");
-  auto timer = queue->makeTimer(1ms, 0ms);
-  timer->cancel();
+  const auto pair = socketPair();
+  auto source = queue->makeReadSource(pair.first.get());  // on which nothing ever happens
+  source->cancel();
   std::promise<void> cancelled;
-  timer->start([] { ADD_FAILURE() << "an event after the end"; }, [&cancelled] { cancelled.set_value(); });
+  source->start([] { ADD_FAILURE() << "an event after the end"; }, [&cancelled] { cancelled.set_value(); });
   expectSoon(cancelled.get_future());
   settle(*queue);
   EXPECT_EQ(queues->sourcesUnderWay(), 0U);
