@@ -229,7 +229,8 @@ std::unique_ptr<IpcListener> LinuxWorld::createListener(const char* /*serviceNam
       SdBusListener::Options{.runtimeDirectory = prepared_->directories.runtime(),
                              .limits = ipcLimits(prepared_->configuration),
                              .readCredentials = readPeerCredentials,
-                             .clientFiles = prepared_->clientFiles},
+                             .clientFiles = prepared_->clientFiles,
+                             .callsLeftBehind = [this](size_t) { callsLeftBehind_ = true; }},
       prepared_->entitlements, log_);
 }
 

@@ -23,12 +23,15 @@ class LinuxWorld final : public ServiceHost {
   int runEventLoop() override;
   void finishPosts() override;
   void stopLogging() override;
+  // Calls of clients still run and use this: the process must end without destroying it.
+  bool hasCallsLeftBehind() const noexcept { return callsLeftBehind_; }
 
  private:
   struct Prepared;
 
   std::shared_ptr<class TarnelLogging> log_;
   std::unique_ptr<Prepared> prepared_;
+  bool callsLeftBehind_ = false;
 };
 
 }  // namespace tarnel

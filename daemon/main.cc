@@ -35,7 +35,9 @@ int main(int argc, char** argv) {
   if (argc > 1) return answerArguments(argv[1]);
   try {
     tarnel::LinuxWorld world;
-    return tarnel::runService(world);
+    const int status = tarnel::runService(world);
+    if (world.hasCallsLeftBehind()) std::_Exit(status);
+    return status;
   } catch (const std::exception& failure) {
     std::fprintf(stderr, "tarneld: cannot go on: %s\n", failure.what());
     return EXIT_FAILURE;

@@ -4,6 +4,7 @@
 #include <sys/eventfd.h>
 
 #include <cerrno>
+#include <chrono>
 #include <system_error>
 #include <utility>
 
@@ -70,7 +71,7 @@ void* ConnectionRegistry::runThread(void* start) {
 void ConnectionRegistry::finished(uint64_t id) {
   const std::lock_guard lock(mutex_);
   const auto thread = running_.find(id);
-  over_.push_back(thread->second.handle);
+  if (!leftBehind_) over_.push_back(thread->second.handle);
   running_.erase(thread);
   eventfd_write(finishedEvent_.get(), 1);
 }
@@ -91,16 +92,25 @@ void ConnectionRegistry::reap() {
   for (const auto thread : over) pthread_join(thread, nullptr);
 }
 
-void ConnectionRegistry::stopAll() {
+size_t ConnectionRegistry::stopAll() {
+  using Clock = std::chrono::steady_clock;
   {
     const std::lock_guard lock(mutex_);
     stopping_ = true;
     for (const auto& [id, thread] : running_) thread.link->stop("the daemon ends");
   }
+  const auto end = Clock::now() + limits_.ending;
   for (reap(); threads() > 0; reap()) {
+    const auto left = std::chrono::ceil<std::chrono::milliseconds>(end - Clock::now()).count();
+    if (left <= 0) break;
     pollfd finished{finishedEvent_.get(), POLLIN, 0};
-    poll(&finished, 1, -1);
+    poll(&finished, 1, static_cast<int>(left));
   }
+  const std::lock_guard lock(mutex_);
+  leftBehind_ = true;
+  for (const auto& [id, thread] : running_) pthread_detach(thread.handle);
+  for (const auto thread : std::exchange(over_, {})) pthread_join(thread, nullptr);
+  return running_.size();
 }
 
 }  // namespace tarnel

@@ -61,8 +61,10 @@ class ConnectionRegistry : public std::enable_shared_from_this<ConnectionRegistr
   int finishedDescriptor() const noexcept { return finishedEvent_.get(); }
   // Joins what is over; never waits for a thread that still runs.
   void reap();
-  // Stops all connections and joins their threads; waits for calls that are being run.
-  void stopAll();
+  // Stops all connections and joins their threads; waits at most limits.ending for calls that are being run.
+  // Returns how many threads still run then: in a system call that does not return. Whatever they use must
+  // outlive them.
+  size_t stopAll();
 
  private:
   struct Thread {
@@ -90,6 +92,7 @@ class ConnectionRegistry : public std::enable_shared_from_this<ConnectionRegistr
   std::vector<pthread_t> over_;
   uint64_t lastId_ = 0;
   bool stopping_ = false;
+  bool leftBehind_ = false;  // nobody joins what still runs
 };
 
 }  // namespace tarnel

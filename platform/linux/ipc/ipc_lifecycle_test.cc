@@ -209,6 +209,37 @@ TEST_F(IpcLifecycleTest, StoppingTheListenerEndsAllConnections) {
   EXPECT_EQ(service.invalidations(), 5U);
   for (const auto& client : clients) EXPECT_EQ(client->call("StartConfig", ""), nullptr);
   EXPECT_FALSE(std::filesystem::exists(service.path()));
+  EXPECT_EQ(service.callsLeftBehind, 0U);
+}
+
+// A client can make a call last: it hands over a socket that lingers when it is closed, or a file of a file
+// system that never answers.
+TEST(IpcEndTest, ACallThatDoesNotReturnIsLeftBehindInTheEnd) {
+  IpcLimits limits;
+  limits.ending = std::chrono::milliseconds(50);
+  Service service(limits);
+  std::promise<void> begun;
+  std::promise<void> mayReturn;
+  service.prepare = [&begun, &mayReturn](RecordingSession& session) {
+    session.onCall = [&begun, &mayReturn](const std::string& call) {
+      if (call != "startConfig") return;
+      begun.set_value();
+      mayReturn.get_future().wait();
+    };
+  };
+  service.start();
+  BusClient stuck(service.path());
+  EXPECT_GE(stuck.post(stuck.newCall("StartConfig")), 0);
+  EXPECT_GE(sd_bus_flush(stuck.bus()), 0);
+  begun.get_future().wait();
+  BusClient other(service.path());
+  EXPECT_NE(other.call("FetchDisplayURL", ""), nullptr);
+  service.stop();
+  EXPECT_EQ(service.callsLeftBehind, 1U);
+  EXPECT_EQ(service.invalidations(), 1U);
+  EXPECT_TRUE(service.logged("IpcListener: Calls that had not returned after 50 ms and are left behind: 1"));
+  mayReturn.set_value();
+  EXPECT_TRUE(eventually([&] { return service.invalidations() == 2; }));
 }
 
 }  // namespace

@@ -18,6 +18,8 @@ struct IpcLimits {
   std::chrono::milliseconds authentication{10'000};
   // From the peer's end of sending to the end of the connection.
   std::chrono::milliseconds interruption{5'000};
+  // For the calls under way when the service ends; longer than a storebag's fetch.
+  std::chrono::milliseconds ending{20'000};
 };
 
 }  // namespace tarnel

@@ -41,7 +41,12 @@ SdBusListener::~SdBusListener() {
   accepting_.reset();
   reaping_.reset();
   pause_.reset();
-  registry_->stopAll();
+  const size_t left = registry_->stopAll();
+  if (left == 0) return;
+  log_->log(LogLevel::warning,
+            "IpcListener: Calls that had not returned after %lld ms and are left behind: %zu",
+            static_cast<long long>(options_.limits.ending.count()), left);
+  if (options_.callsLeftBehind) options_.callsLeftBehind(left);
 }
 
 MaybeError SdBusListener::resume() {

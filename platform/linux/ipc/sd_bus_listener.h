@@ -22,7 +22,8 @@ namespace tarnel {
 // runtime directory.
 //
 // Threads: made, resumed and destroyed on the thread that runs the event loop, which also calls the delegate.
-// Its destruction ends all connections and waits for the calls that they are running.
+// Its destruction ends all connections and waits for the calls that they are running, at most limits.ending:
+// a client can hand over a descriptor whose very closing blocks.
 class SdBusListener final : public IpcListener {
  public:
   struct Options {
@@ -32,6 +33,9 @@ class SdBusListener final : public IpcListener {
     std::function<PeerCredentials(int socket)> readCredentials;
     // Where files that clients hand over can be found; null: none are taken.
     std::shared_ptr<ClientFileRegistry> clientFiles;
+    // Told by the destructor how many calls had to be left behind, if any: their threads still use the
+    // delegate and all that it uses, so the process must end without destroying those.
+    std::function<void(size_t)> callsLeftBehind;
   };
 
   // The event loop's reference is held.
