@@ -66,7 +66,7 @@ static void write_value(FILE* line, const tarnel_value* value) {
       fprintf(line, "%g", values->value_double(value));
       break;
     case TARNEL_TYPE_DATE:
-      fprintf(line, "@%g", values->value_date(value));
+      fprintf(line, "@%.3f", values->value_date(value));
       break;
     case TARNEL_TYPE_STRING:
       fprintf(line, "\"%s\"", values->value_string(value, NULL));
