@@ -1,6 +1,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <fcntl.h>
 #include <sys/stat.h>
 
 #include <chrono>
@@ -180,6 +181,19 @@ TEST_F(FilesAndService, AFileIsHandedOverAndDeletedBeforeTheCompletionRuns) {
   EXPECT_TRUE(isGone.get_future().get());
   EXPECT_THAT(service.session()->calls(),
               ElementsAre("uploadFile file://" + service.folder().path() + "/a%20b%FF.log"));
+}
+
+TEST_F(FilesAndService, AProgramThatIsStartedMeanwhileInheritsNoFile) {
+  const auto path = write("x");
+  onFile([&path](ClientFile&) {
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+      std::error_code gone;
+      if (std::filesystem::read_symlink(entry, gone) != path) continue;
+      EXPECT_EQ(fcntl(std::stoi(entry.path().filename()), F_GETFD) & FD_CLOEXEC, FD_CLOEXEC);
+    }
+  });
+  client::Session session(optionsFor(service));
+  EXPECT_TRUE(session.uploadFileAndWait(path, kLong).success);
 }
 
 TEST_F(FilesAndService, WithoutTheWishTheFileStays) {

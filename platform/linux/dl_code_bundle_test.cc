@@ -73,6 +73,8 @@ TEST_F(DlCodeBundleTest, AMissingBundleIsNoneWithoutAMessage) {
   EXPECT_EQ(bundles.bundleWithPath(kPath), nullptr);
   folder.makeDirectory("System");
   EXPECT_EQ(bundles.bundleWithPath(kPath), nullptr);
+  std::ofstream(folder.path("System/Library")) << "a file where a folder is expected";
+  EXPECT_EQ(bundles.bundleWithPath(kPath), nullptr);
   EXPECT_THAT(log.lines(), IsEmpty());
 }
 
@@ -251,6 +253,7 @@ TEST_F(DlCodeBundleTest, WhatIsNoLibraryIsNamedWithTheLoadersReason) {
 TEST_F(DlCodeBundleTest, ALibraryWithoutTheFunctionIsNamed) {
   install(NO_EXPORT_ADAPTOR);
   EXPECT_EQ(instance(), nullptr);
+  EXPECT_FALSE(bundles.bundleWithPath(kPath)->isLoaded());
   EXPECT_THAT(log.lines(),
               ElementsAre(Line{LogLevel::error, "loadBundle: " + library_ +
                                                     ": does not export tarnel_adaptor_class_named; see "
