@@ -130,7 +130,14 @@ bool UploadBackend::post(const std::string& path, std::string compressed, Client
   const bool isText = isValidUtf8(*result.data);
   TARNEL_LOG(log, debug, "UploadBackend(uploadFileAtPath): sending to |%s|, Json output: %s",
              _uploadURL->c_str(), isText ? result.data->c_str() : "(null)");
-  if (isText && result.data->find("success") != std::string::npos) file.requestDeletion();
+  if (isText && result.data->find("success") != std::string::npos) {
+    file.requestDeletion();
+  } else {
+    TARNEL_LOG(
+        log, information,
+        "UploadBackend(uploadFileAtPath): the server does not say that it took %s (status %d), which stays",
+        path.c_str(), result.response ? result.response->statusCode : 0);
+  }
   return true;
 }
 

@@ -81,7 +81,7 @@ TEST_F(UploadBackendTest, MessagesAreNotItsBusiness) {
 }
 
 TEST_F(UploadBackendTest, TheRequestIsExactlyThis) {
-  EXPECT_TRUE(upload("/var/log/a b.log", "contents of the file"));
+  EXPECT_TRUE(upload("/var/log/a b.log", "contents of the file", "success"));
   const auto requests = world.http.requests();
   ASSERT_EQ(requests.size(), 1U);
   const auto& request = requests[0];
@@ -98,7 +98,7 @@ TEST_F(UploadBackendTest, TheRequestIsExactlyThis) {
   EXPECT_TRUE(logged(LogLevel::debug, "UploadBackend(uploadFileAtPath): Uploading file /var/log/a b.log"));
   EXPECT_TRUE(
       logged(LogLevel::debug,
-             "UploadBackend(uploadFileAtPath): sending to |https://files.example/up|, Json output: ok"));
+             "UploadBackend(uploadFileAtPath): sending to |https://files.example/up|, Json output: success"));
   for (const auto& line : world.log.lines()) EXPECT_EQ(line.level, LogLevel::debug) << line.text;
 }
 
@@ -206,6 +206,9 @@ TEST_F(UploadBackendTest, AnyOtherReplyKeepsTheFileAndIsNoFailure) {
     EXPECT_TRUE(upload("/x", "text", reply));
     EXPECT_THAT(journal(), ElementsAre("consume t", "read t", "release t")) << reply;
   }
+  EXPECT_TRUE(logged(LogLevel::information,
+                     "UploadBackend(uploadFileAtPath): the server does not say that it took /x (status 200), "
+                     "which stays"));
 }
 
 TEST_F(UploadBackendTest, AReplyThatIsNoTextKeepsTheFile) {
