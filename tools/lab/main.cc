@@ -68,9 +68,12 @@ int main(int argc, char** argv) {
   waitForEnd(signals.get(), (*lab)->stopRequestedFd());
   (*lab)->stop();
   const Dictionary status = (*lab)->status();
-  const auto count = [&status](const char* key) { return std::to_string(status.find(key)->int64Value()); };
-  console.ended("ended: received " + count("events") + " events in " + count("posts") + " posts, " +
-                count("uploads") + " files, " + count("logArchives") + " log archives and " +
-                count("datagrams") + " datagrams");
+  const auto count = [&status](const char* key, const char* what) {
+    const int64_t number = status.find(key)->int64Value();
+    return std::to_string(number) + " " + what + (number == 1 ? "" : "s");
+  };
+  console.ended("ended: received " + count("events", "event") + " in " + count("posts", "post") + ", " +
+                count("uploads", "file") + ", " + count("logArchives", "log archive") + " and " +
+                count("datagrams", "datagram"));
   return EXIT_SUCCESS;
 }

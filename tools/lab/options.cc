@@ -15,7 +15,8 @@ constexpr char kFooter[] =
 void addOptions(CLI::App& app, LabOptions& options) {
   app.add_option("-d,--directory", options.directory, "folder for keys, storebags and what arrives")
       ->capture_default_str();
-  app.add_option("--listen", options.listen, "numeric address for HTTPS")->capture_default_str();
+  app.add_option("--listen", options.listen, "numeric address for HTTPS and datagrams")
+      ->capture_default_str();
   app.add_option("-p,--port", options.port, "port for HTTPS, 0 for any free one")
       ->check(CLI::Range(0, 65535))
       ->capture_default_str();

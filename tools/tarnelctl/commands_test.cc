@@ -147,7 +147,9 @@ TEST_F(CommandTest, StorebagsAreMadeSignedVerifiedAndShown) {
                                .key = path("keys/storebag-key.pem"),
                                .binary = binary,
                                .force = true};
+    clear();
     ASSERT_EQ(signStorebag(sign, terminal_), ExitStatus::ok) << err();
+    EXPECT_TRUE(err().starts_with("warning: {{LAB_URL}}: only tarnel-lab puts an address there")) << err();
     clear();
     const StorebagOptions verify{.input = path("bag.signed"), .key = path("keys/bundle")};
     EXPECT_EQ(verifyStorebag(verify, terminal_), ExitStatus::ok) << err();
@@ -162,11 +164,14 @@ TEST_F(CommandTest, StorebagsAreMadeSignedVerifiedAndShown) {
 TEST_F(CommandTest, AForeignKeyDoesNotVerify) {
   ASSERT_EQ(makeStorebagKey({.output = path("a"), .bits = 2048}, terminal_), ExitStatus::ok);
   ASSERT_EQ(makeStorebagKey({.output = path("b"), .bits = 2048}, terminal_), ExitStatus::ok);
-  ASSERT_EQ(newStorebag({.output = path("bag.json")}, terminal_), ExitStatus::ok);
+  ASSERT_EQ(newStorebag({.output = path("bag.json"), .postURL = "https://reports.example"}, terminal_),
+            ExitStatus::ok);
+  clear();
   ASSERT_EQ(signStorebag({.input = path("bag.json"), .output = path("s"), .key = path("a/storebag-key.pem")},
                          terminal_),
             ExitStatus::ok)
       << err();
+  EXPECT_EQ(err().find("warning"), std::string::npos) << err();
   clear();
   EXPECT_EQ(verifyStorebag({.input = path("s"), .key = path("b/bundle/publicKey.der")}, terminal_),
             ExitStatus::failed);

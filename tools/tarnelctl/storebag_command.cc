@@ -124,6 +124,11 @@ ExitStatus signStorebag(const StorebagOptions& options, const Terminal& terminal
   const auto inner = parseDocument(*bytes);
   if (!inner) return fail(terminal, options.input + ": " + inner.error().localizedDescription());
   if (isSigned(*inner)) return fail(terminal, options.input + " is signed already: sign its inner document");
+  if (bytes->find("{{LAB_URL}}") != std::string::npos) {
+    terminal.err
+        << "warning: {{LAB_URL}}: only tarnel-lab puts an address there, as it serves a plain document: name "
+           "your server (storebag new --server)\n";
+  }
   if (report(*inner, terminal) && !options.force) {
     return fail(terminal, "not signed: mend the errors, or --force to sign it as it is");
   }
