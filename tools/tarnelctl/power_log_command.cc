@@ -142,7 +142,8 @@ class FileReader {
   void reportUnreadable() {
     if (unreadable_ != 0) {
       terminal_.err << "tarnelctl: " << options_.file << ": " << unreadable_
-                    << " lines are no records and are not shown\n";
+                    << (unreadable_ == 1 ? " line is no record and is not shown\n"
+                                         : " lines are no records and are not shown\n");
     }
     unreadable_ = 0;
   }

@@ -90,6 +90,12 @@ TEST_F(PowerLogCommandTest, LinesThatAreNoRecordsAreCounted) {
   EXPECT_EQ(err_.str(), "tarnelctl: " + options_.file + ": 2 lines are no records and are not shown\n");
 }
 
+TEST_F(PowerLogCommandTest, OneLineThatIsNoRecordIsCounted) {
+  add("nonsense\n" + powerLogLine(record(2)));
+  EXPECT_EQ(showPowerLog(options_, terminal_), ExitStatus::ok);
+  EXPECT_EQ(err_.str(), "tarnelctl: " + options_.file + ": 1 line is no record and is not shown\n");
+}
+
 TEST_F(PowerLogCommandTest, AnEmptyPowerLogIsSaid) {
   EXPECT_EQ(showPowerLog(options_, terminal_), ExitStatus::failed);
   EXPECT_EQ(err_.str(), "tarnelctl: no power log at " + options_.file + ": nothing was recorded yet\n");
