@@ -63,13 +63,14 @@ TEST_F(SessionUploads, PathIsThatOfTheURL) {
   configureAndStart();
   for (const char* url :
        {"file:///tmp/x", "file://localhost/tmp/x", "file:/tmp/x", "file:///tmp/x?q#f", "file:///tmp/%78",
-        "/tmp/%78", "file:///tmp/%zz%2", "file:///a%00b", "file://host"}) {
+        "/tmp/%78", "file:///tmp/%4A%4b%C3%AB", "file:///tmp/%zz%2", "file:///a%00b", "file://host"}) {
     upload(url);
   }
   EXPECT_THAT(backends.journal.lines(),
               ElementsAre("uploadserver upload /tmp/x with token", "uploadserver upload /tmp/x with token",
                           "uploadserver upload /tmp/x with token", "uploadserver upload /tmp/x with token",
                           "uploadserver upload /tmp/x with token", "uploadserver upload /tmp/%78 with token",
+                          "uploadserver upload /tmp/JK\xC3\xAB with token",
                           "uploadserver upload /tmp/%zz%2 with token",
                           "uploadserver upload /a%00b with token", "uploadserver upload  with token"));
 }

@@ -135,6 +135,24 @@ TEST_F(LinuxPowerLogTest, AFullFileTakesThePlaceOfTheOlderOne) {
     EXPECT_EQ(clients[i], clients[i - 1] + 1) << "none is missing between";
 }
 
+TEST_F(LinuxPowerLogTest, AFileIsFilledToItsLastByte) {
+  const Dictionary event{{"a", 1}};
+  LinuxPowerLog({.file = file}, clock, log).logRegisteredEvent(1, "E", event, std::nullopt);
+  const size_t line = folder.read("power.ndjson").size();
+  LinuxPowerLog power({.file = file, .maxFileBytes = 2 * line}, clock, log);
+  power.logRegisteredEvent(2, "E", event, std::nullopt);
+  EXPECT_EQ(records("power.ndjson").size(), 2U);
+  power.logRegisteredEvent(3, "E", event, std::nullopt);
+  EXPECT_EQ(records("power.ndjson").size(), 1U);
+  EXPECT_EQ(records("power.ndjson.1").size(), 2U);
+}
+
+TEST_F(LinuxPowerLogTest, AnEmptyFileMakesNoRoomForALine) {
+  LinuxPowerLog power({.file = file, .maxFileBytes = 10}, clock, log);
+  power.logRegisteredEvent(1, "E", Dictionary{{"a", 1}}, std::nullopt);
+  EXPECT_FALSE(std::filesystem::exists(olderPowerLogFile(file)));
+}
+
 TEST_F(LinuxPowerLogTest, ALineThatIsLargerThanTheFileMayBeStillFitsAlone) {
   LinuxPowerLog power({.file = file, .maxFileBytes = 10}, clock, log);
   for (int i = 0; i < 3; ++i) power.logRegisteredEvent(i, "E", Dictionary{{"a", 1}}, std::nullopt);
