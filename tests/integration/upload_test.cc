@@ -261,6 +261,7 @@ TEST_F(UploadTest, AClientThatDiesMeanwhileIsSurvivedAndKeepsItsFile) {
 TEST_F(UploadTest, TheToolUploadsAndSaysWhatBecameOfIt) {
   const RawHttpServer server(replying("success"));
   serve(server.url("/up"));
+  instance.setConfiguration("[limits]\nmax_upload_bytes = 2000\n");
   ASSERT_TRUE(instance.start());
   const auto path = write("x.log", "text");
   const std::vector<std::string> arguments{"upload", "--client-type", "8", path};
@@ -270,8 +271,12 @@ TEST_F(UploadTest, TheToolUploadsAndSaysWhatBecameOfIt) {
   EXPECT_FALSE(exists(path));
   done = run(arguments);
   EXPECT_EQ(done.end.status, 1);
-  EXPECT_THAT(done.errors, HasSubstr(path + " cannot be opened: No such file or directory"));
+  EXPECT_EQ(done.errors, "tarnelctl: " + path + " cannot be read: No such file or directory\n");
   write("x.log", "");
+  done = run(arguments);
+  EXPECT_EQ(done.end.status, 1);
+  EXPECT_EQ(done.errors, "tarnelctl: " + path + " is empty: only files that hold something are uploaded\n");
+  write("x.log", std::string(2001, 'x'));
   done = run({"upload", "--json", "--client-type", "8", path});
   EXPECT_EQ(done.end.status, 1);
   EXPECT_THAT(done.output, HasSubstr("\"success\": false"));
