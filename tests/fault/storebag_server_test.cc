@@ -243,7 +243,7 @@ TEST_F(StorebagServerTest, VerifiedDocumentsOfTheWrongShape) {
                        for (int i = 0; i < 1000; ++i) many.set("backend" + std::to_string(i), i);
                        return many;
                      }())),
-       "TarnelBackend(newBackendWithName): backend999"},
+       "createBackends: 1000 keys of the storebag are no backends, of which only the first 256 are named"},
   };
   run(cases, server);
 }
