@@ -266,6 +266,7 @@ ConnectionLoop::Pump ConnectionLoop::examine() {
   if (!framer_.isBetweenMessages()) return admit(std::min(input.size(), framer_.restOfMessage()));
   const auto size = framer_.sizeOfNext(input);
   if (!size) return closing(framer_.refusal());
+  messageBytes_ = *size;
   if (*size != 0 && !descriptors_.empty()) {
     if (const auto claimed = claimDescriptors(*size)) return *claimed;
   }
@@ -276,6 +277,7 @@ ConnectionLoop::Pump ConnectionLoop::examine() {
     wanted_ = *size;
     return Pump::progress;
   }
+  const auto place = waitForTurn(LargeCalls::Kind::prompt);
   auto call = readSendCall(message);
   if (!call) return admit(message.size());
   framer_.passMessage();

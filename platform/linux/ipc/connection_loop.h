@@ -7,6 +7,7 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -20,6 +21,7 @@
 #include "platform/linux/ipc/connection_link.h"
 #include "platform/linux/ipc/input_framer.h"
 #include "platform/linux/ipc/ipc_limits.h"
+#include "platform/linux/ipc/large_calls.h"
 #include "platform/linux/ipc/send_call.h"
 #include "platform/linux/unique_fd.h"
 
@@ -53,7 +55,9 @@ class ConnectionLoop {
     std::string peer;  // for logs
     IpcLimits limits;
     Log& log;
-    ClientFileRegistry* clientFiles = nullptr;  // null: this service takes no files
+    ClientFileRegistry* clientFiles;  // null: this service takes no files
+    LargeCalls& largeCalls;
+    uint32_t uid;
   };
 
   ConnectionLoop(Setup setup, UniqueFd socket);
@@ -124,6 +128,8 @@ class ConnectionLoop {
 
   int onMessage(sd_bus_message* message);
   void onSendCall(SendCall call);
+  std::optional<LargeCalls::Place> waitForTurn(LargeCalls::Kind kind);
+  void runBusCall(sd_bus_message* message, std::span<UniqueFd> descriptors);
   template <class Run>
   void carryOut(sd_bus_message* message, Run run);
   template <class Run>
@@ -150,6 +156,7 @@ class ConnectionLoop {
   size_t inputBegin_ = 0;
   size_t inputEnd_ = 0;
   size_t admitted_ = 0;
+  size_t messageBytes_ = 0;            // of the message that was looked at last
   bool isNew_ = false;                 // what is in the buffer and not admitted has not been looked at
   bool mayHaveMore_ = false;           // the socket, since the last read filled the buffer
   bool isFed_ = false;                 // the bus may have something to read

@@ -29,14 +29,52 @@ int ConnectionLoop::onMessage(sd_bus_message* message) {
       refuse(message, wire::kErrorInvalidArguments, "only UploadFile takes a descriptor");
       return 1;
     }
-    carryOut(message, [&descriptors](SessionCall call) {
-      call.descriptors = descriptors;
-      return callSessionMethod(call);
-    });
+    runBusCall(message, descriptors);
     return 1;
   }
   if (isPeerGone()) return 1;
   return answerGenericTool(message) ? 1 : 0;
+}
+
+void ConnectionLoop::runBusCall(sd_bus_message* message, std::span<UniqueFd> descriptors) {
+  const auto calls = [member = sd_bus_message_get_member(message)](const wire::Method& method) {
+    return std::strcmp(member, method.name) == 0;
+  };
+  const bool isLarge = messageBytes_ > setup_.limits.largeMessage;
+  if (isLarge && (calls(wire::kSetSessionInfo) || calls(wire::kFetchStates))) {
+    const std::string why = "what a session keeps may have " + std::to_string(setup_.limits.largeMessage) +
+                            " bytes, not " + std::to_string(messageBytes_);
+    setup_.log.log(LogLevel::warning, "IpcConnection: %s of %s is refused: %s",
+                   sd_bus_message_get_member(message), setup_.peer.c_str(), why.c_str());
+    refuse(message, wire::kErrorInvalidArguments, why);
+    return;
+  }
+  const bool waitsForServer = calls(wire::kUploadLogData);
+  const auto place = waitForTurn(waitsForServer ? LargeCalls::Kind::upload : LargeCalls::Kind::prompt);
+  if (isLarge && !place) {
+    refuse(message, wire::kErrorFailed,
+           "the log data of this user that is under way leaves no room for more; try again later");
+    return;
+  }
+  carryOut(message, [descriptors](SessionCall call) {
+    call.descriptors = descriptors;
+    return callSessionMethod(call);
+  });
+}
+
+// Room for the message at hand, if it is large; nothing also when log data found none.
+std::optional<LargeCalls::Place> ConnectionLoop::waitForTurn(LargeCalls::Kind kind) {
+  const auto& limits = setup_.limits;
+  if (messageBytes_ <= limits.largeMessage) return std::nullopt;
+  if (kind == LargeCalls::Kind::prompt) return setup_.largeCalls.enter(setup_.uid, kind, messageBytes_);
+  auto place = setup_.largeCalls.enter(setup_.uid, kind, messageBytes_, limits.waitForLogData);
+  if (!place) {
+    setup_.log.log(LogLevel::warning,
+                   "IpcConnection: Log data of %s found no room among that of its user: at most %zu bytes "
+                   "are under way at once",
+                   setup_.peer.c_str(), limits.largeBytesAtWork);
+  }
+  return place;
 }
 
 // The library's way of answering needs a message; this one stands for what it has not read.

@@ -11,7 +11,9 @@
 namespace tarnel {
 
 ConnectionRegistry::ConnectionRegistry(const IpcLimits& limits)
-    : limits_(limits), finishedEvent_(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
+    : limits_(limits),
+      finishedEvent_(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
+      largeCalls_(limits.largeBytesAtWork) {
   if (!finishedEvent_) throw std::system_error(errno, std::generic_category(), "eventfd");
 }
 

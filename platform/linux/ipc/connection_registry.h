@@ -15,6 +15,7 @@
 
 #include "platform/linux/ipc/connection_link.h"
 #include "platform/linux/ipc/ipc_limits.h"
+#include "platform/linux/ipc/large_calls.h"
 #include "platform/linux/unique_fd.h"
 
 namespace tarnel {
@@ -47,6 +48,9 @@ class ConnectionRegistry : public std::enable_shared_from_this<ConnectionRegistr
   enum class Full { perUser, total };
 
   explicit ConnectionRegistry(const IpcLimits& limits);
+
+  // Of all connections. Lives as long as this.
+  LargeCalls& largeCalls() noexcept { return largeCalls_; }
 
   // A place, or the limit that stands against it.
   std::variant<Place, Full> enter(uint32_t uid);
@@ -83,6 +87,7 @@ class ConnectionRegistry : public std::enable_shared_from_this<ConnectionRegistr
 
   const IpcLimits limits_;
   const UniqueFd finishedEvent_;
+  LargeCalls largeCalls_;
 
   mutable std::mutex mutex_;
   // All below guarded by mutex_.

@@ -14,6 +14,12 @@ struct IpcLimits {
   size_t queuedBytes = size_t{1} << 20U;
   // Calls of one connection that are not answered yet; more are not read until some are.
   size_t unansweredCalls = 1024;
+  // Messages of one user's clients that are larger than `largeMessage` and at work at the same time, bytes;
+  // others wait for their turn.
+  size_t largeMessage = size_t{64} << 10U;
+  size_t largeBytesAtWork = size_t{4} << 20U;
+  // Of log data for its turn, while the server does not answer for that which came before.
+  std::chrono::milliseconds waitForLogData{60'000};
   // From accepting to the end of the authentication.
   std::chrono::milliseconds authentication{10'000};
   // From the peer's end of sending to the end of the connection.

@@ -1,3 +1,4 @@
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/resource.h>
@@ -53,6 +54,89 @@ TEST(IpcUnansweredTest, UnansweredCallsAreBounded) {
     for (auto& reply : now) reply(std::nullopt);
   }
   EXPECT_EQ(session()->count(), 30U);
+}
+
+// What makes a message of about 70 kB.
+constexpr size_t kLargeText = 70'000;
+
+TEST(IpcLargeMessagesTest, WhatASessionKeepsIsBounded) {
+  Service service;
+  service.start();
+  BusClient client(service.path());
+  const std::string text(kLargeText, 'x');
+  EXPECT_EQ(client.call("SetSessionInfo", "aa{sv}aa{sv}aavb", 1, 1, "k", "s", text.c_str(), 0, 0, 0),
+            nullptr);
+  EXPECT_THAT(client.errorText, HasSubstr("what a session keeps may have 65536 bytes, not 70"));
+  EXPECT_EQ(client.call("FetchStates", "aa{sv}", 1, 1, "k", "s", text.c_str()), nullptr);
+  EXPECT_THAT(client.errorText, HasSubstr("what a session keeps may have 65536 bytes, not 70"));
+  EXPECT_TRUE(service.logged("FetchStates of pid "));
+  EXPECT_EQ(service.session()->count(), 0U);
+  EXPECT_NE(client.call("SetSessionInfo", "aa{sv}aa{sv}aavb", 1, 1, "k", "s", "x", 0, 0, 0), nullptr);
+}
+
+TEST(IpcLargeMessagesTest, AFileURLIsNoLongerThanAPathMayBe) {
+  Service service;
+  service.start();
+  BusClient client(service.path());
+  const std::string longest = "file://" + std::string(3 * 4096, 'x');
+  const UniqueFd file(open("/dev/null", O_RDONLY | O_CLOEXEC));
+  EXPECT_NE(client.call("UploadFile", "sh", longest.c_str(), file.get()), nullptr) << client.errorText;
+  EXPECT_EQ(client.call("UploadFile", "sh", (longest + 'x').c_str(), file.get()), nullptr);
+  EXPECT_EQ(client.errorText, "the file's URL is longer than 12295 bytes");
+  EXPECT_EQ(service.session()->count(), 1U);
+}
+
+TEST(IpcLargeMessagesTest, LogDataBehindAServerThatHangsIsRefusedInTheEnd) {
+  IpcLimits limits;
+  limits.largeBytesAtWork = 100'000;
+  limits.waitForLogData = std::chrono::milliseconds(20);
+  Service service(limits);
+  std::promise<void> begun;
+  std::promise<void> mayReturn;
+  std::atomic<int> uploads{0};
+  service.prepare = [&](RecordingSession& session) {
+    session.onCall = [&](const std::string& call) {
+      if (!call.starts_with("uploadLogData") || uploads++ > 0) return;
+      begun.set_value();
+      mayReturn.get_future().wait();
+    };
+  };
+  service.start();
+  const std::string text(kLargeText, 'x');
+  BusClient stuck(service.path());
+  auto upload = stuck.newCall("UploadLogData");
+  ASSERT_GE(sd_bus_message_append(upload.get(), "av", 1, "s", text.c_str()), 0);
+  ASSERT_GE(stuck.post(upload), 0);
+  ASSERT_GE(sd_bus_flush(stuck.bus()), 0);
+  begun.get_future().wait();
+  BusClient other(service.path());
+  EXPECT_EQ(other.call("UploadLogData", "av", 1, "s", text.c_str()), nullptr);
+  EXPECT_EQ(other.errorText,
+            "the log data of this user that is under way leaves no room for more; try again later");
+  EXPECT_TRUE(service.logged("found no room among that of its user: at most 100000 bytes are under way"));
+  // Messages, and small log data, do not wait for it.
+  EXPECT_NE(other.call("SendMessage", "qqaa{sv}", 1, 2, 1, 1, "k", "s", text.c_str()), nullptr);
+  EXPECT_NE(other.call("UploadLogData", "av", 1, "s", "x"), nullptr);
+  mayReturn.set_value();
+  EXPECT_TRUE(eventually([&] { return other.call("UploadLogData", "av", 1, "s", text.c_str()) != nullptr; }));
+}
+
+TEST(IpcLargeMessagesTest, LargeMessagesOfManyClientsAllArrive) {
+  IpcLimits limits;
+  limits.largeBytesAtWork = 1;  // one after the other
+  Service service(limits);
+  service.start();
+  const std::string text(kLargeText, 'x');
+  std::vector<std::thread> clients;
+  for (int i = 0; i < 8; ++i) {
+    clients.emplace_back([&service, &text] {
+      BusClient client(service.path());
+      for (int k = 0; k < 5; ++k) {
+        EXPECT_NE(client.call("SendMessage", "qqaa{sv}", 1, 2, 1, 1, "k", "s", text.c_str()), nullptr);
+      }
+    });
+  }
+  for (auto& client : clients) client.join();
 }
 
 TEST(IpcQueueTest, AClientThatNeverReadsItsCallsIsDropped) {

@@ -111,8 +111,15 @@ void SdBusConnection::resume() {
 }
 
 void SdBusConnection::serve() {
-  ConnectionLoop::Setup setup{
-      link_, object_, std::move(interruptionHandler_), description_, limits_, *log_, clientFiles_.get()};
+  ConnectionLoop::Setup setup{link_,
+                              object_,
+                              std::move(interruptionHandler_),
+                              description_,
+                              limits_,
+                              *log_,
+                              clientFiles_.get(),
+                              registry_->largeCalls(),
+                              peer_.uid};
   interruptionHandler_ = nullptr;
   {
     ConnectionLoop loop(std::move(setup), std::move(socket_));

@@ -3,6 +3,7 @@
 #include <systemd/sd-bus.h>
 
 #include <array>
+#include <climits>
 #include <cstring>
 #include <utility>
 
@@ -18,6 +19,8 @@ namespace {
 using wire::Method;
 
 constexpr size_t kPerName = 32;
+// Of the longest path, every byte of it percent-encoded.
+constexpr size_t kMaxFileURL = 3 * size_t{PATH_MAX} + 7;
 
 bool wantsReply(const SessionCall& call) {
   return sd_bus_message_get_expect_reply(call.message) > 0;
@@ -165,6 +168,10 @@ MaybeError uploadFile(const SessionCall& call) {
   }
   if (sd_bus_message_read(call.message, "s", &fileURL) < 0) {
     return Error(wire::kErrorInvalidArguments, -1, "the file's URL cannot be read");
+  }
+  if (std::strlen(fileURL) > kMaxFileURL) {
+    return Error(wire::kErrorInvalidArguments, -1,
+                 "the file's URL is longer than " + std::to_string(kMaxFileURL) + " bytes");
   }
   if (call.clientFiles == nullptr) return Error(wire::kErrorFailed, -1, "this service takes no files");
   const auto offer = call.clientFiles->offer(std::move(call.descriptors.front()), fileURL, call.link);
