@@ -167,7 +167,7 @@ void TestDaemon::post(std::function<void()> task) {
   auto finished = done.get_future();
   {
     const std::lock_guard lock(mutex_);
-    tasks_.push_back([&task, &done] {
+    tasks_.emplace_back([&task, &done] {
       task();
       done.set_value();
     });

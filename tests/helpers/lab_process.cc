@@ -205,6 +205,7 @@ std::string kindOf(const Dictionary& arrival) {
 
 std::vector<std::string> kindsOf(const std::vector<Dictionary>& arrivals) {
   std::vector<std::string> kinds;
+  kinds.reserve(arrivals.size());
   for (const auto& arrival : arrivals) kinds.push_back(kindOf(arrival));
   return kinds;
 }
