@@ -27,19 +27,24 @@ std::optional<Data> InstalledClientBundle::resource(std::string_view name, std::
 }
 
 std::vector<std::string> InstalledClientBundle::problems() {
-  const std::string remedy = "; install libtarnel, or name the folder of another bundle with TARNEL_BUNDLE";
+  const std::string other = "or name the folder of another bundle with TARNEL_BUNDLE";
+  const std::string keyRemedy =
+      ", so no storebag can be verified; put the public key there that belongs to your signing key "
+      "(tarnelctl storebag keygen makes one), " +
+      other;
   std::vector<std::string> problems;
   const std::string key = folder_ + "/publicKey.der";
   const auto contents = readFile(key);
   const auto der = resource("publicKey", "der");
   if (!contents) {
-    problems.push_back(contents.error().localizedDescription() + ", so no storebag can be verified" + remedy);
+    problems.push_back(contents.error().localizedDescription() + keyRemedy);
   } else if (!der || RsaPublicKey::fromDer(*der) == nullptr) {
-    problems.push_back(key + ": holds no RSA public key in DER form, so no storebag can be verified" +
-                       remedy);
+    problems.push_back(key + ": holds no RSA public key in DER form" + keyRemedy);
   }
   if (!version()) {
-    problems.push_back(folder_ + "/version: holds no version, so storebags are asked for as by 8.0" + remedy);
+    problems.push_back(
+        folder_ + "/version: holds no version, so storebags are asked for as by 8.0; install libtarnel, " +
+        other);
   }
   return problems;
 }

@@ -47,20 +47,23 @@ TEST(InstalledClientBundle, AVersionThatIsNoTextIsAbsent) {
 
 TEST(InstalledClientBundle, ItsProblemsAreNamedWithTheRemedy) {
   const TemporaryFolder folder;
-  const std::string remedy = "; install libtarnel, or name the folder of another bundle with TARNEL_BUNDLE";
+  const std::string other = "or name the folder of another bundle with TARNEL_BUNDLE";
+  const std::string keyRemedy =
+      ", so no storebag can be verified; put the public key there that belongs to your signing key "
+      "(tarnelctl storebag keygen makes one), " +
+      other;
   InstalledClientBundle bundle(folder.path("bundle"));
-  EXPECT_EQ(bundle.problems(),
-            (std::vector<std::string>{
-                folder.path("bundle/publicKey.der") +
-                    ": cannot be opened: No such file or directory, so no storebag can be verified" + remedy,
-                folder.path("bundle/version") + ": holds no version, so storebags are asked for as by 8.0" +
-                    remedy}));
+  EXPECT_EQ(
+      bundle.problems(),
+      (std::vector<std::string>{
+          folder.path("bundle/publicKey.der") + ": cannot be opened: No such file or directory" + keyRemedy,
+          folder.path("bundle/version") +
+              ": holds no version, so storebags are asked for as by 8.0; install libtarnel, " + other}));
   folder.write("bundle/version", "8.2");
   folder.write("bundle/publicKey.der", "no key");
   EXPECT_EQ(bundle.problems(),
-            (std::vector<std::string>{
-                folder.path("bundle/publicKey.der") +
-                ": holds no RSA public key in DER form, so no storebag can be verified" + remedy}));
+            (std::vector<std::string>{folder.path("bundle/publicKey.der") +
+                                      ": holds no RSA public key in DER form" + keyRemedy}));
   folder.write("bundle/publicKey.der", publicKeyDer());
   EXPECT_TRUE(bundle.problems().empty());
 }
