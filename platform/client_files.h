@@ -22,6 +22,8 @@ class ClientFile {
   ClientFile& operator=(const ClientFile&) = delete;
   virtual ~ClientFile() = default;
 
+  // The user whose process handed it over, as the kernel says.
+  virtual uint32_t owner() const = 0;
   // Neither a directory, device, pipe, socket nor link. Only a regular file may be read: nothing else is
   // sure not to block.
   virtual bool isRegular() const = 0;

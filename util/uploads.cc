@@ -1,5 +1,7 @@
 #include "util/uploads.h"
 
+#include <algorithm>
+#include <map>
 #include <utility>
 
 namespace tarnel {
@@ -8,9 +10,21 @@ struct Uploads::State {
   std::mutex mutex;
   std::condition_variable changed;
   // All guarded by mutex.
-  std::list<int> waiting;  // one element each, in order
+  std::list<uint32_t> waiting;            // the owner of each, in order
+  std::map<uint32_t, uint64_t> lastTurn;  // of each owner, counted; of none when all is quiet
+  uint64_t turns = 0;
   uint64_t bytes = 0;
   bool isStopped = false;
+
+  uint64_t lastTurnOf(uint32_t owner) const {
+    const auto found = lastTurn.find(owner);
+    return found == lastTurn.end() ? 0 : found->second;
+  }
+  // Whose turn it is; somebody waits.
+  std::list<uint32_t>::const_iterator next() const {
+    return std::min_element(waiting.begin(), waiting.end(),
+                            [this](uint32_t a, uint32_t b) { return lastTurnOf(a) < lastTurnOf(b); });
+  }
 };
 
 namespace {
@@ -24,17 +38,18 @@ HttpResult goingAway(const char* why) {
 Uploads::Uploads(ClientFiles& files, UploadLimits limits)
     : files_(files), limits_(limits), state_(std::make_shared<State>()) {}
 
-std::optional<Uploads::Place> Uploads::enter(uint64_t bytes) {
+std::optional<Uploads::Place> Uploads::enter(uint64_t bytes, uint32_t owner) {
   std::unique_lock lock(state_->mutex);
-  const auto self = state_->waiting.insert(state_->waiting.end(), 0);
+  const auto self = state_->waiting.insert(state_->waiting.end(), owner);
   const auto isOver = [this, self, bytes] {
     const bool hasRoom = state_->bytes == 0 || (state_->bytes <= limits_.bytesUnderWay &&
                                                 bytes <= limits_.bytesUnderWay - state_->bytes);
-    return state_->isStopped || (hasRoom && self == state_->waiting.begin());
+    return state_->isStopped || (hasRoom && self == state_->next());
   };
   const bool hasTurn = state_->changed.wait_for(lock, limits_.waitForRoom, isOver) && !state_->isStopped;
   state_->waiting.erase(self);
-  state_->changed.notify_all();  // the next one is first now
+  if (hasTurn) state_->lastTurn[owner] = ++state_->turns;
+  state_->changed.notify_all();  // it is another's turn now
   if (!hasTurn) return std::nullopt;
   state_->bytes += bytes;
   return Place(*this, bytes);
@@ -48,6 +63,7 @@ size_t Uploads::waiting() const {
 void Uploads::leave(uint64_t bytes) {
   const std::lock_guard lock(state_->mutex);
   state_->bytes -= bytes;
+  if (state_->bytes == 0 && state_->waiting.empty()) state_->lastTurn.clear();
   state_->changed.notify_all();
 }
 

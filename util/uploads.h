@@ -23,7 +23,9 @@ struct UploadLimits {
 
 // What the uploads of all sessions share: the clients' files, and how much of the process's memory may be
 // taken by contents that are read, compressed and on their way. An upload holds its own session's thread;
-// those beyond the bound wait for their turn, in the order in which they came.
+// those beyond the bound wait for their turn: users take turns, the one next who had none for the longest
+// time, and a user's own uploads go in the order in which they came. So nobody's crowd of uploads keeps
+// others from theirs.
 //
 // Threads: any. Outlives all that was taken from it.
 class Uploads {
@@ -47,8 +49,9 @@ class Uploads {
     Uploads* uploads_;
     uint64_t bytes_;
   };
-  // Waits for room, at most limits().waitForRoom; nothing when there was none, or after stop().
-  std::optional<Place> enter(uint64_t bytes);
+  // Waits for room, at most limits().waitForRoom; nothing when there was none, or after stop(). The owner is
+  // the user whose file it is.
+  std::optional<Place> enter(uint64_t bytes, uint32_t owner = 0);
 
   // Uploads that wait for room.
   size_t waiting() const;

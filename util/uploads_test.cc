@@ -61,6 +61,26 @@ TEST_F(UploadsTest, WhoWaitsGetsItsTurnInOrder) {
   EXPECT_EQ(uploads.waiting(), 0U);
 }
 
+TEST_F(UploadsTest, UsersTakeTurns) {
+  Uploads uploads(files, limits(std::chrono::hours(1)));
+  auto all = uploads.enter(10, 1);
+  std::mutex mutex;
+  std::vector<uint32_t> turns;
+  std::vector<std::thread> threads;
+  // A crowd of one user's, then two of others.
+  for (const uint32_t owner : {1, 1, 1, 1, 2, 3, 2}) {
+    threads.emplace_back([&uploads, &mutex, &turns, owner] {
+      const auto place = uploads.enter(10, owner);
+      const std::lock_guard lock(mutex);
+      turns.push_back(owner);
+    });
+    while (uploads.waiting() < threads.size()) std::this_thread::yield();
+  }
+  all.reset();
+  for (auto& thread : threads) thread.join();
+  EXPECT_THAT(turns, ::testing::ElementsAre(2, 3, 1, 2, 1, 1, 1));
+}
+
 TEST_F(UploadsTest, ThoseBehindComeInAsSoonAsThereIsRoomForAll) {
   Uploads uploads(files, limits(std::chrono::hours(1)));
   for (int round = 0; round < 50; ++round) {

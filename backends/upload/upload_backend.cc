@@ -68,7 +68,7 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, const std::string&
                path.c_str(), size, uploads.limits().fileBytes);
     return false;
   }
-  const auto place = uploads.enter(size);
+  const auto place = uploads.enter(size, file->owner());
   if (!place) {
     TARNEL_LOG(log, error,
                "UploadBackend(uploadFileAtPath): %s with %" PRIu64

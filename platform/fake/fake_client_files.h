@@ -17,6 +17,7 @@ class FakeClientFiles final : public ClientFiles {
   struct File {
     std::string text;
     bool isRegular = true;
+    uint32_t owner = 0;
     uint64_t claimedSize = UINT64_MAX;  // the text's, unless said otherwise
     MaybeError readError;
   };
@@ -37,6 +38,7 @@ class FakeClientFiles final : public ClientFiles {
     Handle(FakeClientFiles& owner, std::string token, File file)
         : owner_(owner), token_(std::move(token)), file_(std::move(file)) {}
     ~Handle() override { owner_.journal.push_back("release " + token_); }
+    uint32_t owner() const override { return file_.owner; }
     bool isRegular() const override { return file_.isRegular; }
     uint64_t size() const override {
       return file_.claimedSize == UINT64_MAX ? file_.text.size() : file_.claimedSize;

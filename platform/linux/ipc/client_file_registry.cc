@@ -38,11 +38,17 @@ std::string newToken() {
 // Read where it stands, whatever the client does with the descriptor's own position meanwhile.
 class PassedFile final : public ClientFile {
  public:
-  PassedFile(UniqueFd file, std::string fileURL, std::shared_ptr<ConnectionLink> link, Log& log)
-      : file_(std::move(file)), fileURL_(std::move(fileURL)), link_(std::move(link)), log_(log) {
+  PassedFile(UniqueFd file, std::string fileURL, std::shared_ptr<ConnectionLink> link, uint32_t owner,
+             Log& log)
+      : file_(std::move(file)),
+        fileURL_(std::move(fileURL)),
+        link_(std::move(link)),
+        owner_(owner),
+        log_(log) {
     isKnown_ = fstat(file_.get(), &before_) == 0;
   }
 
+  uint32_t owner() const override { return owner_; }
   bool isRegular() const override { return isKnown_ && S_ISREG(before_.st_mode); }
   uint64_t size() const override { return isKnown_ ? static_cast<uint64_t>(before_.st_size) : 0; }
 
@@ -95,6 +101,7 @@ class PassedFile final : public ClientFile {
   const UniqueFd file_;
   const std::string fileURL_;
   const std::shared_ptr<ConnectionLink> link_;
+  const uint32_t owner_;
   Log& log_;
   struct stat before_ {};
   bool isKnown_ = false;
@@ -103,10 +110,10 @@ class PassedFile final : public ClientFile {
 }  // namespace
 
 ClientFileRegistry::Offer ClientFileRegistry::offer(UniqueFd file, std::string fileURL,
-                                                    std::shared_ptr<ConnectionLink> link) {
+                                                    std::shared_ptr<ConnectionLink> link, uint32_t owner) {
   std::string token = newToken();
   const std::lock_guard lock(mutex_);
-  offered_.emplace(token, Offered{std::move(file), std::move(fileURL), std::move(link)});
+  offered_.emplace(token, Offered{std::move(file), std::move(fileURL), std::move(link), owner});
   return {*this, std::move(token)};
 }
 
@@ -123,7 +130,8 @@ std::unique_ptr<ClientFile> ClientFileRegistry::consume(const std::string& exten
       why = "it was used before";
     } else {
       auto& offered = found->second;
-      return std::make_unique<PassedFile>(std::move(offered.file), offered.fileURL, offered.link, log_);
+      return std::make_unique<PassedFile>(std::move(offered.file), offered.fileURL, offered.link,
+                                          offered.owner, log_);
     }
   }
   // The token itself is nobody's business, least of all a log's.
@@ -132,7 +140,7 @@ std::unique_ptr<ClientFile> ClientFileRegistry::consume(const std::string& exten
 }
 
 void ClientFileRegistry::withdraw(const std::string& token) {
-  Offered gone;  // closed without the lock
+  Offered gone{};  // closed without the lock
   const std::lock_guard lock(mutex_);
   const auto found = offered_.find(token);
   if (found == offered_.end()) return;

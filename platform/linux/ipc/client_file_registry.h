@@ -36,8 +36,9 @@ class ClientFileRegistry final : public ClientFiles {
     ClientFileRegistry& registry_;
     const std::string token_;
   };
-  // fileURL: as the client named it; it goes back with the wish to delete it. On the connection's thread.
-  Offer offer(UniqueFd file, std::string fileURL, std::shared_ptr<ConnectionLink> link);
+  // fileURL: as the client named it; it goes back with the wish to delete it. owner: the client's user. On
+  // the connection's thread.
+  Offer offer(UniqueFd file, std::string fileURL, std::shared_ptr<ConnectionLink> link, uint32_t owner);
 
   std::unique_ptr<ClientFile> consume(const std::string& extensionToken) override;
 
@@ -46,6 +47,7 @@ class ClientFileRegistry final : public ClientFiles {
     UniqueFd file;
     std::string fileURL;
     std::shared_ptr<ConnectionLink> link;
+    uint32_t owner;
     bool isConsumed = false;
   };
 

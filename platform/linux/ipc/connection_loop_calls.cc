@@ -114,8 +114,8 @@ void ConnectionLoop::carryOut(sd_bus_message* message, Run run) {
 
 template <class Run>
 void ConnectionLoop::runCall(sd_bus_message* message, Run run) {
-  const SessionCall call{message,     *setup_.object, setup_.link,       currentSerial_,
-                         setup_.peer, setup_.log,     setup_.clientFiles};
+  const SessionCall call{message,     *setup_.object, setup_.link,        currentSerial_,
+                         setup_.peer, setup_.log,     setup_.clientFiles, setup_.uid};
   try {
     if (const MaybeError error = run(call)) {
       current_ = nullptr;

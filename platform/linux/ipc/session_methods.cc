@@ -174,7 +174,8 @@ MaybeError uploadFile(const SessionCall& call) {
                  "the file's URL is longer than " + std::to_string(kMaxFileURL) + " bytes");
   }
   if (call.clientFiles == nullptr) return Error(wire::kErrorFailed, -1, "this service takes no files");
-  const auto offer = call.clientFiles->offer(std::move(call.descriptors.front()), fileURL, call.link);
+  const auto offer =
+      call.clientFiles->offer(std::move(call.descriptors.front()), fileURL, call.link, call.uid);
   call.session.uploadFileAtPath(fileURL, offer.token(), replyTo<bool>(call));
   return std::nullopt;
 }

@@ -27,6 +27,7 @@ struct SessionCall {
   const std::string& peer;
   Log& log;
   ClientFileRegistry* clientFiles;       // null: none are taken
+  uint32_t uid;                          // the client's user
   std::span<UniqueFd> descriptors = {};  // that came with it; a method takes them by moving
 };
 
