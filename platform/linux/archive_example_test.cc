@@ -81,6 +81,11 @@ TEST_F(ArchiveExampleTest, KeepsKindsApart) {
   EXPECT_EQ(read(*archive).output, "[1, 1.0, true, {\"$date\": 1700000000.5}, {\"$date\": 1.0}, \"inf\"]\n");
 }
 
+TEST_F(ArchiveExampleTest, PrintsNothingThatATerminalObeys) {
+  const auto archive = archiveObject(Array{"\x1b]0;\x07\x7f\u009b2J\u00a0"});
+  EXPECT_EQ(read(*archive).output, "[\"\\u001b]0;\\u0007\\u007f\\u009b2J\u00a0\"]\n");
+}
+
 TEST_F(ArchiveExampleTest, SaysWhatIsWrong) {
   EXPECT_EQ(read("[1]").output, problem("it does not begin with the bytes D9 D9 F7"));
   const auto archive = archiveObject(Array{"text"});
