@@ -52,6 +52,7 @@ TEST(LargeMessagesTest, LogDataOfManyClientsForAServerThatHangsIsBounded) {
   TestSession other(instance, {.sessionID = 100});
   const std::string text(200'000, 'x');
   for (int i = 0; i < 5; ++i) EXPECT_TRUE(other.send(1, 2, client::Dictionary().set("text", text)).ok());
+  EXPECT_EQ(hanging.connectionCount(), 4U);
   const size_t held = instance.residentBytes() - before;
   EXPECT_TRUE(!kMemoryIsMeasurable || held < 160 * kMiB) << held / kMiB << " MiB";
   instance.kill();
