@@ -199,10 +199,13 @@ Outcome measure(Request& request) {
     return failure(TARNEL_ERROR_INVALID_ARGUMENT, "this cannot be sent: " + meter.problem());
   }
   request.bytes = meter.bytes() + kFrameOverhead;
-  if (request.bytes > wire::kMaxMessageBytes) {
-    return failure(TARNEL_ERROR_TOO_LARGE,
-                   "the call takes " + std::to_string(request.bytes) + " bytes; the daemon takes at most " +
-                       std::to_string(wire::kMaxMessageBytes) + ": send less at once");
+  const bool isKept =
+      request.kind == Request::Kind::setSessionInfo || request.kind == Request::Kind::fetchStates;
+  const size_t most = isKept ? wire::kMaxKeptBytes : wire::kMaxMessageBytes;
+  if (request.bytes > most) {
+    return failure(TARNEL_ERROR_TOO_LARGE, "the call takes " + std::to_string(request.bytes) +
+                                               " bytes; the daemon takes at most " + std::to_string(most) +
+                                               ": send less at once");
   }
   return {};
 }

@@ -127,6 +127,13 @@ TEST_F(SessionTest, RefusesWhatTheDaemonWouldNotTakeBeforeSendingIt) {
   EXPECT_THAT(tooLarge.message, HasSubstr("the daemon takes at most 1048576"));
   EXPECT_THAT(tooLarge.message, HasSubstr("the call takes 10488"));
 
+  // Less of what a session keeps.
+  const auto info = Dictionary().set("s", std::string(1U << 16U, 'x'));
+  const auto tooMuchInfo = session.setSessionInfo(info, {});
+  EXPECT_EQ(tooMuchInfo.code, TARNEL_ERROR_TOO_LARGE);
+  EXPECT_THAT(tooMuchInfo.message, HasSubstr("the daemon takes at most 65536"));
+  EXPECT_EQ(session.fetchStatesAndWait(info, kLong).status.code, TARNEL_ERROR_TOO_LARGE);
+
   const auto notText = session.sendMessage(1, 1, Dictionary().set("bad", "\xC3("));
   EXPECT_EQ(notText.code, TARNEL_ERROR_INVALID_ARGUMENT);
   EXPECT_EQ(notText.message, "this cannot be sent: at key \"bad\": the text is not UTF-8");

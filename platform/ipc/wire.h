@@ -60,7 +60,8 @@ inline constexpr char kErrorFailed[] = "com.orvane.tarneld.Error.Failed";
 
 // Bounds that every peer is held to.
 inline constexpr unsigned kMaxMessageBytes = 1U << 20U;
-inline constexpr unsigned kMaxDepth = 32;       // nesting of dictionaries and arrays in one argument
-inline constexpr unsigned kMaxDescriptors = 4;  // per message
+inline constexpr unsigned kMaxKeptBytes = 64U << 10U;  // of a call with what the session keeps: its info
+inline constexpr unsigned kMaxDepth = 32;              // nesting of dictionaries and arrays in one argument
+inline constexpr unsigned kMaxDescriptors = 4;         // per message
 
 }  // namespace tarnel::wire

@@ -40,15 +40,15 @@ void ConnectionLoop::runBusCall(sd_bus_message* message, std::span<UniqueFd> des
   const auto calls = [member = sd_bus_message_get_member(message)](const wire::Method& method) {
     return std::strcmp(member, method.name) == 0;
   };
-  const bool isLarge = messageBytes_ > setup_.limits.largeMessage;
-  if (isLarge && (calls(wire::kSetSessionInfo) || calls(wire::kFetchStates))) {
-    const std::string why = "what a session keeps may have " + std::to_string(setup_.limits.largeMessage) +
+  if (messageBytes_ > wire::kMaxKeptBytes && (calls(wire::kSetSessionInfo) || calls(wire::kFetchStates))) {
+    const std::string why = "what a session keeps may have " + std::to_string(wire::kMaxKeptBytes) +
                             " bytes, not " + std::to_string(messageBytes_);
     setup_.log.log(LogLevel::warning, "IpcConnection: %s of %s is refused: %s",
                    sd_bus_message_get_member(message), setup_.peer.c_str(), why.c_str());
-    refuse(message, wire::kErrorInvalidArguments, why);
+    refuse(message, wire::kErrorTooLarge, why);
     return;
   }
+  const bool isLarge = messageBytes_ > setup_.limits.largeMessage;
   const bool waitsForServer = calls(wire::kUploadLogData);
   const auto place = waitForTurn(waitsForServer ? LargeCalls::Kind::upload : LargeCalls::Kind::prompt);
   if (isLarge && !place) {
