@@ -152,6 +152,7 @@ void runBytes(SessionWorld& world, InputReader& input, bool isFramed) {
   limits.unansweredCalls = kLongestInput;
   {
     const auto link = std::make_shared<ConnectionLink>(limits.queuedBytes);
+    LargeCalls largeCalls(limits.largeBytesAtWork);
     const std::span eventBytes(reinterpret_cast<const uint8_t*>(events.data()), events.size());
     ConnectionLoop loop({.link = link,
                          .object = std::make_shared<WatchedSession>(
@@ -160,7 +161,9 @@ void runBytes(SessionWorld& world, InputReader& input, bool isFramed) {
                          .peer = "the fuzzer",
                          .limits = limits,
                          .log = world.fakes.log,
-                         .clientFiles = &registry},
+                         .clientFiles = &registry,
+                         .largeCalls = largeCalls,
+                         .uid = 1000},
                         client.takeOther());
     loop.run();
     require(link->closed(), "the end of a connection closes its link");
