@@ -62,7 +62,9 @@ static void absent_daemon(void) {
   CHECK(tarnel_session_create(&options, &session) == TARNEL_OK);
   CHECK(tarnel_session_start_config_and_wait(session, 30000, &reply) == TARNEL_ERROR_NO_DAEMON);
   CHECK(strcmp(tarnel_last_error(),
-               "no daemon is listening at /nonexistent/socket: start it with systemctl start tarneld") == 0);
+               "no daemon is listening at /nonexistent/socket: start the daemon of that instance, or name "
+               "another socket "
+               "(TARNEL_SOCKET)") == 0);
   tarnel_reply_destroy(reply);
   CHECK(tarnel_session_send_message(session, 1, 1, 4, NULL, NULL, NULL) == TARNEL_ERROR_INVALID_ARGUMENT);
   tarnel_session_destroy(session);

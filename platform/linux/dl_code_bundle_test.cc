@@ -114,7 +114,7 @@ TEST_F(DlCodeBundleTest, TheAdaptorReadsEveryKindOfValue) {
   ASSERT_EQ(lines.size(), 3U);
   EXPECT_EQ(
       withoutNumber(lines[0]),
-      "65535/1 bool=true integer=-9223372036854775808 unsigned=18446744073709551615 real=0.5 date=@12.25 "
+      "65535/1 bool=true integer=-9223372036854775808 unsigned=18446744073709551615 real=0.5 date=@12.250 "
       "text=\"grüße\" data=00ff array=[1,\"two\",[]] dictionary={ x=null }");
   EXPECT_EQ(withoutNumber(lines[1]), "0/65535 no payload");
   EXPECT_EQ(withoutNumber(lines[2]), "2/3");
