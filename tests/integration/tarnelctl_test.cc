@@ -168,7 +168,7 @@ TEST_F(TarnelctlTest, ARecordedCallArrivesCompleteEventByEvent) {
                      instance.folder().path("events.ndjson"), lab.storebagFolder()};
   const auto checked = runProcess(check);
   EXPECT_EQ(checked.end.status, 0) << checked.output << checked.errors;
-  EXPECT_THAT(checked.output, HasSubstr("everything that was sent arrived as it should"));
+  EXPECT_THAT(checked.output, HasSubstr("every event that was sent arrived as it should"));
 }
 
 TEST_F(TarnelctlTest, ReplayReadsStandardInputAndNamesItsMistakes) {
