@@ -70,8 +70,8 @@ class PassedFile final : public ClientFile {
   }
 
   void requestDeletion() override {
-    if (!isUnchanged()) {
-      kept("it changed while it was uploaded");
+    if (const char* const why = change()) {
+      kept(why);
       return;
     }
     auto* loop = link_->loopOfThisThread();
@@ -89,10 +89,16 @@ class PassedFile final : public ClientFile {
   }
 
  private:
-  bool isUnchanged() const {
+  // What happened to the file since it came that keeps it from being deleted; null for nothing.
+  const char* change() const {
     struct stat now {};
-    return fstat(file_.get(), &now) == 0 && now.st_size == before_.st_size &&
-           now.st_mtim.tv_sec == before_.st_mtim.tv_sec && now.st_mtim.tv_nsec == before_.st_mtim.tv_nsec;
+    if (fstat(file_.get(), &now) != 0 || now.st_size != before_.st_size ||
+        now.st_mtim.tv_sec != before_.st_mtim.tv_sec || now.st_mtim.tv_nsec != before_.st_mtim.tv_nsec) {
+      return "it changed while it was uploaded";
+    }
+    // Moving a file leaves their number as it is; the client sees to that itself.
+    if (now.st_nlink < before_.st_nlink) return "a name of it was deleted, or given to another file";
+    return nullptr;
   }
   void kept(const char* why) {
     TARNEL_LOG(log_, warning, "ClientFiles: %s was uploaded and is kept: %s", fileURL_.c_str(), why);

@@ -165,6 +165,37 @@ TEST_F(IpcFilesTest, EverySignOfAChangeKeepsTheFile) {
   }
 }
 
+// The client would not find the file at its path, and leave what it finds alone.
+TEST_F(IpcFilesTest, WhatLostANameMeanwhileIsKeptAndTold) {
+  const auto path = write("x", "uploaded");
+  const auto next = write("next", "not uploaded");
+  onFile([&path, &next](ClientFile& file) {
+    EXPECT_EQ(*file.contents(), "uploaded");
+    std::filesystem::rename(next, path);
+    file.requestDeletion();
+  });
+  BusClient client(service.path());
+  EXPECT_EQ(upload(client, "/x", open(path)), true);
+  EXPECT_TRUE(deletions(client).empty());
+  EXPECT_TRUE(service.log().contains(LogLevel::warning,
+                                     "ClientFiles: /x was uploaded and is kept: a name of it was deleted, or "
+                                     "given to another file"));
+}
+
+TEST_F(IpcFilesTest, MoreNamesAndOtherNamesAreNoChange) {
+  const auto path = write("x", "x");
+  const auto moved = service.folder().path() + "/moved";
+  onFile([&path, &moved](ClientFile& file) {
+    std::filesystem::rename(path, moved);
+    std::filesystem::create_hard_link(moved, moved + ".2");
+    file.requestDeletion();
+  });
+  BusClient client(service.path());
+  EXPECT_EQ(upload(client, "/x", open(path)), true);
+  EXPECT_THAT(deletions(client), ElementsAre("/x"));
+  EXPECT_FALSE(service.logged("is kept"));
+}
+
 // A program that the process starts inherits nothing of it.
 TEST_F(IpcFilesTest, NoDescriptorOfAFileIsInheritable) {
   const auto path = write("x", "x");
