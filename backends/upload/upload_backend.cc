@@ -28,6 +28,11 @@ std::string lastPathComponent(std::string_view path) {
   return std::string(path);
 }
 
+// Whether the HTTP client itself refused the request for this reason: nothing of it was sent then.
+bool isRefusal(const MaybeError& error, int64_t code) {
+  return error && error->domain() == kHttpErrorDomain && error->code() == code;
+}
+
 }  // namespace
 
 std::shared_ptr<UploadBackend> UploadBackend::initWithName(const Dependencies& dependencies,
@@ -117,15 +122,14 @@ bool UploadBackend::post(const std::string& path, std::string compressed, Client
   request.headers = {{"Content-Type", "application/octet-stream"}, {"Content-Encoding", "gzip"}};
   request.body = std::make_shared<const std::string>(std::move(compressed));
   const auto result = dependencies().uploads.perform(dependencies().http, std::move(request));
-  // What no request can be made of comes back from the client before anything was sent.
-  if (result.error && result.error->domain() == kHttpErrorDomain && result.error->code() == kHttpBadRequest) {
+  if (isRefusal(result.error, kHttpBadRequest)) {
     TARNEL_LOG(log, error, "UploadBackend(uploadFileAtPath): Unable to create URL request");
     return false;
   }
   if (!result.data) {
     TARNEL_LOG(log, error, "UploadBackend(uploadFileAtPath): post %s",
-               result.error ? result.error->localizedDescription().c_str() : "(null)");
-    return true;
+               result.error ? result.error->description().c_str() : "(null)");
+    return !isRefusal(result.error, kHttpTooMuchQueued);
   }
   const bool isText = isValidUtf8(*result.data);
   TARNEL_LOG(log, debug, "UploadBackend(uploadFileAtPath): sending to |%s|, Json output: %s",

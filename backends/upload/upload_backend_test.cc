@@ -230,8 +230,22 @@ TEST_F(UploadBackendTest, ATransportFailureKeepsTheFileAndIsStillTrue) {
   world.clientFiles.files["t"] = {.text = "x"};
   world.http.setAnswer(FakeHttpClient::failure("the server cannot be reached"));
   EXPECT_TRUE(make(profile)->uploadFileAtPath("/x", "t"));
-  EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): post the server cannot be reached"));
+  EXPECT_TRUE(logged(LogLevel::error,
+                     "UploadBackend(uploadFileAtPath): post TarnelHTTPErrorDomain (7): the server cannot be "
+                     "reached"));
   EXPECT_THAT(journal(), ElementsAre("consume t", "read t", "release t"));
+}
+
+TEST_F(UploadBackendTest, WhatTheHttpClientRefusesUnsentIsAFailure) {
+  world.clientFiles.files["t"] = {.text = "x"};
+  world.http.setAnswer({std::nullopt, std::nullopt, Error(kHttpErrorDomain, kHttpTooMuchQueued, "no room")});
+  EXPECT_FALSE(make(profile)->uploadFileAtPath("/x", "t"));
+  EXPECT_TRUE(
+      logged(LogLevel::error, "UploadBackend(uploadFileAtPath): post TarnelHTTPErrorDomain (-2): no room"));
+  EXPECT_THAT(journal(), ElementsAre("consume t", "read t", "release t"));
+  // The code alone says nothing.
+  world.http.setAnswer({std::nullopt, std::nullopt, Error("another", kHttpTooMuchQueued, "no room")});
+  EXPECT_TRUE(make(profile)->uploadFileAtPath("/x", "t"));
 }
 
 TEST_F(UploadBackendTest, AnAddressThatMakesNoRequestIsRefused) {
