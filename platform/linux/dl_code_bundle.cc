@@ -104,7 +104,6 @@ class Bundle final : public CodeBundle {
     if (handle == nullptr) return refuse(library_ + ": cannot be loaded: " + loaderError());
     entry_ = reinterpret_cast<Entry>(::dlsym(handle, kEntry));
     if (entry_ != nullptr) return true;
-    ::dlclose(handle);
     return refuse(library_ + ": does not export " + kEntry + "; see tarnel_adaptor.h");
   }
 

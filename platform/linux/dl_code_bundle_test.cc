@@ -1,5 +1,6 @@
 #include "platform/linux/dl_code_bundle.h"
 
+#include <dlfcn.h>
 #include <gmock/gmock.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -258,6 +259,19 @@ TEST_F(DlCodeBundleTest, ALibraryWithoutTheFunctionIsNamed) {
               ElementsAre(Line{LogLevel::error, "loadBundle: " + library_ +
                                                     ": does not export tarnel_adaptor_class_named; see "
                                                     "tarnel_adaptor.h"}));
+}
+
+// What it started when it was loaded may still run.
+TEST_F(DlCodeBundleTest, ALibraryWithoutTheFunctionIsLoadedOnceAndStays) {
+  install(NO_EXPORT_ADAPTOR);
+  ::unsetenv("MISBEHAVING_ADAPTOR_LOADS");
+  EXPECT_FALSE(bundles.bundleWithPath(kPath)->load());
+  EXPECT_FALSE(bundles.bundleWithPath(kPath)->load());
+  EXPECT_STREQ(::getenv("MISBEHAVING_ADAPTOR_LOADS"), "1");
+  EXPECT_EQ(log.lines().size(), 1U);
+  void* const handle = ::dlopen(library_.c_str(), RTLD_NOW | RTLD_NOLOAD);
+  EXPECT_NE(handle, nullptr);
+  if (handle != nullptr) ::dlclose(handle);
 }
 
 TEST_F(DlCodeBundleTest, AClassOfAnotherVersionIsNamed) {

@@ -1,6 +1,8 @@
 // An adaptor for tests. What it does wrong, ADAPTOR_FAULT says when it is built.
 
+#include <cstdlib>
 #include <stdexcept>
+#include <string>
 #include <string_view>
 
 #include "client/include/tarnel/tarnel_adaptor.h"
@@ -72,6 +74,12 @@ const tarnel_adaptor_class* tarnel_adaptor_class_named(uint32_t /*version*/,
   return std::string_view(name) == "ThrowsLater" ? &kThrowingLater : &kClass;
 }
 #else
+// Tells, in the variable MISBEHAVING_ADAPTOR_LOADS, how often the library was loaded.
+__attribute__((constructor)) static void countLoads() {
+  const char* const before = getenv("MISBEHAVING_ADAPTOR_LOADS");
+  setenv("MISBEHAVING_ADAPTOR_LOADS", std::to_string(before == nullptr ? 1 : atoi(before) + 1).c_str(), 1);
+}
+
 extern "C" TARNEL_ADAPTOR_EXPORT int tarnel_something_else(void* instance);
 int tarnel_something_else(void* instance) {
   static_cast<void>(kClass);
