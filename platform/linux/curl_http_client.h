@@ -38,8 +38,9 @@ struct HttpClientOptions {
 //
 // Past connectionsPerHost or connections, requests wait for their turn in the order of their start; waiting
 // counts toward their time-out. Past maxQueuedBytes or maxQueuedRequests a request ends at once with
-// kHttpTooMuchQueued. A redirect (301, 302, 303, 307, 308) is followed by this class: 303, and 301 and 302
-// after a POST, go on as GET without the body and its "Content-" headers; "Authorization" and "Cookie" stay
+// kHttpTooMuchQueued. A redirect (301, 302, 303, 307, 308) is followed by this class. Method and body stay, a
+// POST's after 301 and 302 too: what was posted must arrive. Only 303, by which the server has taken the
+// request, goes on as GET without the body and its "Content-" headers. "Authorization" and "Cookie" stay
 // behind when scheme, host or port change. Answers come as they were sent (nothing is decompressed). No proxy
 // is used, whatever the environment says. A request on a kept connection that the server closed before it
 // answered anything is sent once more on a new one.

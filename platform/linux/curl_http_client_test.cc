@@ -275,11 +275,27 @@ TEST_P(RedirectTest, goesOnWithTheRightMethodBodyAndHeaders) {
 }
 
 INSTANTIATE_TEST_SUITE_P(AllStatuses, RedirectTest,
-                         testing::Values(RedirectCase{301, "GET", "GET"}, RedirectCase{301, "POST", "GET"},
-                                         RedirectCase{302, "POST", "GET"}, RedirectCase{303, "POST", "GET"},
+                         testing::Values(RedirectCase{301, "GET", "GET"}, RedirectCase{301, "POST", "POST"},
+                                         RedirectCase{302, "POST", "POST"}, RedirectCase{303, "POST", "GET"},
                                          RedirectCase{303, "PUT", "GET"}, RedirectCase{302, "PUT", "PUT"},
                                          RedirectCase{307, "POST", "POST"}, RedirectCase{308, "POST", "POST"},
                                          RedirectCase{308, "GET", "GET"}));
+
+// A page at the new place is no answer to what was posted.
+TEST_F(CurlHttpClientTest, hasThePostsAnswerAfterAMove) {
+  for (const char* status : {"301 Moved Permanently", "302 Found", "307 Temporary", "308 Permanent"}) {
+    RawHttpServer server(RawHttpServer::answering([status](const std::string& request) {
+      if (request.starts_with("POST /old ")) return httpAnswer(status, "", "Location: /new\r\n");
+      if (request.starts_with("GET ")) return httpAnswer("200 OK", "success: a page");
+      const bool isWhole = request.starts_with("POST /new ") && request.ends_with("\r\n\r\nabc");
+      return httpAnswer("200 OK", isWhole ? "taken" : "incomplete");
+    }));
+    HttpRequest request = get(server.url("/old"));
+    request.method = "POST";
+    request.body = std::make_shared<const std::string>("abc");
+    EXPECT_EQ(perform(request).data, "taken") << status;
+  }
+}
 
 TEST_F(CurlHttpClientTest, followsRelativeRedirectsAndKeepsCredentialsOnTheSameOrigin) {
   std::vector<std::string> seen;

@@ -241,8 +241,9 @@ MaybeError CurlTransfer::redirectTo(const std::string& url, long status) {
     return Error(kHttpErrorDomain, CURLE_UNSUPPORTED_PROTOCOL,
                  "refused a redirect from https to \"" + url + "\", which is not encrypted");
   }
-  const bool becomesGet = (status == 303 && request_.method != "HEAD") ||
-                          ((status == 301 || status == 302) && request_.method == "POST");
+  // Only 303 says that the request was taken. A POST that became a GET after a 301 or 302 would have the
+  // new place's page for its answer, and nobody would have what was posted.
+  const bool becomesGet = status == 303 && request_.method != "HEAD";
   if (becomesGet) {
     request_.method = "GET";
     request_.body.reset();
