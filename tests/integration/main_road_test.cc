@@ -318,10 +318,22 @@ TEST_F(MainRoadTest, ASingleMessageNeedsNoConfiguring) {
   const auto arrivals = lab.waitForEvents(1);
   EXPECT_EQ(kindOf(arrivals[0]), "7/8");
   EXPECT_EQ(textIn(eventOf(arrivals[0]), "k"), "v");
-  // Without identifiers there is no answer, and the client is told that none comes.
-  const auto refused = session.sendSingleMessageAndWait(client::Dictionary(), user, 7, 8, {}, kDeadline);
-  EXPECT_EQ(refused.status.code, TARNEL_ERROR_NO_REPLY) << refused.status.message;
+}
+
+TEST_F(MainRoadTest, ASingleMessageWithoutIdentifiersIsNotAnsweredAndTheClientIsToldSo) {
+  serveEntry(entry());
+  ASSERT_TRUE(instance.start());
+  client::Session session(optionsFor(instance));
+  std::vector<client::Dictionary> lacking(3);
+  lacking[1].set(kTarnelSessionInfoClientType, 8);
+  lacking[2].set(kTarnelSessionInfoSessionID, 42);
+  for (const auto& info : lacking) {
+    const auto reply = session.sendSingleMessageAndWait(info, {}, 7, 8, {}, kDeadline);
+    EXPECT_EQ(reply.status.code, TARNEL_ERROR_NO_REPLY) << reply.status.message;
+    EXPECT_EQ(reply.text, std::nullopt);
+  }
   instance.waitForLog("sendMessageWithSessionInfo: Could not retrieve identifiers from sessionInfo");
+  EXPECT_EQ(session.sendSingleMessageAndWait(sessionInfo({}), {}, 7, 8, {}, kDeadline).text, "finished");
 }
 
 TEST_F(MainRoadTest, DefaultsOfTheAdministratorWinOverTheStorebagsAddresses) {

@@ -258,7 +258,8 @@ class Session {
     return wait(timeout, tarnel_session_upload_log_data_and_wait, handle_, logData.handle());
   }
 
-  // One message with its own session info, on a session that needs no configuring. Reply: text.
+  // One message with its own session info, on a session that needs no configuring. Reply: text; without
+  // client type or session identifier TARNEL_ERROR_NO_REPLY.
   Status sendSingleMessage(DictionaryView sessionInfo, DictionaryView userInfo, std::uint16_t category,
                            std::uint16_t type, DictionaryView payload, Completion completion) {
     return async(std::move(completion), tarnel_session_send_single_message, handle_, sessionInfo.handle(),

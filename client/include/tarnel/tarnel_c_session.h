@@ -201,9 +201,10 @@ TARNEL_API tarnel_status tarnel_session_finish_and_wait(tarnel_session* session,
  * The file is opened here and read by the daemon through what was opened; a process has at most 64 open for
  * uploads. When the server takes it the library deletes it, before the completion runs: unless another
  * file stands at the path by then, it was changed meanwhile, or this process may not delete it.
- * Reply: success: a request was made and has ended, whatever the server said; whether the file is gone says
- * what became of it. The answer takes as long as the upload, whatever reply_timeout_ms says; other calls of
- * the session wait meanwhile, but no other session's. A file above the daemon's limit is refused.
+ * Reply: success: a request was made and has ended, whatever came of it; whether the file is gone says what
+ * became of it. The answer takes as long as the upload, whatever reply_timeout_ms says; other calls of the
+ * session wait meanwhile, but no other session's. A file above the daemon's limit, or for which it has no
+ * room, is refused: success is false.
  * TARNEL_ERROR_FILE: the file cannot be opened, or is no regular file. TARNEL_ERROR_QUEUE_FULL: also when too
  * many are open. */
 TARNEL_API tarnel_status tarnel_session_upload_file(tarnel_session* session, const char* path,
@@ -220,8 +221,9 @@ TARNEL_API tarnel_status tarnel_session_upload_log_data_and_wait(tarnel_session*
                                                                  uint32_t timeout_ms, tarnel_reply** reply);
 
 /* Sends one message with its own session info, on a session that needs no configuring.
- * session_info: client type and session identifier are mandatory: without them the daemon never answers.
- * Reply: text, "finished" (which does not mean that a backend took it) or "storebag not available". */
+ * session_info: client type and session identifier are mandatory.
+ * Reply: text, "finished" (which does not mean that a backend took it) or "storebag not available".
+ * TARNEL_ERROR_NO_REPLY: session_info lacks one of the two, and nothing was sent. */
 TARNEL_API tarnel_status tarnel_session_send_single_message(tarnel_session* session,
                                                             const tarnel_dictionary* session_info,
                                                             const tarnel_dictionary* user_info,
