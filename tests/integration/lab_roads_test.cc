@@ -10,6 +10,7 @@
 #include "tests/helpers/http_request.h"
 #include "tests/helpers/lab_process.h"
 #include "tests/helpers/private_instance.h"
+#include "tests/helpers/programs.h"
 #include "tests/helpers/storebags.h"
 #include "tests/helpers/test_session.h"
 
@@ -44,6 +45,14 @@ class LabRoadsTest : public ::testing::Test {
     return path;
   }
   static bool exists(const std::string& path) { return std::filesystem::exists(path); }
+  FinishedProcess uploadLog(std::vector<std::string> more, std::string_view input = {}) const {
+    ProcessOptions options;
+    options.program = kTarnelctl;
+    options.arguments = {"upload-log", "--client-type", "8"};
+    std::move(more.begin(), more.end(), std::back_inserter(options.arguments));
+    options.environment = instance.environment();
+    return runProcess(options, input);
+  }
   static client::Array logRecords() {
     client::Dictionary first;
     first.set("level", 3).set("text", "no route");
@@ -147,6 +156,28 @@ TEST_F(LabRoadsTest, LogDataArrivesDecodedAndItsLocationIsTold) {
   const auto shown = httpRequest(port, "GET", location.substr(slash));
   EXPECT_EQ(shown.status, 200);
   EXPECT_EQ(*parseDocument(shown.body), expected);
+}
+
+TEST_F(LabRoadsTest, TheToolUploadsRecordsOfAFileAndOfStandardInput) {
+  const std::string lines = "{\"level\": 3, \"text\": \"no route\"}\n{\"level\": 6}\n";
+  const Value expected(Array{Dictionary{{"level", 3}, {"text", "no route"}}, Dictionary{{"level", 6}}});
+  const auto fromFile = uploadLog({write("records.json", lines)});
+  EXPECT_EQ(fromFile.end.status, 0) << fromFile.errors;
+  EXPECT_THAT(fromFile.output, EndsWith("\nupload: 2 records were taken\n"));
+  const auto fromInput = uploadLog({"--json", "-"}, lines);
+  EXPECT_EQ(fromInput.end.status, 0) << fromInput.errors;
+  const auto answer = parseDocument(fromInput.output);
+  ASSERT_TRUE(answer && answer->dictionary() != nullptr) << fromInput.output;
+  const Value* upload = answer->dictionary()->find("upload");
+  ASSERT_NE(upload, nullptr) << fromInput.output;
+  EXPECT_EQ(*upload, Value(Dictionary{{"success", true}, {"records", 2}}));
+  EXPECT_THAT(uploadLog({"-"}, "{\"level\": 1}\n").output, EndsWith("\nupload: 1 record was taken\n"));
+  const auto arrivals = lab.logData();
+  ASSERT_THAT(arrivals, SizeIs(3));
+  for (size_t i = 0; i < 2; ++i) {
+    EXPECT_EQ(*parseDocument(readWholeFile(textIn(arrivals[i], "recordsFile"))), expected);
+  }
+  EXPECT_EQ(numberIn(arrivals[2], "recordCount"), 1);
 }
 
 TEST_F(LabRoadsTest, StatusCountsWhatArrived) {
