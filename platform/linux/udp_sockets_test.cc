@@ -117,7 +117,7 @@ TEST(UdpSocketsTest, ConnectingToTheBroadcastAddressIsRefused) {
   EXPECT_EQ(makeSocket()->connectTo({0xFFFFFFFF, 9}), EACCES);
 }
 
-TEST(UdpSocketsTest, SendingOnAClosedConnectionRaisesNoSignal) {
+TEST(UdpSocketsTest, SendingOnAClosedConnectionGivesAnError) {
   const Server server;
   const auto socket = makeSocket();
   socket->suppressBrokenPipeSignal();
