@@ -1,22 +1,16 @@
 #include "tools/tarnelctl/power_log_journal.h"
 
-#include <systemd/sd-journal.h>
-
+#include <cerrno>
 #include <charconv>
 #include <cstring>
 #include <memory>
 #include <ostream>
-#include <string_view>
 
 #include "platform/document.h"
+#include "tools/tarnelctl/system_journal.h"
 
 namespace tarnel::ctl {
 namespace {
-
-// What one record may say; the daemon's are smaller.
-constexpr size_t kMaxField = 1U << 20U;
-
-using Journal = std::unique_ptr<sd_journal, decltype(&sd_journal_close)>;
 
 ExitStatus failed(const Terminal& terminal, const char* action, int result) {
   terminal.err << "tarnelctl: the journal cannot be " << action << ": " << std::strerror(-result)
@@ -25,15 +19,6 @@ ExitStatus failed(const Terminal& terminal, const char* action, int result) {
                        : "")
                << '\n';
   return ExitStatus::failed;
-}
-
-std::optional<std::string> field(sd_journal* journal, const char* name) {
-  const void* data = nullptr;
-  size_t length = 0;
-  if (sd_journal_get_data(journal, name, &data, &length) < 0) return std::nullopt;
-  // It begins with "NAME=".
-  const std::string_view text(static_cast<const char*>(data), length);
-  return std::string(text.substr(std::min(text.size(), std::strlen(name) + 1)));
 }
 
 template <class Number>
@@ -45,46 +30,35 @@ std::optional<Number> number(const std::string* text) {
   return error == std::errc{} && stop == end ? std::optional(value) : std::nullopt;
 }
 
-int open(const PowerLogOptions& options, Journal& journal) {
-  sd_journal* opened = nullptr;
-  const int result = options.journalDirectory.empty()
-                         ? sd_journal_open(&opened, SD_JOURNAL_LOCAL_ONLY)
-                         : sd_journal_open_directory(&opened, options.journalDirectory.c_str(), 0);
-  journal.reset(opened);
-  return result;
-}
-
-int match(const PowerLogOptions& options, sd_journal* journal) {
-  const std::string kind = std::string("MESSAGE_ID=") + kPowerLogMessageID;
-  int result = sd_journal_add_match(journal, kind.data(), kind.size());
+int match(const PowerLogOptions& options, Journal& journal) {
+  const int result = journal.addMatch(std::string("MESSAGE_ID=") + kPowerLogMessageID);
+  if (result < 0 || options.unit.empty()) return result;
   // The journal itself notes whose record it is; anybody may write one of this kind.
-  const std::string unit = "_SYSTEMD_UNIT=" + options.unit;
-  if (result >= 0 && !options.unit.empty()) result = sd_journal_add_match(journal, unit.data(), unit.size());
-  return result;
+  return journal.addMatch("_SYSTEMD_UNIT=" + options.unit);
 }
 
-void print(sd_journal* journal, const PowerLogOptions& options, const Terminal& terminal) {
-  uint64_t microseconds = 0;
-  if (sd_journal_get_realtime_usec(journal, &microseconds) < 0) return;
-  const auto client = field(journal, kPowerLogClientField);
-  const auto event = field(journal, kPowerLogEventField);
-  const auto payload = field(journal, kPowerLogPayloadField);
-  const auto dropped = field(journal, kPowerLogDroppedField);
+void print(Journal& journal, const PowerLogOptions& options, const Terminal& terminal) {
+  const auto microseconds = journal.microseconds();
+  if (!microseconds) return;
+  const auto client = journal.field(kPowerLogClientField);
+  const auto event = journal.field(kPowerLogEventField);
+  const auto payload = journal.field(kPowerLogPayloadField);
+  const auto dropped = journal.field(kPowerLogDroppedField);
   const auto pointer = [](const std::optional<std::string>& text) { return text ? &*text : nullptr; };
-  const auto record = powerLogRecordFromFields(static_cast<int64_t>(microseconds), pointer(client),
-                                               pointer(event), pointer(payload), pointer(dropped));
+  const auto record = powerLogRecordFromFields(*microseconds, pointer(client), pointer(event),
+                                               pointer(payload), pointer(dropped));
   if (record) terminal.out << powerLogText(*record, options.json);
 }
 
 // Before the first entry that is to be shown.
-int seek(const PowerLogOptions& options, sd_journal* journal) {
-  if (options.lines == 0) return sd_journal_seek_head(journal);
-  int result = sd_journal_seek_tail(journal);
+int seek(const PowerLogOptions& options, Journal& journal) {
+  if (options.lines == 0) return journal.seekHead();
+  int result = journal.seekTail();
   if (result < 0) return result;
   // One more than is shown, because showing begins with the next one.
-  result = sd_journal_previous_skip(journal, uint64_t{options.lines} + 1);
+  result = journal.previousSkip(uint64_t{options.lines} + 1);
   if (result < 0) return result;
-  return static_cast<uint64_t>(result) <= options.lines ? sd_journal_seek_head(journal) : 0;
+  return static_cast<uint64_t>(result) <= options.lines ? journal.seekHead() : 0;
 }
 
 }  // namespace
@@ -104,22 +78,25 @@ std::optional<PowerLogRecord> powerLogRecordFromFields(int64_t microseconds, con
   return record;
 }
 
-ExitStatus showPowerLogOfJournal(const PowerLogOptions& options, const Terminal& terminal) {
-  Journal journal(nullptr, &sd_journal_close);
-  int result = open(options, journal);
-  if (result < 0) return failed(terminal, "opened", result);
-  sd_journal_set_data_threshold(journal.get(), kMaxField);
-  result = match(options, journal.get());
-  if (result >= 0) result = seek(options, journal.get());
+ExitStatus showPowerLogOf(Journal& journal, const PowerLogOptions& options, const Terminal& terminal) {
+  int result = match(options, journal);
+  if (result >= 0) result = seek(options, journal);
   if (result < 0) return failed(terminal, "read", result);
   for (;;) {
-    while ((result = sd_journal_next(journal.get())) > 0) print(journal.get(), options, terminal);
+    while ((result = journal.next()) > 0) print(journal, options, terminal);
     terminal.out.flush();
     if (result < 0) return failed(terminal, "read", result);
     if (!options.follow || !terminal.out.good()) return ExitStatus::ok;
-    result = sd_journal_wait(journal.get(), UINT64_MAX);
+    result = journal.wait();
     if (result < 0) return failed(terminal, "watched", result);
   }
+}
+
+ExitStatus showPowerLogOfJournal(const PowerLogOptions& options, const Terminal& terminal) {
+  int error = 0;
+  const auto journal = openSystemJournal(options.journalDirectory, error);
+  if (journal == nullptr) return failed(terminal, "opened", error);
+  return showPowerLogOf(*journal, options, terminal);
 }
 
 }  // namespace tarnel::ctl

@@ -1,11 +1,15 @@
 #pragma once
 
+#include "tools/tarnelctl/journal.h"
 #include "tools/tarnelctl/power_log_command.h"
 
 namespace tarnel::ctl {
 
 // The records of the power log that stand in the journal.
 ExitStatus showPowerLogOfJournal(const PowerLogOptions& options, const Terminal& terminal);
+
+// The same of a journal that was just opened.
+ExitStatus showPowerLogOf(Journal& journal, const PowerLogOptions& options, const Terminal& terminal);
 
 // One record from the fields of a journal entry, null for one that it lacks; nothing when it is no such
 // record.
