@@ -358,7 +358,8 @@ TEST_F(HTTPSPostBackendAnswerTest, TransportErrorIsLoggedAndPassedOn) {
   EXPECT_EQ(text, std::nullopt);
   EXPECT_EQ(error, failure.error);
   EXPECT_EQ(backend->state(), ReportingState::enabled);
-  expectLog(LogLevel::error, "HTTPSPostBackend(postJsonMessage): post error: connection refused");
+  expectLog(LogLevel::error,
+            "HTTPSPostBackend(postJsonMessage): post error: TarnelHTTPErrorDomain (7): connection refused");
 }
 
 TEST_F(HTTPSPostBackendAnswerTest, TransportErrorWithAServerStatusStillDisables) {
@@ -366,7 +367,8 @@ TEST_F(HTTPSPostBackendAnswerTest, TransportErrorWithAServerStatusStillDisables)
   auto result = fake::FakeHttpClient::status(502);
   result.error = Error(kHttpErrorDomain, 18, "cut short");
   const auto [text, error] = answerWith(*backend, result);
-  expectLog(LogLevel::error, "HTTPSPostBackend(postJsonMessage): post error: cut short");
+  expectLog(LogLevel::error,
+            "HTTPSPostBackend(postJsonMessage): post error: TarnelHTTPErrorDomain (18): cut short");
   EXPECT_EQ(backend->state(), ReportingState::disabled);
   EXPECT_EQ(error->code(), 502);
 }

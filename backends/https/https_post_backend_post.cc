@@ -76,7 +76,7 @@ HttpClient::Completion HTTPSPostBackend::answerHandler(FlushCompletion completio
           completion = std::move(completion)](HttpResult result) mutable {
     if (result.error) {
       TARNEL_LOG(log, error, "HTTPSPostBackend(postJsonMessage): post error: %s",
-                 result.error->localizedDescription().c_str());
+                 result.error->description().c_str());
     }
     const int status = result.response ? result.response->statusCode : 0;
     if (status < 500 || status > 599) {
