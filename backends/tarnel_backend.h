@@ -27,7 +27,10 @@ using FlushCompletion = OneShot<void(MaybeString text, MaybeError error)>;
 // storebag or the user information changes, then any number of sends, flushes and uploads, and finally
 // cleanup before it lets go.
 //
-// Threads: the owning session's thread; `state` may also be read and written on any other.
+// Threads: the owning session's thread; `state` may also be read and written on any other. The texts (name,
+// addresses, identifiers) are neither atomic nor locked: that thread alone uses them. Completions and work
+// queues have copies of what they need, and what another session changes is noted until that thread applies
+// it.
 class TarnelBackend : public std::enable_shared_from_this<TarnelBackend> {
  public:
   TarnelBackend(const TarnelBackend&) = delete;
@@ -77,7 +80,7 @@ class TarnelBackend : public std::enable_shared_from_this<TarnelBackend> {
   virtual MaybeString flushMessagesWithCompletion(FlushCompletion completion);
 
   // uploadFileAtPath:extensionToken: and uploadLogData:
-  // True when the upload was started.
+  // True when the upload was made; what that means each backend says. Holds the thread until it has ended.
   virtual bool uploadFileAtPath(const std::string& path, const std::string& extensionToken);
   virtual bool uploadLogData(const Array& logData);
 
