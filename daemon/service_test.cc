@@ -82,7 +82,7 @@ class FakeHost final : public ServiceHost {
   int loopStatus = 0;
 };
 
-TEST(Service, StartsAndEndsInThePrescribedOrder) {
+TEST(Service, StartsAndEndsInTheFixedOrder) {
   FakeHost host;
   EXPECT_EQ(runService(host), 0);
   EXPECT_THAT(host.journal.lines(),

@@ -179,7 +179,7 @@ TEST_F(CompressionTest, ReusedStreamGivesTheSameBytesAsAFreshOne) {
   }
 }
 
-TEST_F(CompressionTest, SetsTheStreamUpAsPrescribed) {
+TEST_F(CompressionTest, SetsTheStreamUpWithFixedParameters) {
   compressWithFakes(CompressionFormat::gzip);
   EXPECT_EQ(fakeZlib.level, -1);
   EXPECT_EQ(fakeZlib.method, 8);

@@ -61,7 +61,7 @@ class [[nodiscard]] Result {
   std::variant<T, Error> held_;
 };
 
-// The one failure that unwinds: an argument the system itself prescribes to be invalid (a client type
+// The one failure that unwinds: an argument the system itself counts as invalid (a client type
 // without a storebag name as a cache key; a verified document without a version). Every entry that calls
 // into the daemon (IPC dispatch, queue tasks, HTTP completions) catches it, logs it at level 3 and answers
 // the caller with an error; locks are released on the way by their guards.
