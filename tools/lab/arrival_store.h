@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <deque>
+#include <functional>
 #include <mutex>
 #include <vector>
 
@@ -62,7 +63,8 @@ class NewestArrivals {
   uint64_t bytes_ = 0;
 };
 
-// Keeps the last arrivals of each kind and tells the observers. Threads: any.
+// Keeps the last arrivals of each kind and tells the observers, in their order. What is read here, the
+// observers have been told of. Threads: any.
 class ArrivalStore {
  public:
   // What is kept of each kind goes down to the newest `keep` arrivals and to this many bytes of their plain
@@ -78,13 +80,18 @@ class ArrivalStore {
   ArrivalStore& operator=(const ArrivalStore&) = delete;
 
   // The observer outlives the store. Before the first arrival.
-  void addObserver(ArrivalObserver& observer) { observers_.push_back(&observer); }
+  void addObserver(ArrivalObserver& observer) {
+    const std::lock_guard lock(telling_);
+    observers_.push_back(&observer);
+  }
 
-  // Each numbers the arrival, keeps it and tells every observer.
+  // Each numbers the arrival, keeps it, tells every observer and returns then.
   void add(Arrival arrival);
   void addUpload(UploadArrival arrival);
   void addLogData(LogDataArrival arrival);
-  void addDatagram(DatagramArrival arrival);
+  // kept: called, on this thread and before this returns, once the arrival is kept; it waits for no
+  // observer. May be empty.
+  void addDatagram(DatagramArrival arrival, const std::function<void()>& kept = {});
   void countDatagramOverLimit();
 
   // The newest, oldest of them first.
@@ -98,8 +105,17 @@ class ArrivalStore {
   ArrivalCounts counts() const;
 
  private:
+  using Telling = std::function<void(ArrivalObserver&)>;
+
+  // Reads, with mutex_ held, when the observers have been told of everything.
+  template <class Read>
+  auto whenTold(Read read) const;
+  void tellObservers() const;
+
   std::vector<ArrivalObserver*> observers_;
+  mutable std::mutex telling_;  // before mutex_; held while observers are told
   mutable std::mutex mutex_;
+  mutable std::deque<Telling> untold_;
   NewestArrivals<Arrival> posts_;
   NewestArrivals<UploadArrival> uploads_;
   NewestArrivals<LogDataArrival> logData_;

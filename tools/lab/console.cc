@@ -5,8 +5,26 @@
 #include "tools/lab/text.h"
 
 namespace tarnel::lab {
+namespace {
+
+std::string recordLine(const char* kind, const Dictionary& record) {
+  Dictionary line = {{"kind", kind}};
+  line.merge(record);
+  return writeTextDocument(line) + "\n";
+}
+
+}  // namespace
+
 Console::Console(std::FILE* output, std::FILE* errors, ConsoleStyle style, bool colour, Clock& clock)
-    : output_(output), errors_(errors), style_(style), colour_(colour), clock_(clock) {}
+    : output_(output),
+      errors_(errors),
+      style_(style),
+      colour_(colour),
+      clock_(clock),
+      queue_([this](uint64_t lost) {
+        return warningText("lines that the output did not take, and that are lost: " + grouped(lost) +
+                           "; what arrived is in the files");
+      }) {}
 
 std::string Console::tinted(Tint tint, const std::string& text) const {
   if (!colour_ || tint == Tint::plain) return text;
@@ -14,16 +32,8 @@ std::string Console::tinted(Tint tint, const std::string& text) const {
   return code + text + "\033[0m";
 }
 
-void Console::print(std::FILE* stream, const std::string& text) {
-  const std::lock_guard lock(mutex_);
-  std::fwrite(text.data(), 1, text.size(), stream);
-  std::fflush(stream);
-}
-
-void Console::printRecord(const char* kind, Dictionary record) {
-  Dictionary line = {{"kind", kind}};
-  line.merge(record);
-  print(output_, writeTextDocument(line) + "\n");
+void Console::printRecord(const char* kind, const Dictionary& record) {
+  print(output_, recordLine(kind, record));
 }
 
 void Console::arrived(const Arrival& arrival) {
@@ -98,11 +108,15 @@ void Console::storebagServed(const ServedStorebag& served) {
   print(output_, text + "\n");
 }
 
-void Console::warning(const std::string& text) {
+PrintQueue::Text Console::warningText(const std::string& text) const {
   const double now = secondsFromTimeValue(clock_.timeOfDay());
-  if (style_ == ConsoleStyle::json) return printRecord("warning", {{"time", now}, {"text", text}});
-  print(errors_,
-        tinted(Tint::dim, clockTime(now)) + "  " + tinted(Tint::bad, "warning") + "  " + text + "\n");
+  if (style_ == ConsoleStyle::json) return {output_, recordLine("warning", {{"time", now}, {"text", text}})};
+  return {errors_,
+          tinted(Tint::dim, clockTime(now)) + "  " + tinted(Tint::bad, "warning") + "  " + text + "\n"};
+}
+
+void Console::warning(const std::string& text) {
+  queue_.print(warningText(text));
 }
 
 void Console::started(const std::string& text, const Dictionary& status) {

@@ -1,19 +1,20 @@
 #pragma once
 
 #include <cstdio>
-#include <mutex>
 #include <string>
 
 #include "platform/clock.h"
 #include "tools/lab/arrival.h"
 #include "tools/lab/notices.h"
+#include "tools/lab/print_queue.h"
 
 namespace tarnel::lab {
 
 enum class ConsoleStyle { text, json, quiet };
 
 // Prints what happens: arrivals and served storebags to the output, a readable line each (or one JSON object
-// each); warnings to the error output. With ConsoleStyle::quiet only warnings. Threads: any.
+// each); warnings to the error output. With ConsoleStyle::quiet only warnings. Nobody waits for the printing,
+// but for flush() and the destructor. Threads: any.
 class Console final : public ArrivalObserver, public Notices {
  public:
   // Streams and clock outlive the console. colour: only for terminals.
@@ -29,6 +30,8 @@ class Console final : public ArrivalObserver, public Notices {
   // Where the lab listens and what to do with it: text for people, the status with ConsoleStyle::json.
   void started(const std::string& text, const Dictionary& status);
   void ended(const std::string& text);
+  // Returns when all has been printed.
+  void flush() { queue_.flush(); }
 
  private:
   enum class Tint { plain, dim, good, bad };
@@ -37,15 +40,16 @@ class Console final : public ArrivalObserver, public Notices {
   std::string verdict(const std::vector<std::string>& problems) const;
   std::string problemLines(const std::vector<std::string>& problems) const;
   void printPost(const HttpArrival& arrival, const std::string& summary);
-  void print(std::FILE* stream, const std::string& text);
-  void printRecord(const char* kind, Dictionary record);
+  void print(std::FILE* stream, std::string text) { queue_.print({stream, std::move(text)}); }
+  PrintQueue::Text warningText(const std::string& text) const;
+  void printRecord(const char* kind, const Dictionary& record);
 
   std::FILE* const output_;
   std::FILE* const errors_;
   const ConsoleStyle style_;
   const bool colour_;
   Clock& clock_;
-  std::mutex mutex_;
+  PrintQueue queue_;
 };
 
 }  // namespace tarnel::lab

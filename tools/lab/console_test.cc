@@ -1,13 +1,17 @@
 #include "tools/lab/console.h"
 
+#include <fcntl.h>
 #include <gmock/gmock.h>
+#include <unistd.h>
 
+#include <array>
 #include <memory>
 
 #include "platform/document.h"
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/summary.h"
 #include "tools/lab/test_post.h"
+#include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {
 namespace {
@@ -100,6 +104,7 @@ TEST_F(ConsoleTest, FilesAndLogDataAreOneLineEach) {
   Console text = console(ConsoleStyle::text);
   text.uploadArrived(upload);
   text.logDataArrived(logData);
+  text.flush();
   const std::string printed = read(output_);
   EXPECT_THAT(printed,
               HasSubstr("  POST /v1/uploads  file \"a b.log.gz\"  session 77  797 B gzip of 17.2 kB  "
@@ -126,6 +131,7 @@ TEST_F(ConsoleTest, DatagramsAreOneLineEach) {
   datagram.problems = {"no datagram: has 68 bytes, but names 70"};
   datagram.answer = DatagramAnswer::nothing;
   text.datagramArrived(datagram);
+  text.flush();
   const std::string printed = read(output_);
   EXPECT_THAT(printed, HasSubstr("  UDP  127.0.0.1:5  client type 12  session 7  event 3  method 1  status 8"
                                  "  a=1 b=?[2J  ok  acknowledged\n"));
@@ -144,6 +150,7 @@ TEST_F(ConsoleTest, JsonIsOneObjectALine) {
   json.datagramArrived({});
   json.warning("careful");
   json.ended("bye");
+  json.flush();
   std::string text = read(output_);
   std::vector<std::string> kinds;
   for (size_t end = text.find('\n'); end != std::string::npos; end = text.find('\n')) {
@@ -157,6 +164,31 @@ TEST_F(ConsoleTest, JsonIsOneObjectALine) {
   EXPECT_EQ(read(errors_), "");
 }
 
+TEST_F(ConsoleTest, LinesThatTheOutputDoesNotTakeAreCounted) {
+  std::array<int, 2> ends{};
+  ASSERT_EQ(::pipe2(ends.data(), O_CLOEXEC), 0);
+  const FileDescriptor reader(ends[0]);
+  const Stream pipe(::fdopen(ends[1], "w"), std::fclose);
+  size_t left = 0;
+  const auto readSome = [&reader, &left](size_t most) {
+    std::vector<char> bytes(most);
+    const ssize_t count = ::read(reader.get(), bytes.data(), bytes.size());
+    ASSERT_GT(count, 0);
+    left -= static_cast<size_t>(count);
+  };
+  Console text(pipe.get(), errors_.get(), ConsoleStyle::text, false, clock_);
+  const std::string large(1U << 20U, 'x');
+  text.started(large, {});
+  readSome(1);
+  const std::string largest(PrintQueue::kMaxWaitingBytes, 'x');
+  text.started(largest, {});
+  for (int i = 0; i < 1200; ++i) text.ended("lost");
+  for (left = large.size() - 1 + largest.size(); left > 0;) readSome(65536);
+  text.flush();
+  EXPECT_THAT(read(errors_), HasSubstr("  warning  lines that the output did not take, and that are lost: "
+                                       "1,200; what arrived is in the files\n"));
+}
+
 TEST_F(ConsoleTest, QuietSaysWarningsOnly) {
   Console quiet = console(ConsoleStyle::quiet);
   quiet.started("text", {});
@@ -167,6 +199,7 @@ TEST_F(ConsoleTest, QuietSaysWarningsOnly) {
   quiet.storebagServed({});
   quiet.ended("bye");
   quiet.warning("careful");
+  quiet.flush();
   EXPECT_EQ(read(output_), "");
   EXPECT_THAT(read(errors_), HasSubstr("  warning  careful\n"));
 }
@@ -176,6 +209,7 @@ TEST_F(ConsoleTest, ServedStorebags) {
   text.storebagServed({.name = "brevan", .version = "1.2", .status = 200, .bytes = 8300});
   text.storebagServed({.name = "brevan", .version = "1.2", .status = 304});
   text.storebagServed({.name = "none", .status = 404, .remark = "no such file"});
+  text.flush();
   const std::string printed = read(output_);
   EXPECT_THAT(printed, HasSubstr("  GET  storebag brevan  version 1.2  8.3 kB\n"));
   EXPECT_THAT(printed, HasSubstr("  GET  storebag brevan  version 1.2  not modified\n"));

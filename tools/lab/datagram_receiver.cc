@@ -55,10 +55,10 @@ uint64_t DatagramReceiver::countRepetition(const std::string& message) {
   return count;
 }
 
-std::optional<std::vector<uint8_t>> DatagramReceiver::receive(std::span<const uint8_t> bytes, size_t size,
-                                                              const std::string& sender) {
+void DatagramReceiver::receive(std::span<const uint8_t> bytes, size_t size, const std::string& sender,
+                               const std::function<void(const std::vector<uint8_t>&)>& acknowledge) {
   const TimeValue now = clock_.timeOfDay();
-  if (!isWithinLimit(now.seconds)) return std::nullopt;
+  if (!isWithinLimit(now.seconds)) return;
   DatagramArrival arrival;
   arrival.arrived = secondsFromTimeValue(now);
   arrival.sender = sender;
@@ -73,9 +73,9 @@ std::optional<std::vector<uint8_t>> DatagramReceiver::receive(std::span<const ui
     arrival.answer = answerFor(*arrival.content, faults_.fateOf(message, arrival.repetition));
   }
   const bool acknowledges = arrival.answer == DatagramAnswer::acknowledged;
-  store_.addDatagram(std::move(arrival));
-  if (!acknowledges) return std::nullopt;
-  return acknowledgementOf(bytes);
+  store_.addDatagram(std::move(arrival), [acknowledges, bytes, &acknowledge] {
+    if (acknowledges) acknowledge(acknowledgementOf(bytes));
+  });
 }
 
 }  // namespace tarnel::lab

@@ -2,7 +2,7 @@
 
 #include <cstdint>
 #include <deque>
-#include <optional>
+#include <functional>
 #include <span>
 #include <string>
 #include <unordered_map>
@@ -28,10 +28,10 @@ class DatagramReceiver {
       : store_(store), faults_(faults), notices_(notices), clock_(clock) {}
 
   // bytes: the datagram, or its first kMaxDatagramBytes + 1 bytes. size: of the whole one.
-  // Returns what is to be sent back, if anything: every readable datagram that asks for it is acknowledged,
-  // each time that it comes.
-  std::optional<std::vector<uint8_t>> receive(std::span<const uint8_t> bytes, size_t size,
-                                              const std::string& sender);
+  // acknowledge: sends back what it is given. It is called before this returns and without waiting for disk
+  // or terminal, for every readable datagram that asks for it, each time that it comes.
+  void receive(std::span<const uint8_t> bytes, size_t size, const std::string& sender,
+               const std::function<void(const std::vector<uint8_t>&)>& acknowledge);
 
  private:
   bool isWithinLimit(int64_t second);

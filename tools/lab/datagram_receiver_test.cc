@@ -19,7 +19,9 @@ class DatagramReceiverTest : public ::testing::Test, public Notices {
   void warning(const std::string& text) override { warnings_.push_back(text); }
 
   std::optional<Bytes> receive(const Bytes& bytes) {
-    return receiver_.receive(bytes, bytes.size(), "127.0.0.1:5");
+    std::optional<Bytes> answer;
+    receiver_.receive(bytes, bytes.size(), "127.0.0.1:5", [&answer](const Bytes& sent) { answer = sent; });
+    return answer;
   }
   DatagramArrival last() const { return store_.lastDatagrams(1).at(0); }
 

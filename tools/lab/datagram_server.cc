@@ -17,6 +17,10 @@ namespace {
 
 // Read in one go before the end is looked for.
 constexpr int kMaxAtOnce = 1000;
+// Read at the end: more than a receive buffer holds, and an end to a flood.
+constexpr int kMaxAtEnd = 100'000;
+// Failures to read in a row until the socket is given up.
+constexpr int kMaxFailures = 100;
 
 std::string textOf(const sockaddr_in& address) {
   std::array<char, INET_ADDRSTRLEN> text{};
@@ -43,14 +47,18 @@ class ServerOfDatagrams final : public DatagramServer {
 
  private:
   void run() {
-    for (;;) {
+    while (failures_ < kMaxFailures) {
       pollfd entries[2] = {{.fd = socket_.socket.get(), .events = POLLIN, .revents = 0},
                            {.fd = stopEvent_.get(), .events = POLLIN, .revents = 0}};
-      if (::poll(entries, 2, -1) < 0 && errno != EINTR) return;
-      for (int i = 0; i < kMaxAtOnce && readOne(); ++i) {
+      if (::poll(entries, 2, -1) < 0 && errno != EINTR) break;
+      const bool isEnd = entries[1].revents != 0;
+      const int most = isEnd ? kMaxAtEnd : kMaxAtOnce;
+      for (int i = 0; i < most && readOne(); ++i) {
       }
-      if (entries[1].revents != 0) return;
+      if (isEnd) return;
     }
+    notices_.warning("cannot receive datagrams any more: " + std::generic_category().message(errno) +
+                     "; start the lab again");
   }
 
   bool readOne() {
@@ -58,11 +66,14 @@ class ServerOfDatagrams final : public DatagramServer {
     socklen_t senderSize = sizeof sender;
     const ssize_t size = ::recvfrom(socket_.socket.get(), buffer_.data(), buffer_.size(), MSG_TRUNC,
                                     reinterpret_cast<sockaddr*>(&sender), &senderSize);
-    if (size < 0) return false;
+    if (size < 0) {
+      if (errno != EAGAIN) ++failures_;
+      return false;
+    }
+    failures_ = 0;
     const auto whole = static_cast<size_t>(size);
-    const auto acknowledgement =
-        receiver_.receive({buffer_.data(), std::min(whole, buffer_.size())}, whole, textOf(sender));
-    if (acknowledgement) send(*acknowledgement, sender);
+    receiver_.receive({buffer_.data(), std::min(whole, buffer_.size())}, whole, textOf(sender),
+                      [this, &sender](const std::vector<uint8_t>& bytes) { send(bytes, sender); });
     return true;
   }
 
@@ -83,7 +94,8 @@ class ServerOfDatagrams final : public DatagramServer {
   Notices& notices_;
   const FileDescriptor stopEvent_;
   std::array<uint8_t, kMaxDatagramBytes + 1> buffer_{};
-  bool failing_ = false;
+  bool failing_ = false;  // to send
+  int failures_ = 0;      // to read, in a row
   std::thread thread_;
 };
 

@@ -20,7 +20,8 @@ class DatagramServer {
   DatagramServer& operator=(const DatagramServer&) = delete;
   virtual ~DatagramServer() = default;
 
-  // Returns when the thread has ended; what has come until then has been read. Idempotent.
+  // Returns when the thread has ended; what the socket held until then has been read, unless still more came
+  // all the time. Idempotent.
   virtual void stop() = 0;
 };
 

@@ -6,6 +6,8 @@
 #include <poll.h>
 #include <sys/socket.h>
 
+#include <future>
+
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/options.h"
 #include "tools/lab/test_datagram.h"
@@ -44,6 +46,24 @@ class Sender {
   FileDescriptor socket_;
 };
 
+// As a disk that does not answer.
+class StoppedObserver final : public ArrivalObserver {
+ public:
+  void arrived(const Arrival&) override {}
+  void datagramArrived(const DatagramArrival&) override { goOn_.get_future().wait(); }
+  void goOn() { goOn_.set_value(); }
+
+ private:
+  std::promise<void> goOn_;
+};
+
+class FirstWarning final : public Notices {
+ public:
+  void storebagServed(const ServedStorebag&) override {}
+  void warning(const std::string& told) override { text.set_value(told); }
+  std::promise<std::string> text;
+};
+
 class DatagramServerTest : public ::testing::Test, public Notices {
  protected:
   DatagramServerTest() {
@@ -72,6 +92,18 @@ TEST_F(DatagramServerTest, WhoAsksForItIsAcknowledged) {
   EXPECT_THAT(store_.lastDatagrams(1).at(0).sender, HasSubstr("127.0.0.1:"));
 }
 
+TEST_F(DatagramServerTest, TheAcknowledgementWaitsForNoObserver) {
+  StoppedObserver observer;
+  store_.addObserver(observer);
+  const Sender sender(port_);
+  const Bytes bytes = sampleDatagram(" a=1");
+  sender.send(bytes);
+  EXPECT_EQ(sender.receive(), acknowledgementOf(bytes));
+  observer.goOn();
+  EXPECT_EQ(store_.counts().acknowledged, 1U);
+  server_->stop();
+}
+
 TEST_F(DatagramServerTest, SizesOfEveryKindAreSurvived) {
   const Sender sender(port_);
   for (const size_t size : {0, 1, 63, 1087, 1088, 1089, 60'000}) sender.send(Bytes(size, 0xFF));
@@ -95,6 +127,17 @@ TEST_F(DatagramServerTest, EndsWhenToldAndStaysEnded) {
   server_->stop();
   EXPECT_EQ(store_.counts().datagrams, 1U) << "what came before is read";
   server_->stop();
+}
+
+TEST_F(DatagramServerTest, ASocketThatFailsForGoodIsGivenUpWithAWarning) {
+  // Not connected: it always has something to tell, and never anything to read.
+  FileDescriptor unusable(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  FirstWarning warning;
+  const auto server = DatagramServer::start({.socket = std::move(unusable)}, receiver_, warning);
+  auto text = warning.text.get_future();
+  ASSERT_EQ(text.wait_for(std::chrono::milliseconds(kDeadlineMilliseconds)), std::future_status::ready);
+  EXPECT_EQ(text.get(),
+            "cannot receive datagrams any more: Transport endpoint is not connected; start the lab again");
 }
 
 TEST(DatagramListenerTest, AddressesAndPortsInUseAreNamed) {

@@ -347,6 +347,7 @@ TEST_F(LabTest, ClientsThatCannotTalkToItAreNamedWithTheRemedy) {
   ASSERT_TRUE(ensureCertificates(others, {"localhost"}, std::time(nullptr)));
   EXPECT_EQ(Client(others.authority).get(at("url")).code, CURLE_PEER_FAILED_VERIFICATION);
   lab_->stop();
+  console_.flush();
   std::rewind(output_.get());
   std::string text(65536, '\0');
   text.resize(std::fread(text.data(), 1, text.size(), output_.get()));
