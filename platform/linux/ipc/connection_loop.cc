@@ -177,6 +177,7 @@ ConnectionLoop::Pump ConnectionLoop::processOnce() {
   const int r = sd_bus_process(bus_.get(), nullptr);
   if (r == -ECONNRESET || r == -EPIPE) return Pump::over;
   if (r < 0) return closing(std::string("it broke the protocol: ") + strerror(-r));
+  if (isOutOfStep_) return closing("it broke the protocol: a message where none was seen");
   const bool isDone = admitted_ == 0 && messages_ == framer_.completed() && ready_;
   if (r == 0 || isDone) isFed_ = false;
   // The library drops what it finds malformed without a word; a peer that sends such is not to be trusted
@@ -252,17 +253,23 @@ std::string_view ConnectionLoop::unadmitted() const {
 // Looks at what was received. The bus has read everything before it.
 ConnectionLoop::Pump ConnectionLoop::examine() {
   isNew_ = false;
+  // The bus has read the last line, and would let another follow: it must not go on with lines where we see
+  // messages.
+  if (!framer_.isAuthenticating() && !ready_) {
+    return closing("it broke the protocol: its authentication did not end with BEGIN");
+  }
   const auto input = unadmitted();
   if (input.empty()) {
     dropDescriptors();
     return Pump::progress;
   }
   if (framer_.isAuthenticating()) {
-    admitted_ = framer_.admitAuthentication(input);
+    const auto lines = framer_.admitAuthentication(input);
+    if (!lines) return closing(framer_.refusal());
+    admitted_ = *lines;
     isNew_ = true;
     return Pump::progress;
   }
-  if (!ready_) return admit(input.size());
   if (!framer_.isBetweenMessages()) return admit(std::min(input.size(), framer_.restOfMessage()));
   const auto size = framer_.sizeOfNext(input);
   if (!size) return closing(framer_.refusal());

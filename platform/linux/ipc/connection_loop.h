@@ -164,6 +164,7 @@ class ConnectionLoop {
   bool toldOfDescriptors_ = false;     // that nobody asked for
   std::vector<UniqueFd> descriptors_;  // came with bytes that have not been looked at
   std::vector<UniqueFd> announced_;    // belong to the message that the bus reads now
+  bool isOutOfStep_ = false;           // the bus took for a message what did not come as one
   uint64_t messages_ = 0;              // that were read, by the bus or past it
 
   // The call whose method runs now.

@@ -20,6 +20,11 @@ int ConnectionLoop::onMessage(sd_bus_message* message) {
   std::vector<UniqueFd> descriptors = std::exchange(announced_, {});
   uint8_t type = 0;
   if (sd_bus_message_get_type(message, &type) < 0 || type != SD_BUS_MESSAGE_METHOD_CALL) return 1;
+  // Nothing that was bounded: it is not carried out.
+  if (messages_ > framer_.completed()) {
+    isOutOfStep_ = true;
+    return 1;
+  }
   const char* interface = sd_bus_message_get_interface(message);
   if (interface != nullptr && std::strcmp(interface, wire::kSessionInterface) == 0 &&
       std::strcmp(sd_bus_message_get_path(message), wire::kSessionPath) == 0) {

@@ -9,6 +9,8 @@ namespace {
 
 constexpr size_t kFixedHeader = 16;
 constexpr std::string_view kLastLine = "BEGIN\r\n";
+// Of the authentication, all lines together; what is customary has less than 100.
+constexpr size_t kMaxAuthentication = 4096;
 
 uint32_t numberAt(std::string_view header, size_t offset, bool isLittleEndian) {
   uint32_t number = 0;
@@ -20,7 +22,12 @@ uint32_t numberAt(std::string_view header, size_t offset, bool isLittleEndian) {
 }  // namespace
 
 std::optional<size_t> InputFramer::admit(std::string_view bytes) {
-  size_t admitted = authenticating_ ? admitAuthentication(bytes) : 0;
+  size_t admitted = 0;
+  if (authenticating_) {
+    const auto lines = admitAuthentication(bytes);
+    if (!lines) return std::nullopt;
+    admitted = *lines;
+  }
   while (!authenticating_ && admitted < bytes.size()) {
     if (restOfMessage_ == 0) {
       const auto size = sizeOfNext(bytes.substr(admitted));
@@ -36,11 +43,18 @@ std::optional<size_t> InputFramer::admit(std::string_view bytes) {
   return admitted;
 }
 
-// The authentication ends with a line that is BEGIN; its bytes are bounded by the library.
-size_t InputFramer::admitAuthentication(std::string_view bytes) {
+// The authentication ends with a line that is BEGIN. What a line is must be the same here as for the library,
+// or the client would choose what each of us takes for a message: it ends with both of "\r\n", and before the
+// first one there is a NUL.
+std::optional<size_t> InputFramer::admitAuthentication(std::string_view bytes) {
   for (size_t i = 0; i < bytes.size(); ++i) {
-    if (line_.size() <= kLastLine.size()) line_ += bytes[i];
-    if (bytes[i] != '\n') continue;
+    if (authenticationBytes_++ == kMaxAuthentication) {
+      refusal_ = "its authentication takes more than " + std::to_string(kMaxAuthentication) + " bytes";
+      return std::nullopt;
+    }
+    if (authenticationBytes_ == 1) continue;
+    line_ += bytes[i];
+    if (!line_.ends_with("\r\n")) continue;
     if (line_ == kLastLine) {
       authenticating_ = false;
       line_ = std::string();

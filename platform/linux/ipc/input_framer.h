@@ -23,8 +23,9 @@ class InputFramer {
 
   // Until the peer's line that ends the authentication.
   bool isAuthenticating() const noexcept { return authenticating_; }
-  // While authenticating: how many of these bytes belong to the authentication.
-  size_t admitAuthentication(std::string_view bytes);
+  // While authenticating: how many of these bytes belong to the authentication. Nothing when there are too
+  // many.
+  std::optional<size_t> admitAuthentication(std::string_view bytes);
   // True when the next byte begins a message.
   bool isBetweenMessages() const noexcept { return !authenticating_ && restOfMessage_ == 0; }
   // Bytes of the message begun that were not admitted yet.
@@ -41,7 +42,8 @@ class InputFramer {
  private:
   const size_t maxMessageBytes_;
   bool authenticating_ = true;
-  std::string line_;          // of the authentication, as far as it matters
+  std::string line_;  // of the authentication
+  size_t authenticationBytes_ = 0;
   size_t restOfMessage_ = 0;  // bytes of the current message that are still to come
   uint64_t completed_ = 0;
   std::string refusal_;

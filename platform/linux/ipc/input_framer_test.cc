@@ -35,12 +35,35 @@ TEST(InputFramerTest, MessagesAreCountedWhereverTheBytesAreCut) {
 
 TEST(InputFramerTest, OnlyALineOfItsOwnEndsTheAuthentication) {
   InputFramer framer(kLimit);
+  // Neither of the two alone ends a line.
   const std::string lines =
-      std::string("\0AUTH BEGIN\r\nXBEGIN\r\nBEGIN \r\n", 29) + std::string(100'000, 'B');
+      std::string("\0AUTH BEGIN\r\nXBEGIN\r\nBEGIN \r\nX\nBEGIN\r\nX\rBEGIN\r\n\r\r\nBEGIN\r\r\nBEGIN\n",
+                  64) +
+      std::string(1000, 'B');
   EXPECT_EQ(framer.admit(lines), lines.size());
+  EXPECT_TRUE(framer.isAuthenticating());
   EXPECT_EQ(framer.admit("\r\nBEGIN\r\n"), 9U);
   EXPECT_EQ(framer.admit("x"), 0U);
   EXPECT_FALSE(framer.admit(std::string(16, 'x')));
+}
+
+TEST(InputFramerTest, TheFirstByteIsOfNoLine) {
+  for (const char first : {'\0', 'x', '\r'}) {
+    InputFramer framer(kLimit);
+    EXPECT_EQ(framer.admit(first + std::string("BEGIN\r\n")), 8U);
+    EXPECT_FALSE(framer.isAuthenticating());
+  }
+}
+
+TEST(InputFramerTest, TheAuthenticationIsBounded) {
+  for (const bool fits : {true, false}) {
+    InputFramer framer(kLimit);
+    const std::string lines(fits ? 4089 : 4090, 'x');
+    EXPECT_EQ(framer.admit(lines.substr(0, 2000)), 2000U);
+    EXPECT_EQ(framer.admit(lines.substr(2002) + "\r\n"), lines.size() - 2000);
+    EXPECT_EQ(framer.admit("BEGIN\r\n").has_value(), fits);
+    EXPECT_EQ(framer.refusal(), fits ? "" : "its authentication takes more than 4096 bytes");
+  }
 }
 
 TEST(InputFramerTest, TheLimitItselfIsAllowedAndOneMoreIsNot) {

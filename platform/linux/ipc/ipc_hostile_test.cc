@@ -37,6 +37,18 @@ class IpcHostileTest : public ::testing::Test {
     BusClient client(service.path());
     EXPECT_NE(client.call("StartConfig", ""), nullptr) << client.errorText;
   }
+  // Connections that were closed for what begins so.
+  size_t closings(const std::string& why) {
+    size_t count = 0;
+    for (const auto& line : service.log().startingWith("IpcConnection: Closing the connection of ")) {
+      if (line.text.find(": " + why) != std::string::npos) ++count;
+    }
+    return count;
+  }
+  size_t callsOf(size_t connection) const {
+    const auto session = service.session(connection);
+    return session == nullptr ? 0 : session->count();
+  }
 
   Service service;
 };
@@ -92,6 +104,96 @@ TEST_F(IpcHostileTest, CallsInOnePieceWithTheHandshakeAreServed) {
   EXPECT_TRUE(client.write(std::string("\0AUTH ANONYMOUS 74\r\nBEGIN\r\n", 27) + rawCall("StartConfig") +
                            rawCall("FlushMessages") + rawCall("FinishSession")));
   EXPECT_TRUE(eventually([&] { return service.accepted() == 1 && service.session()->count() == 3; }));
+}
+
+// Where the authentication ends must be the same for the one who bounds messages and the one who reads them.
+TEST_F(IpcHostileTest, LinesThatOnlySeemToEndTheAuthenticationLetNothingPass) {
+  service.start();
+  // The header of a large message, in which the calls and the last line hide from the one who bounds.
+  const std::string cover = std::string("B\1\0\1\0\x0F\xF0\0\0\0\0\1\0\0\0\0", 16) + "\r\nBEGIN\r\n";
+  const std::string authenticated("\0AUTH ANONYMOUS 74\r\n", 20);
+  for (const std::string& lines :
+       {authenticated + "NOPE\nBEGIN\r\n", authenticated + "\nBEGIN\r\n", authenticated + "X\rBEGIN\r\n",
+        authenticated + "NEGOTIATE_UNIX_FD\nBEGIN\r\n"}) {
+    const RawClient client(service.path());
+    const size_t before = service.invalidations();
+    client.write(lines + cover + rawCall("StartConfig") +
+                 rawCall("SetSessionInfo", std::string(16, '\0'), "aa{sv}aa{sv}aavb", uint32_t{2} << 20U));
+    EXPECT_TRUE(isClosedByPeer(client.fd()));
+    EXPECT_TRUE(eventually([&] { return service.invalidations() == before + 1; }));
+  }
+  EXPECT_EQ(closings("a message of 2097"), 4U);
+  expectOthersAreServed();
+}
+
+TEST_F(IpcHostileTest, AnAuthenticationThatIsEndedBeforeItSucceededEndsTheConnection) {
+  service.start();
+  const std::vector<std::string> handshakes{std::string("\0BEGIN\r\n", 8),
+                                            std::string("\0AUTH\r\nBEGIN\r\n", 14),
+                                            std::string("\0AUTH KERBEROS_V4 00\r\nBEGIN\r\n", 29),
+                                            std::string("\0NEGOTIATE_UNIX_FD\r\nBEGIN\r\n", 27),
+                                            std::string("\0AUTH ANONYMOUS 74\r\nCANCEL\r\nBEGIN\r\n", 35),
+                                            std::string("\0AUTH ANONYMOUS 74\r\nERROR\r\nBEGIN\r\n", 34)};
+  for (const std::string& handshake : handshakes) {
+    for (const std::string& rest :
+         {std::string(), "AUTH ANONYMOUS 74\r\nBEGIN\r\n" + rawCall("StartConfig")}) {
+      const RawClient client(service.path());
+      client.write(handshake + rest);
+      EXPECT_TRUE(isClosedByPeer(client.fd())) << handshake;
+    }
+  }
+  EXPECT_TRUE(eventually([&] { return service.invalidations() == 2 * handshakes.size(); }));
+  EXPECT_EQ(closings("it broke the protocol: its authentication did not end with BEGIN"),
+            2 * handshakes.size());
+  expectOthersAreServed();
+}
+
+TEST_F(IpcHostileTest, AnAuthenticationWithoutEndIsClosed) {
+  service.start();
+  const RawClient client(service.path());
+  client.write(std::string("\0AUTH ANONYMOUS 74\r\n", 20) + std::string(10'000, 'x'));
+  EXPECT_TRUE(isClosedByPeer(client.fd()));
+  EXPECT_TRUE(eventually([&] { return closings("its authentication takes more than 4096 bytes") == 1; }));
+}
+
+// As the common libraries do it: some ask what there is, some wait for each answer, some send all at once.
+TEST_F(IpcHostileTest, EveryCustomaryAuthenticationIsTaken) {
+  service.start();
+  const std::string name = std::to_string(getuid());
+  std::string hex;
+  for (const char digit : name) hex += std::string("3") + digit;
+  const std::vector<std::vector<std::string>> handshakes{
+      {"AUTH EXTERNAL " + hex, "NEGOTIATE_UNIX_FD", "BEGIN"},
+      {"AUTH", "AUTH EXTERNAL " + hex, "NEGOTIATE_UNIX_FD", "BEGIN"},
+      {"AUTH EXTERNAL", "DATA", "NEGOTIATE_UNIX_FD", "BEGIN"},
+      {"AUTH EXTERNAL", "DATA " + hex, "BEGIN"},
+      {"AUTH KERBEROS_V4", "AUTH ANONYMOUS", "DATA", "BEGIN"},
+      {"AUTH EXTERNAL " + hex, "CANCEL", "AUTH ANONYMOUS 74", "BEGIN"}};
+  size_t served = 0;
+  for (const auto& handshake : handshakes) {
+    std::string all(1, '\0');
+    for (const auto& line : handshake) all += line + "\r\n";
+    const std::string calls = rawCall("StartConfig") + rawCall("FlushMessages");
+    {
+      const RawClient patient(service.path());
+      patient.write(std::string(1, '\0'));
+      for (const auto& line : handshake) {
+        patient.write(line + "\r\n");
+        EXPECT_TRUE(line == "BEGIN" || patient.readLine().ends_with("\r\n"));
+      }
+      patient.write(calls);
+      EXPECT_TRUE(eventually([&] { return service.accepted() == served + 1 && callsOf(served) == 2; }));
+      ++served;
+    }
+    for (size_t cut = 1; cut < all.size(); cut += 7) {
+      const RawClient client(service.path());
+      client.write(all.substr(0, cut));
+      client.write(all.substr(cut) + calls);
+      EXPECT_TRUE(eventually([&] { return service.accepted() == served + 1 && callsOf(served) == 2; }));
+      ++served;
+    }
+  }
+  EXPECT_EQ(closings(""), 0U);
 }
 
 TEST_F(IpcHostileTest, AMessageThatIsTooLargeEndsTheConnection) {
