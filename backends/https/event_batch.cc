@@ -1,6 +1,7 @@
 #include "backends/https/event_batch.h"
 
 #include <utility>
+#include <vector>
 
 namespace tarnel {
 namespace {
@@ -20,6 +21,44 @@ size_t heapSize(const Value& value) {
   size_t bytes = 0;
   for (const auto& item : *array) bytes += sizeof(Value) + heapSize(item);
   return bytes;
+}
+
+struct SizedField {
+  const std::string& key;
+  const Value& value;
+  size_t entryBytes;
+  size_t valueBytes;
+};
+
+std::vector<SizedField> withSizes(const Dictionary& fields) {
+  std::vector<SizedField> sized;
+  sized.reserve(fields.size());
+  for (const auto& [key, value] : fields) {
+    const size_t bytes = heapSize(value);
+    sized.push_back({key, value, sizeof(Dictionary::Entry) + heapSize(key) + bytes, bytes});
+  }
+  return sized;
+}
+
+// Equal in every respect, which is quickly seen; of others this is not asked.
+bool isSame(const Value& a, const Value& b) {
+  const bool isPlain = a.type() == Value::Type::string || a.type() == Value::Type::boolean ||
+                       a.type() == Value::Type::integer || a.type() == Value::Type::unsignedInteger;
+  return isPlain && a == b;
+}
+
+struct SizeChange {
+  size_t more = 0;
+  size_t less = 0;
+};
+
+SizeChange setField(Dictionary& event, const SizedField& field) {
+  const Value* old = event.find(field.key);
+  if (old != nullptr && isSame(*old, field.value)) return {};
+  const SizeChange change =
+      old == nullptr ? SizeChange{field.entryBytes, 0} : SizeChange{field.valueBytes, heapSize(*old)};
+  event.set(field.key, field.value);
+  return change;
 }
 
 }  // namespace
@@ -49,21 +88,22 @@ void EventBatch::append(Dictionary event, size_t bytes) {
 }
 
 size_t EventBatch::mergeIntoAll(const Dictionary& fields) {
-  if (bytes_ + estimateSize(fields) * events_.size() <= kMaxBytes) {
-    for (auto& held : events_) held.event.merge(fields);
-    return 0;
-  }
-  bytes_ = 0;
+  const std::vector<SizedField> sized = withSizes(fields);
+  size_t bytes = 0;
   for (size_t left = events_.size(); left > 0; --left) {
     Held& held = events_[left - 1];
-    held.event.merge(fields);
-    held.bytes = estimateSize(held.event);
-    if (left < events_.size() && bytes_ + held.bytes > kMaxBytes) {
+    for (const auto& field : sized) {
+      const SizeChange change = setField(held.event, field);
+      held.bytes = held.bytes + change.more - change.less;
+    }
+    if (left < events_.size() && bytes + held.bytes > kMaxBytes) {
       events_.erase(events_.begin(), events_.begin() + static_cast<std::ptrdiff_t>(left));
+      bytes_ = bytes;
       return left;
     }
-    bytes_ += held.bytes;
+    bytes += held.bytes;
   }
+  bytes_ = bytes;
   return 0;
 }
 

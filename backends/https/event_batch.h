@@ -23,12 +23,14 @@ class EventBatch {
   bool hasRoomFor(size_t bytes) const noexcept;
   // Drops the oldest events until there is room; returns how many. A batch without events has room for any
   // one event.
-  size_t makeRoomFor(size_t bytes);
+  [[nodiscard]] size_t makeRoomFor(size_t bytes);
+  // bytes: the event's estimateSize.
   void append(Dictionary event, size_t bytes);
 
   // Every entry of `fields` is set in every event. Where the events would outgrow kMaxBytes by that, the
-  // oldest are dropped, all but the last; returns how many.
-  size_t mergeIntoAll(const Dictionary& fields);
+  // oldest are dropped, all but the last; returns how many. Costs little where the events have the entries
+  // already.
+  [[nodiscard]] size_t mergeIntoAll(const Dictionary& fields);
   // Leaves the batch empty.
   Array takeEvents();
 

@@ -2,6 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <cmath>
+#include <vector>
+
 namespace tarnel {
 namespace {
 
@@ -23,7 +26,7 @@ TEST(EventBatchTest, MergesIntoEveryEvent) {
   EventBatch batch;
   batch.append({{"a", 1}}, 10);
   batch.append({{"b", 1}}, 10);
-  batch.mergeIntoAll({{"a", 2}});
+  EXPECT_EQ(batch.mergeIntoAll({{"a", 2}}), 0U);
   EXPECT_EQ(batch.takeEvents(), (Array{Dictionary{{"a", 2}}, Dictionary{{"b", 1}, {"a", 2}}}));
 }
 
@@ -52,6 +55,48 @@ TEST(EventBatchTest, TheNewestEventStaysWhateverIsMerged) {
   const Array events = batch.takeEvents();
   ASSERT_EQ(events.size(), 1U);
   EXPECT_EQ(*events[0].dictionary()->find("n"), Value(2));
+}
+
+// Where all stay, what they take is counted as exactly as where some go.
+TEST(EventBatchTest, WhatIsMergedCountsInTheBound) {
+  EventBatch batch;
+  const std::string text(1000, 'x');
+  const std::vector<Dictionary> events{
+      {{"n", 1}},
+      {{"n", 2}, {"label", "short"}},
+      {{"n", 3}, {"label", std::string(5000, 'y')}},
+      {{"n", 4}, {"label", text}},
+      {{"n", 5}, {"label", Array{text, Dictionary{{text, text}}}}, {"list", Array{text}}},
+      {{"n", 6}, {"list", 1}, {"flag", 1}},
+  };
+  for (const auto& event : events) batch.append(event, EventBatch::estimateSize(event));
+  const Dictionary fields{{"label", text}, {"list", Array{1, text, text}}, {"flag", true}, {"real", 0.5}};
+  for (int times = 0; times < 2; ++times) {
+    EXPECT_EQ(batch.mergeIntoAll(fields), 0U);
+    size_t bytes = 0;
+    for (auto event : events) {
+      event.merge(fields);
+      bytes += EventBatch::estimateSize(event);
+    }
+    EXPECT_TRUE(batch.hasRoomFor(EventBatch::kMaxBytes - bytes));
+    EXPECT_FALSE(batch.hasRoomFor(EventBatch::kMaxBytes - bytes + 1));
+  }
+  // Each event counts for what it has become.
+  EXPECT_EQ(batch.makeRoomFor(EventBatch::kMaxBytes), events.size());
+  batch.append(numbered(1), EventBatch::kMaxBytes);
+  EXPECT_TRUE(batch.hasRoomFor(0));
+  EXPECT_FALSE(batch.hasRoomFor(1));
+}
+
+TEST(EventBatchTest, MergingReplacesWhatOnlyLooksEqual) {
+  EventBatch batch;
+  batch.append({{"flag", 1}, {"zero", 0.0}, {"text", "same"}}, 10);
+  EXPECT_EQ(batch.mergeIntoAll({{"flag", true}, {"zero", -0.0}, {"text", "same"}}), 0U);
+  const Array events = batch.takeEvents();
+  const Dictionary& event = *events[0].dictionary();
+  EXPECT_EQ(*event.find("flag"), Value(true));
+  EXPECT_TRUE(std::signbit(*event.find("zero")->real()));
+  EXPECT_EQ(*event.find("text"), Value("same"));
 }
 
 TEST(EventBatchTest, BoundsBytesByDroppingTheOldest) {

@@ -109,6 +109,7 @@ class HTTPSPostBackend final : public TarnelBackend {
   bool postsAtOnce(bool realtime) const;
   MaybeString postEvent(Dictionary event, Method method, RespCode respCode, Flag flag);
   bool canFlush() const;
+  void mergeIntoBatch(const Dictionary& fields, const char* operation, const char* what);
 
   MaybeString _postURL;
   bool _useDefaultPostURL = false;

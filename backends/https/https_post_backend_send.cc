@@ -92,6 +92,16 @@ bool HTTPSPostBackend::canFlush() const {
   return state() == ReportingState::enabled && (!requireUserInfo() || userInfoDict());
 }
 
+void HTTPSPostBackend::mergeIntoBatch(const Dictionary& fields, const char* operation, const char* what) {
+  const size_t dropped = _batchedEvents->mergeIntoAll(fields);
+  if (dropped == 0) return;
+  TARNEL_LOG(
+      dependencies().log, warning,
+      "HTTPSPostBackend(%s): %s: the oldest %zu events are dropped, since with the %s all would exceed "
+      "%zu bytes",
+      operation, name().c_str(), dropped, what, EventBatch::kMaxBytes);
+}
+
 MaybeString HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
   if (_batchedEvents && state() != ReportingState::enabled) {
     // The counts per method stay.
@@ -110,13 +120,7 @@ MaybeString HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion comple
   if (userInfoDict()) {
     auto userInfo = *userInfoDict();
     _filters.filterEvent(userInfo);
-    if (const size_t dropped = _batchedEvents->mergeIntoAll(userInfo); dropped != 0) {
-      TARNEL_LOG(
-          dependencies().log, warning,
-          "HTTPSPostBackend(flushMessagesWithCompletion): %s: the oldest %zu events are dropped, since with "
-          "the user information all would exceed %zu bytes",
-          name().c_str(), dropped, EventBatch::kMaxBytes);
-    }
+    mergeIntoBatch(userInfo, "flushMessagesWithCompletion", "user information");
   }
   auto events = _batchedEvents->takeEvents();
   MaybeString pretty;
@@ -141,7 +145,7 @@ void HTTPSPostBackend::setCorrelatedSessionID(const MaybeString& correlatedSessi
   if (!_batchedEvents || !correlatedSessionID) return;
   Dictionary label;
   label.set("_sessionID", *correlatedSessionID);
-  _batchedEvents->mergeIntoAll(label);
+  mergeIntoBatch(label, "setCorrelatedSessionID", "identifier of the session");
 }
 
 }  // namespace tarnel

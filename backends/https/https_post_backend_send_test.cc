@@ -355,59 +355,5 @@ TEST_F(HTTPSPostBackendSendTest, FlushDoesNotTouchTheUserInfoItself) {
   EXPECT_TRUE(backend->userInfoDict()->contains("secret"));
 }
 
-// --- correlated identifier ---
-
-// A client may keep back a large user information until many events are held.
-TEST_F(HTTPSPostBackendSendTest, UserInfoThatComesLateDoesNotOutgrowTheBound) {
-  const auto late = userInfo;
-  userInfo.reset();
-  const auto backend = makeUpdated();
-  for (int i = 0; i < 40; ++i) send(*backend);
-  userInfo = late;
-  userInfo->set("large", std::string(1U << 20U, 'x'));
-  backend->setUserInfoDict(userInfo);
-  backend->updateState();
-  flush(*backend);
-  EXPECT_EQ(postedEvents().size(), 3U);
-  expectLog(
-      LogLevel::warning,
-      "HTTPSPostBackend(flushMessagesWithCompletion): httppost: the oldest 37 events are dropped, since "
-      "with the user information all would exceed 4194304 bytes");
-}
-
-TEST_F(HTTPSPostBackendSendTest, CorrelatedIdentifierRelabelsTheBatch) {
-  const auto backend = makeUpdated();
-  backend->setCombinedSessionIDString("own");
-  send(*backend);
-  send(*backend);
-  backend->setCorrelatedSessionID("top.own");
-  send(*backend);
-  flush(*backend);
-  EXPECT_EQ(backend->combinedSessionIDString(), "top.own");
-  const auto events = postedEvents();
-  ASSERT_EQ(events.size(), 3U);
-  for (const auto& event : events) EXPECT_EQ(*event.find("_sessionID"), Value("top.own"));
-}
-
-TEST_F(HTTPSPostBackendSendTest, CorrelatedIdentifierReplacesSessionNumbersToo) {
-  internal = true;
-  const auto backend = makeUpdated();
-  backend->setCompType(7);
-  send(*backend);
-  backend->setCorrelatedSessionID("top.own");
-  send(*backend);
-  flush(*backend);
-  EXPECT_EQ(*postedEvents().at(0).find("_sessionID"), Value("top.own"));
-  EXPECT_EQ(*postedEvents().at(1).find("_sessionID"), Value(77));
-}
-
-TEST_F(HTTPSPostBackendSendTest, CorrelatedIdentifierWithoutABatchMakesNone) {
-  const auto backend = makeUpdated();
-  backend->setCorrelatedSessionID("top.own");
-  expectNothingToFlush(*backend);
-  backend->setCorrelatedSessionID(std::nullopt);
-  EXPECT_EQ(backend->combinedSessionIDString(), std::nullopt);
-}
-
 }  // namespace
 }  // namespace tarnel
