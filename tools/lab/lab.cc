@@ -135,8 +135,8 @@ MaybeError RunningLab::begin() {
 void RunningLab::makeHandlers() {
   store_.addObserver(writer_);
   store_.addObserver(console_);
-  storebags_ =
-      std::make_unique<StorebagSource>(directory_.paths.storebags, directory_.key, baseURL(), started_);
+  storebags_ = std::make_unique<StorebagSource>(directory_.paths.storebags, directory_.key,
+                                                OwnAddresses{baseURL(), datagramPort_}, started_);
   logData_ = std::make_unique<LogDataReceiver>(logDataFiles_, controlURL() + "/log-data", store_,
                                                misbehaviours_, clock_);
   service_ = std::make_unique<Service>(Service::Parts{.storebags = *storebags_,

@@ -26,7 +26,9 @@ void addOptions(CLI::App& app, LabOptions& options) {
   app.add_option("--datagram-port", options.datagramPort,
                  "UDP port for datagrams, 0 for any free one [8445, or any free one with --port 0]")
       ->check(CLI::Range(0, 65535));
-  app.add_option("--max-upload", options.maxUploadMiB, "largest file taken, in MiB, packed and unpacked")
+  app.add_option("--max-upload", options.maxUploadMiB,
+                 "largest file taken, in MiB, packed and unpacked; bodies take up to 256 MiB of memory, "
+                 "or twice this if it is more")
       ->check(CLI::Range(1, 1024))
       ->capture_default_str();
   app.add_option("--keep", options.keep, "arrivals of each kind kept in memory")

@@ -61,8 +61,8 @@ bool StorebagSource::Entry::isOf(const struct stat& status) const {
          sameTime(written, status.st_mtim) && size == status.st_size && inode == status.st_ino;
 }
 
-StorebagSource::StorebagSource(std::string folder, StorebagKey key, std::string labURL, int64_t started)
-    : folder_(std::move(folder)), key_(std::move(key)), labURL_(std::move(labURL)), started_(started) {}
+StorebagSource::StorebagSource(std::string folder, StorebagKey key, OwnAddresses lab, int64_t started)
+    : folder_(std::move(folder)), key_(std::move(key)), lab_(std::move(lab)), started_(started) {}
 
 StorebagSource::Lookup StorebagSource::find(const std::string& name) {
   Lookup lookup;
@@ -98,7 +98,8 @@ void StorebagSource::refresh(Entry& entry, const std::string& path, const struct
     entry.error = inner.error().localizedDescription();
     return;
   }
-  replaceAll(*inner, kLabURLPlaceholder, labURL_);
+  replaceAll(*inner, kLabURLPlaceholder, lab_.url);
+  replaceAll(*inner, kLabDatagramPortPlaceholder, std::to_string(lab_.datagramPort));
   if (entry.storebag && *inner == entry.inner) return;
   const Result<Value> document = parseDocument(*inner);
   if (!document) {

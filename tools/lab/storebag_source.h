@@ -14,7 +14,15 @@
 
 namespace tarnel::lab {
 
+// What stands for the lab's own in a document; replaced before the document is parsed.
 inline constexpr char kLabURLPlaceholder[] = "{{LAB_URL}}";
+inline constexpr char kLabDatagramPortPlaceholder[] = "{{LAB_DATAGRAM_PORT}}";
+
+// Where the lab itself listens.
+struct OwnAddresses {
+  std::string url;
+  uint16_t datagramPort = 0;
+};
 
 // A storebag as it is served.
 struct PreparedStorebag {
@@ -31,7 +39,7 @@ class StorebagSource {
  public:
   // started: seconds since 1970; nothing is dated before it, because another run may have served other
   // content (with another address, say) from the same file.
-  StorebagSource(std::string folder, StorebagKey key, std::string labURL, int64_t started);
+  StorebagSource(std::string folder, StorebagKey key, OwnAddresses lab, int64_t started);
 
   struct Lookup {
     std::shared_ptr<const PreparedStorebag> storebag;  // null: see error
@@ -61,7 +69,7 @@ class StorebagSource {
 
   const std::string folder_;
   const StorebagKey key_;
-  const std::string labURL_;
+  const OwnAddresses lab_;
   const int64_t started_;
   std::mutex mutex_;
   std::map<std::string, Entry> entries_;

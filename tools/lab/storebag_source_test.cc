@@ -45,7 +45,7 @@ class StorebagSourceTest : public ::testing::Test {
 
   const std::string folder_ = ::testing::TempDir() + "tarnel_storebags_" +
                               ::testing::UnitTest::GetInstance()->current_test_info()->name();
-  StorebagSource source_{folder_, key(), "https://127.0.0.1:7", kStarted};
+  StorebagSource source_{folder_, key(), {.url = "https://127.0.0.1:7", .datagramPort = 9}, kStarted};
 };
 
 TEST_F(StorebagSourceTest, SignsTheDocumentWithTheLabsAddress) {
@@ -58,6 +58,13 @@ TEST_F(StorebagSourceTest, SignsTheDocumentWithTheLabsAddress) {
                 {"version", "1"}, {"url", "https://127.0.0.1:7/x"}, {"again", "https://127.0.0.1:7"}}));
   EXPECT_EQ(lookup.storebag->version, "1");
   EXPECT_FALSE(source_.find("a").fresh);
+}
+
+TEST_F(StorebagSourceTest, ThePortForDatagramsIsANumber) {
+  put("a", "{\"port\": {{LAB_DATAGRAM_PORT}}, \"again\": {{LAB_DATAGRAM_PORT}}}");
+  const StorebagSource::Lookup lookup = source_.find("a");
+  ASSERT_TRUE(lookup.storebag) << lookup.error;
+  EXPECT_EQ(*innerOf(lookup.storebag->outer), Value(Dictionary{{"port", 9}, {"again", 9}}));
 }
 
 TEST_F(StorebagSourceTest, TheBrokenOneFailsAtItsSignatureOnly) {

@@ -161,7 +161,10 @@ MaybeError StoredFiles::keep(IncomingFile& file, std::string_view description) {
     if (MaybeError error = giveName(*beside)) return error;
     size += description.size();
   }
-  if (MaybeError error = giveName(file)) return error;
+  if (MaybeError error = giveName(file)) {
+    if (!description.empty()) ::unlink(descriptionOf(file.path()).c_str());
+    return error;
+  }
   entries_.push_back({file.name(), size});
   bytes_ += size;
   makeRoom();

@@ -101,6 +101,7 @@ TEST_F(StoredFilesTest, NothingIsEverOverwritten) {
   write(file->name(), "mine");
   EXPECT_THAT(files.keep(*file, "{}")->localizedDescription(), HasSubstr("File exists"));
   EXPECT_EQ(*readFile(folder_ + "/" + file->name(), 100), "mine");
+  EXPECT_FALSE(pathExists(descriptionOf(file->path()))) << "it would describe what is not ours";
 }
 
 TEST_F(StoredFilesTest, WhatIsNotKeptIsGone) {
