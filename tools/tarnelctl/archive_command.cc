@@ -8,13 +8,12 @@
 #include <string_view>
 
 #include "platform/document.h"
+#include "platform/linux/archive_format.h"
 #include "tools/storebag/file_io.h"
 #include "tools/tarnelctl/readable_value.h"
 
 namespace tarnel::ctl {
 namespace {
-
-constexpr std::string_view kMark = "\xD9\xD9\xF7";
 
 Error tooManyBytes(const std::string& name, size_t maxBytes) {
   return {kToolErrorDomain, EFBIG,
@@ -58,10 +57,9 @@ ExitStatus fail(const Terminal& terminal, const std::string& text) {
 // What to do with bytes that cannot be shown.
 std::string problem(const std::string& bytes, const Error& error) {
   if (bytes.empty()) return "it is empty: give the body of a log data upload, as it was received";
-  if (!bytes.starts_with(kMark)) {
+  if (!bytes.starts_with(kArchiveMark)) {
     return "this is no keyed archive, which begins with the bytes D9 D9 F7: give the body of a log data "
-           "upload, "
-           "as it was received";
+           "upload, as it was received";
   }
   if (error.code() == kArchiveTooLarge) {
     return "it is more than a log data upload may hold: " + error.localizedDescription();

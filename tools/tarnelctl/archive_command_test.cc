@@ -126,8 +126,7 @@ TEST_F(ArchiveCommandTest, WhatIsNoArchiveIsRefused) {
   expectRefusal("", "it is empty: give the body of a log data upload, as it was received");
   const std::string no =
       "this is no keyed archive, which begins with the bytes D9 D9 F7: give the body of a log data upload, "
-      "as it "
-      "was received";
+      "as it was received";
   expectRefusal("{}", no);
   expectRefusal("\x1f\x8b\x08", no);
   expectRefusal("\xD9\xD9", no);
