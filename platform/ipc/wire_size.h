@@ -4,7 +4,7 @@
 
 #include "platform/base/value.h"
 
-// About how many bytes values take on the wire; for bounding what waits to be sent.
+// About how many bytes values take on the wire; for bounding what waits to be sent and what is kept.
 
 namespace tarnel::wire {
 

@@ -12,7 +12,6 @@
 #include <utility>
 
 #include "platform/ipc/wire.h"
-#include "platform/linux/ipc/descriptor_passing.h"
 
 namespace tarnel {
 namespace {
@@ -274,6 +273,7 @@ ConnectionLoop::Pump ConnectionLoop::examine() {
   const auto size = framer_.sizeOfNext(input);
   if (!size) return closing(framer_.refusal());
   messageBytes_ = *size;
+  foundNoRoom_ = false;
   if (*size != 0 && !descriptors_.empty()) {
     if (const auto claimed = claimDescriptors(*size)) return *claimed;
   }
@@ -285,6 +285,11 @@ ConnectionLoop::Pump ConnectionLoop::examine() {
     return Pump::progress;
   }
   const auto place = waitForTurn(LargeCalls::Kind::prompt);
+  if (!place && messageBytes_ > setup_.limits.largeMessage) {
+    // The library reads as much of it as an answer needs.
+    foundNoRoom_ = true;
+    return admit(message.size());
+  }
   auto call = readSendCall(message);
   if (!call) return admit(message.size());
   framer_.passMessage();
@@ -300,6 +305,7 @@ ConnectionLoop::Pump ConnectionLoop::admit(size_t bytes) {
   if (!admitted) return closing(framer_.refusal());
   admitted_ = *admitted;
   isNew_ = admitted_ > 0;
+  if (!announced_.empty()) lastNumber_.add(unadmitted().substr(0, admitted_));
   return Pump::progress;
 }
 
@@ -326,6 +332,7 @@ std::optional<ConnectionLoop::Pump> ConnectionLoop::claimDescriptors(size_t size
   announced_.assign(std::make_move_iterator(descriptors_.begin()), std::make_move_iterator(end));
   descriptors_.erase(descriptors_.begin(), end);
   announceNoDescriptors({buffer_.get() + inputBegin_, header});
+  lastNumber_.begin(input.front());
   return admit(std::min(sizeOfMessage, input.size()));
 }
 

@@ -19,6 +19,7 @@
 #include "platform/ipc/wire.h"
 #include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/connection_link.h"
+#include "platform/linux/ipc/descriptor_passing.h"
 #include "platform/linux/ipc/input_framer.h"
 #include "platform/linux/ipc/ipc_limits.h"
 #include "platform/linux/ipc/large_calls.h"
@@ -138,6 +139,8 @@ class ConnectionLoop {
   BusMessage takeCall(uint64_t serial);
   MaybeError newClientCall(const char* member, BusMessage& message);
   MaybeError send(sd_bus_message* message);
+  void refuseForRoom(sd_bus_message* message);
+  void refuseTooLarge(sd_bus_message* message, const std::string& why);
   void refuse(sd_bus_message* call, const char* name, const std::string& text);
 
   Setup setup_;
@@ -156,14 +159,18 @@ class ConnectionLoop {
   size_t inputBegin_ = 0;
   size_t inputEnd_ = 0;
   size_t admitted_ = 0;
-  size_t messageBytes_ = 0;            // of the message that was looked at last
-  bool isNew_ = false;                 // what is in the buffer and not admitted has not been looked at
-  bool mayHaveMore_ = false;           // the socket, since the last read filled the buffer
-  bool isFed_ = false;                 // the bus may have something to read
-  bool mayPassDescriptors_ = false;    // negotiated
-  bool toldOfDescriptors_ = false;     // that nobody asked for
+  size_t messageBytes_ = 0;          // of the message that was looked at last
+  bool isNew_ = false;               // what is in the buffer and not admitted has not been looked at
+  bool mayHaveMore_ = false;         // the socket, since the last read filled the buffer
+  bool isFed_ = false;               // the bus may have something to read
+  bool mayPassDescriptors_ = false;  // negotiated
+  bool foundNoRoom_ = false;         // the message that the bus reads now, among the large ones
+  bool toldOfDescriptors_ = false;   // that nobody asked for
+  bool toldOfNoRoom_ = false;
+  bool toldOfTooLarge_ = false;
   std::vector<UniqueFd> descriptors_;  // came with bytes that have not been looked at
   std::vector<UniqueFd> announced_;    // belong to the message that the bus reads now
+  LastNumber lastNumber_;              // of that message
   bool isOutOfStep_ = false;           // the bus took for a message what did not come as one
   uint64_t messages_ = 0;              // that were read, by the bus or past it
 

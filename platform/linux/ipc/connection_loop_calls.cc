@@ -46,40 +46,61 @@ void ConnectionLoop::runBusCall(sd_bus_message* message, std::span<UniqueFd> des
     return std::strcmp(member, method.name) == 0;
   };
   if (messageBytes_ > wire::kMaxKeptBytes && (calls(wire::kSetSessionInfo) || calls(wire::kFetchStates))) {
-    const std::string why = "what a session keeps may have " + std::to_string(wire::kMaxKeptBytes) +
-                            " bytes, not " + std::to_string(messageBytes_);
-    setup_.log.log(LogLevel::warning, "IpcConnection: %s of %s is refused: %s",
-                   sd_bus_message_get_member(message), setup_.peer.c_str(), why.c_str());
-    refuse(message, wire::kErrorTooLarge, why);
+    refuseTooLarge(message, "what a session keeps may have " + std::to_string(wire::kMaxKeptBytes) +
+                                " bytes, not " + std::to_string(messageBytes_));
+    return;
+  }
+  if (std::exchange(foundNoRoom_, false)) {
+    refuseForRoom(message);
     return;
   }
   const bool isLarge = messageBytes_ > setup_.limits.largeMessage;
-  const bool waitsForServer = calls(wire::kUploadLogData);
+  // A session's start, also that of a single message, may fetch its configuration.
+  const bool waitsForServer =
+      calls(wire::kUploadLogData) || calls(wire::kStartConfig) || calls(wire::kSendSingleMessage);
   const auto place = waitForTurn(waitsForServer ? LargeCalls::Kind::upload : LargeCalls::Kind::prompt);
   if (isLarge && !place) {
-    refuse(message, wire::kErrorFailed,
-           "the log data of this user that is under way leaves no room for more; try again later");
+    refuseForRoom(message);
     return;
   }
-  carryOut(message, [descriptors](SessionCall call) {
+  carryOut(message, [descriptors, index = lastNumber_.value()](SessionCall call) {
     call.descriptors = descriptors;
+    call.descriptorIndex = index;
     return callSessionMethod(call);
   });
 }
 
-// Room for the message at hand, if it is large; nothing also when log data found none.
+// Room for the message at hand, if it is large; nothing also when it found none.
 std::optional<LargeCalls::Place> ConnectionLoop::waitForTurn(LargeCalls::Kind kind) {
   const auto& limits = setup_.limits;
   if (messageBytes_ <= limits.largeMessage) return std::nullopt;
-  if (kind == LargeCalls::Kind::prompt) return setup_.largeCalls.enter(setup_.uid, kind, messageBytes_);
-  auto place = setup_.largeCalls.enter(setup_.uid, kind, messageBytes_, limits.waitForLogData);
-  if (!place) {
-    setup_.log.log(LogLevel::warning,
-                   "IpcConnection: Log data of %s found no room among that of its user: at most %zu bytes "
-                   "are under way at once",
-                   setup_.peer.c_str(), limits.largeBytesAtWork);
+  return setup_.largeCalls.enter(
+      setup_.uid, kind, messageBytes_,
+      kind == LargeCalls::Kind::prompt ? limits.waitForMessages : limits.waitForUploads);
+}
+
+void ConnectionLoop::refuseForRoom(sd_bus_message* message) {
+  if (setup_.largeCalls.stopped()) {
+    refuse(message, wire::kErrorFailed, "the daemon ends");
+    return;
   }
-  return place;
+  if (!std::exchange(toldOfNoRoom_, true)) {
+    setup_.log.log(
+        LogLevel::warning,
+        "IpcConnection: %s of %s found no room among the large calls of its user: at most %zu bytes are "
+        "under way at once",
+        sd_bus_message_get_member(message), setup_.peer.c_str(), setup_.limits.largeBytesAtWork);
+  }
+  refuse(message, wire::kErrorFailed,
+         "the large calls of this user that are under way leave no room for more; try again later");
+}
+
+void ConnectionLoop::refuseTooLarge(sd_bus_message* message, const std::string& why) {
+  if (!std::exchange(toldOfTooLarge_, true)) {
+    setup_.log.log(LogLevel::warning, "IpcConnection: %s of %s is refused: %s",
+                   sd_bus_message_get_member(message), setup_.peer.c_str(), why.c_str());
+  }
+  refuse(message, wire::kErrorTooLarge, why);
 }
 
 // The library's way of answering needs a message; this one stands for what it has not read.
@@ -124,6 +145,8 @@ void ConnectionLoop::runCall(sd_bus_message* message, Run run) {
   try {
     if (const MaybeError error = run(call)) {
       current_ = nullptr;
+      if (error->domain() == wire::kErrorTooLarge)
+        return refuseTooLarge(message, error->localizedDescription());
       refuse(message, error->domain().c_str(), error->localizedDescription());
     }
   } catch (const std::exception& error) {

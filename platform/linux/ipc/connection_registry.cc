@@ -96,6 +96,8 @@ void ConnectionRegistry::reap() {
 
 size_t ConnectionRegistry::stopAll() {
   using Clock = std::chrono::steady_clock;
+  // First, so that nobody is in line when the connections are told.
+  largeCalls_.stop();
   {
     const std::lock_guard lock(mutex_);
     stopping_ = true;

@@ -97,4 +97,20 @@ void announceNoDescriptors(std::span<char> message) {
   if (at && *at != 0) std::fill_n(message.begin() + static_cast<std::ptrdiff_t>(*at), 4, '\0');
 }
 
+void LastNumber::begin(char byteOrder) noexcept {
+  byteOrder_ = byteOrder;
+  bytes_ = {};
+}
+
+void LastNumber::add(std::string_view piece) noexcept {
+  piece = piece.substr(piece.size() - std::min(piece.size(), bytes_.size()));
+  std::shift_left(bytes_.begin(), bytes_.end(), static_cast<std::ptrdiff_t>(piece.size()));
+  std::copy(piece.begin(), piece.end(), bytes_.end() - static_cast<std::ptrdiff_t>(piece.size()));
+}
+
+uint32_t LastNumber::value() const noexcept {
+  const std::array<char, 5> message{byteOrder_, bytes_[0], bytes_[1], bytes_[2], bytes_[3]};
+  return numberAt({message.data(), message.size()}, 1);
+}
+
 }  // namespace tarnel

@@ -2,7 +2,9 @@
 
 #include <sys/types.h>
 
+#include <array>
 #include <cstddef>
+#include <cstdint>
 #include <optional>
 #include <span>
 #include <string_view>
@@ -29,5 +31,18 @@ size_t headerSize(std::string_view message);
 
 // Makes a message that announces descriptors one that announces none.
 void announceNoDescriptors(std::span<char> message);
+
+// The last four bytes of a message, which comes in pieces, as the number that they are.
+class LastNumber {
+ public:
+  // Of a message that begins with this byte.
+  void begin(char byteOrder) noexcept;
+  void add(std::string_view piece) noexcept;
+  uint32_t value() const noexcept;
+
+ private:
+  char byteOrder_ = 'l';
+  std::array<char, 4> bytes_{};
+};
 
 }  // namespace tarnel

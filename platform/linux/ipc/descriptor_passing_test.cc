@@ -114,5 +114,19 @@ TEST(DescriptorPassingTest, NoMoreThanTheLimitAreReceivedAndTheRestIsClosed) {
   EXPECT_EQ(openDescriptors(), before);
 }
 
+TEST(LastNumberTest, IsThatOfTheMessageHoweverItIsCut) {
+  const std::string bytes = "abcdefgh\x01\x02\x03\x04";
+  for (const auto& [order, expected] : {std::pair{'l', 0x04030201U}, std::pair{'B', 0x01020304U}}) {
+    for (size_t cut = 1; cut <= bytes.size(); ++cut) {
+      LastNumber number;
+      number.begin(order);
+      for (size_t at = 0; at < bytes.size(); at += cut) number.add(std::string_view(bytes).substr(at, cut));
+      EXPECT_EQ(number.value(), expected) << cut;
+      number.begin(order);
+      EXPECT_EQ(number.value(), 0U);
+    }
+  }
+}
+
 }  // namespace
 }  // namespace tarnel

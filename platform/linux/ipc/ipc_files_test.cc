@@ -383,6 +383,40 @@ TEST_F(IpcFilesTest, ACallWithoutItsDescriptorIsRefused) {
   EXPECT_THAT(service.session(1)->calls(), ElementsAre("startConfig"));
 }
 
+TEST_F(IpcFilesTest, TheDescriptorIsNamedByTheOnlyIndexThereIs) {
+  onFile([](ClientFile&) {});
+  const auto file = open(write("x", "x"));
+  const RawClient client(service.path());
+  client.authenticateForDescriptors();
+  const auto upload = [](uint32_t index) {
+    return rawCall("UploadFile", uploadBody("/x", index), "sh", UINT32_MAX, 1, 1);
+  };
+  EXPECT_TRUE(client.writeWith(upload(1), file.get()));
+  // Also when the index comes in pieces.
+  const std::string call = upload(0x01000000);
+  EXPECT_TRUE(client.writeWith(call.substr(0, call.size() - 2), file.get()));
+  std::string answers;
+  std::array<char, 4096> piece{};
+  const auto readUntil = [&](const std::string& text) {
+    while (answers.find(text) == std::string::npos) {
+      const auto got = recv(client.fd().get(), piece.data(), piece.size(), 0);
+      if (got <= 0) return false;
+      answers.append(piece.data(), static_cast<size_t>(got));
+    }
+    return true;
+  };
+  EXPECT_TRUE(
+      readUntil("UploadFile names the descriptor by the index 1; one came with the message, and its "
+                "index is 0"))
+      << answers;
+  EXPECT_TRUE(client.write(call.substr(call.size() - 2, 1)));
+  EXPECT_TRUE(client.write(call.substr(call.size() - 1)));
+  EXPECT_TRUE(readUntil("by the index 16777216;")) << answers;
+  EXPECT_EQ(service.session()->count(), 0U);
+  EXPECT_TRUE(client.writeWith(upload(0), file.get()));
+  EXPECT_TRUE(eventually([&] { return service.session()->count() == 1; }));
+}
+
 // The bus library would leave it open, with nobody to close it.
 TEST_F(IpcFilesTest, TheDescriptorOfAMalformedMessageIsClosed) {
   onFile([](ClientFile&) {});

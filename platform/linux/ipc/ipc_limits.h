@@ -18,8 +18,10 @@ struct IpcLimits {
   // others wait for their turn.
   size_t largeMessage = size_t{64} << 10U;
   size_t largeBytesAtWork = size_t{4} << 20U;
-  // Of log data for its turn, while the server does not answer for that which came before.
-  std::chrono::milliseconds waitForLogData{60'000};
+  // Of a large message for its turn; and of one that may wait for a server, such as log data, while that does
+  // not answer for those which came before. After that it is refused.
+  std::chrono::milliseconds waitForMessages{30'000};
+  std::chrono::milliseconds waitForUploads{60'000};
   // From accepting to the end of the authentication.
   std::chrono::milliseconds authentication{10'000};
   // From the peer's end of sending to the end of the connection.

@@ -69,9 +69,36 @@ TEST(IpcLargeMessagesTest, WhatASessionKeepsIsBounded) {
   EXPECT_THAT(client.errorText, HasSubstr("what a session keeps may have 65536 bytes, not 70"));
   EXPECT_EQ(client.call("FetchStates", "aa{sv}", 1, 1, "k", "s", text.c_str()), nullptr);
   EXPECT_THAT(client.errorText, HasSubstr("what a session keeps may have 65536 bytes, not 70"));
-  EXPECT_TRUE(service.logged("FetchStates of pid "));
+  // Told once of each connection.
+  EXPECT_TRUE(service.logged("SetSessionInfo of pid "));
+  EXPECT_FALSE(service.logged("FetchStates of pid "));
   EXPECT_EQ(service.session()->count(), 0U);
   EXPECT_NE(client.call("SetSessionInfo", "aa{sv}aa{sv}aavb", 1, 1, "k", "s", "x", 0, 0, 0), nullptr);
+}
+
+TEST(IpcLargeMessagesTest, WhatASingleMessageLeavesWithTheSessionIsBounded) {
+  Service service;
+  service.start();
+  BusClient client(service.path());
+  // As much for each of session info, user info and payload.
+  const auto send = [&client](size_t sessionInfo, size_t userInfo, size_t payload) {
+    const auto text = [](size_t bytes) { return std::string(bytes, 'x'); };
+    return client.call("SendSingleMessage", "aa{sv}aa{sv}qqaa{sv}", 1, 1, "k", "s", text(sessionInfo).c_str(),
+                       1, 1, "k", "s", text(userInfo).c_str(), 1, 2, 1, 1, "k", "s",
+                       text(payload).c_str()) != nullptr;
+  };
+  // Beside the texts, 49 bytes are counted for each.
+  EXPECT_TRUE(send(30'000, 65'536 - 98 - 30'000, 900'000)) << client.errorText;
+  EXPECT_EQ(service.session()->count(), 1U);
+  EXPECT_FALSE(send(30'000, 65'537 - 98 - 30'000, 1));
+  EXPECT_EQ(client.errorName, wire::kErrorTooLarge);
+  EXPECT_EQ(client.errorText,
+            "what a session keeps may have 65536 bytes, and session info and user info take about 65537");
+  EXPECT_FALSE(send(1'000'000, 1, 1));
+  EXPECT_FALSE(send(1, 1'000'000, 1));
+  EXPECT_EQ(service.session()->count(), 1U);
+  EXPECT_TRUE(send(1, 1, 1'000'000));
+  EXPECT_EQ(service.log().startingWith("IpcConnection: SendSingleMessage of ").size(), 1U);
 }
 
 TEST(IpcLargeMessagesTest, AFileURLIsNoLongerThanAPathMayBe) {
@@ -86,45 +113,148 @@ TEST(IpcLargeMessagesTest, AFileURLIsNoLongerThanAPathMayBe) {
   EXPECT_EQ(service.session()->count(), 1U);
 }
 
-TEST(IpcLargeMessagesTest, LogDataBehindAServerThatHangsIsRefusedInTheEnd) {
-  IpcLimits limits;
-  limits.largeBytesAtWork = 100'000;
-  limits.waitForLogData = std::chrono::milliseconds(20);
-  Service service(limits);
-  std::promise<void> begun;
-  std::promise<void> mayReturn;
-  std::atomic<int> uploads{0};
-  service.prepare = [&](RecordingSession& session) {
-    session.onCall = [&](const std::string& call) {
-      if (!call.starts_with("uploadLogData") || uploads++ > 0) return;
-      begun.set_value();
-      mayReturn.get_future().wait();
+// The first large call of one kind hangs until it is told to go on.
+class HangingCallTest : public ::testing::Test {
+ protected:
+  void TearDown() override { goOn(); }
+  Service& make(const IpcLimits& limits) {
+    service_ = std::make_unique<Service>(limits);
+    return *service_;
+  }
+  void hangIn(const std::string& operation) {
+    service_->prepare = [this, operation](RecordingSession& session) {
+      session.onCall = [this, operation](const std::string& call) {
+        if (!call.starts_with(operation) || isHanging_.exchange(true)) return;
+        begun_.set_value();
+        mayReturn_.get_future().wait();
+      };
     };
-  };
-  service.start();
-  const std::string text(kLargeText, 'x');
-  BusClient stuck(service.path());
-  auto upload = stuck.newCall("UploadLogData");
-  ASSERT_GE(sd_bus_message_append(upload.get(), "av", 1, "s", text.c_str()), 0);
-  ASSERT_GE(stuck.post(upload), 0);
-  ASSERT_GE(sd_bus_flush(stuck.bus()), 0);
-  begun.get_future().wait();
+    service_->start();
+    stuck_ = std::make_unique<BusClient>(service_->path());
+  }
+  template <class... Arguments>
+  void post(const char* member, const char* signature, Arguments... arguments) {
+    auto call = stuck_->newCall(member);
+    ASSERT_GE(sd_bus_message_append(call.get(), signature, arguments...), 0);
+    ASSERT_GE(stuck_->post(call), 0);
+    ASSERT_GE(sd_bus_flush(stuck_->bus()), 0);
+    begun_.get_future().wait();
+  }
+  void goOn() {
+    if (isHanging_ && !std::exchange(isTold_, true)) mayReturn_.set_value();
+  }
+  BusMessage upload(BusClient& client) { return client.call("UploadLogData", "av", 1, "s", text.c_str()); }
+  BusMessage sendMessage(BusClient& client) {
+    return client.call("SendMessage", "qqaa{sv}", 1, 2, 1, 1, "k", "s", text.c_str());
+  }
+  BusMessage sendSingle(BusClient& client) {
+    return client.call("SendSingleMessage", "aa{sv}aa{sv}qqaa{sv}", 0, 0, 1, 2, 1, 1, "k", "s", text.c_str());
+  }
+  size_t refusalsLogged() const {
+    size_t count = 0;
+    for (const auto& line : service_->log().lines()) {
+      if (line.text.find(
+              "found no room among the large calls of its user: at most 100000 bytes are under way") !=
+          std::string::npos) {
+        ++count;
+      }
+    }
+    return count;
+  }
+  static IpcLimits limits() {
+    IpcLimits limits;
+    limits.largeBytesAtWork = 100'000;
+    return limits;
+  }
+
+  const std::string text = std::string(kLargeText, 'x');
+
+ private:
+  std::atomic<bool> isHanging_{false};
+  bool isTold_ = false;
+  std::promise<void> begun_;
+  std::promise<void> mayReturn_;
+  std::unique_ptr<Service> service_;
+  std::unique_ptr<BusClient> stuck_;
+};
+
+constexpr char kNoRoom[] =
+    "the large calls of this user that are under way leave no room for more; try again later";
+
+TEST_F(HangingCallTest, LogDataBehindAServerThatHangsIsRefusedInTheEnd) {
+  auto limits = HangingCallTest::limits();
+  limits.waitForUploads = std::chrono::milliseconds(20);
+  Service& service = make(limits);
+  hangIn("uploadLogData");
+  post("UploadLogData", "av", 1, "s", text.c_str());
   BusClient other(service.path());
-  EXPECT_EQ(other.call("UploadLogData", "av", 1, "s", text.c_str()), nullptr);
-  EXPECT_EQ(other.errorText,
-            "the log data of this user that is under way leaves no room for more; try again later");
-  EXPECT_TRUE(service.logged("found no room among that of its user: at most 100000 bytes are under way"));
+  // Twice, and told once. Another call that may wait for a server is one of them.
+  EXPECT_EQ(upload(other), nullptr);
+  EXPECT_EQ(other.errorText, kNoRoom);
+  EXPECT_EQ(sendSingle(other), nullptr);
+  EXPECT_EQ(other.errorText, kNoRoom);
+  EXPECT_EQ(refusalsLogged(), 1U);
   // Messages, and small log data, do not wait for it.
-  EXPECT_NE(other.call("SendMessage", "qqaa{sv}", 1, 2, 1, 1, "k", "s", text.c_str()), nullptr);
+  EXPECT_NE(sendMessage(other), nullptr);
   EXPECT_NE(other.call("UploadLogData", "av", 1, "s", "x"), nullptr);
-  mayReturn.set_value();
-  EXPECT_TRUE(eventually([&] { return other.call("UploadLogData", "av", 1, "s", text.c_str()) != nullptr; }));
+  goOn();
+  EXPECT_TRUE(eventually([&] { return upload(other) != nullptr; }));
 }
 
-TEST(IpcLargeMessagesTest, LargeMessagesOfManyClientsAllArrive) {
+TEST_F(HangingCallTest, MessagesBehindAnAdaptorThatHangsAreRefusedInTheEnd) {
+  auto limits = HangingCallTest::limits();
+  limits.waitForMessages = std::chrono::milliseconds(20);
+  Service& service = make(limits);
+  hangIn("send");
+  post("SendMessage", "qqaa{sv}", 1, 2, 1, 1, "k", "s", text.c_str());
+  BusClient other(service.path());
+  EXPECT_EQ(sendMessage(other), nullptr);
+  EXPECT_EQ(other.errorName, wire::kErrorFailed);
+  EXPECT_EQ(other.errorText, kNoRoom);
+  // By its name only: the library reads this one.
+  EXPECT_EQ(other.call("FlushMessages", "s", text.c_str()), nullptr);
+  EXPECT_EQ(other.errorText, kNoRoom);
+  EXPECT_EQ(refusalsLogged(), 1U);
+  // What is small, and what waits for servers anyway, goes on.
+  EXPECT_NE(other.call("SendMessage", "qqaa{sv}", 1, 2, 0), nullptr) << other.errorText;
+  EXPECT_NE(upload(other), nullptr);
+  EXPECT_NE(sendSingle(other), nullptr);
+  goOn();
+  EXPECT_TRUE(eventually([&] { return sendMessage(other) != nullptr; }));
+}
+
+TEST_F(HangingCallTest, WhoWaitsForItsTurnDoesNotKeepTheDaemonFromEnding) {
+  auto limits = HangingCallTest::limits();
+  limits.waitForMessages = std::chrono::minutes(10);
+  Service& service = make(limits);
+  hangIn("send");
+  post("SendMessage", "qqaa{sv}", 1, 2, 1, 1, "k", "s", text.c_str());
+  BusClient other(service.path());
+  EXPECT_NE(other.call("StartConfig", ""), nullptr);
+  std::thread ending([&service] { service.stop(); });
+  EXPECT_EQ(sendMessage(other), nullptr);
+  EXPECT_EQ(other.errorText.find("timed out"), std::string::npos) << other.errorText;
+  EXPECT_EQ(service.callsLeftBehind, 0U);
+  goOn();
+  ending.join();
+  EXPECT_EQ(service.callsLeftBehind, 0U);
+}
+
+TEST(IpcLargeMessagesTest, LargeMessagesOfManyClientsAllArriveOneAfterTheOther) {
   IpcLimits limits;
-  limits.largeBytesAtWork = 1;  // one after the other
+  limits.largeBytesAtWork = 1;
   Service service(limits);
+  std::atomic<int> atWork{0};
+  std::atomic<int> most{0};
+  service.prepare = [&atWork, &most](RecordingSession& session) {
+    session.onCall = [&atWork, &most](const std::string&) {
+      const int now = ++atWork;
+      if (now > most) most = now;
+      // Long enough that others would come meanwhile.
+      for (int i = 0; i < 300; ++i) std::this_thread::yield();
+      --atWork;
+    };
+  };
   service.start();
   const std::string text(kLargeText, 'x');
   std::vector<std::thread> clients;
@@ -137,6 +267,7 @@ TEST(IpcLargeMessagesTest, LargeMessagesOfManyClientsAllArrive) {
     });
   }
   for (auto& client : clients) client.join();
+  EXPECT_EQ(most, 1);
 }
 
 TEST(IpcQueueTest, AClientThatNeverReadsItsCallsIsDropped) {

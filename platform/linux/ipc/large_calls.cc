@@ -4,37 +4,92 @@
 
 namespace tarnel {
 
+void LargeCalls::trimHeap() {
+  ::malloc_trim(0);
+}
+
 std::optional<LargeCalls::Place> LargeCalls::enter(uint32_t uid, Kind kind, size_t bytes,
-                                                   std::optional<std::chrono::milliseconds> limit) {
+                                                   std::chrono::milliseconds limit) {
   const Place::Key key{uid, kind};
   std::unique_lock lock(mutex_);
-  const auto hasRoom = [this, key, bytes] {
-    const auto found = atWork_.find(key);
-    return found == atWork_.end() || found->second + bytes <= bytesAtWork_;
-  };
-  if (!limit) {
-    changed_.wait(lock, hasRoom);
-  } else if (!changed_.wait_for(lock, *limit, hasRoom)) {
-    return std::nullopt;
+  if (stopped_) return std::nullopt;
+  Line& line = lines_[key];
+  if (line.waiting.empty() && fits(line, bytes)) {
+    line.atWork += bytes;
+    return Place(*this, key, bytes);
   }
-  atWork_[key] += bytes;
-  return Place(*this, key, bytes);
+  Waiting self(bytes);
+  const auto place = line.waiting.insert(line.waiting.end(), &self);
+  self.changed.wait_for(lock, limit, [this, &self] { return self.entered || stopped_; });
+  if (self.entered) return Place(*this, key, bytes);
+  line.waiting.erase(place);
+  // Those behind it may be smaller.
+  admitWaiting(line);
+  removeIfUnused(key);
+  return std::nullopt;
+}
+
+void LargeCalls::stop() {
+  const std::lock_guard lock(mutex_);
+  stopped_ = true;
+  for (auto& [key, line] : lines_) {
+    for (auto* waiting : line.waiting) waiting->changed.notify_one();
+  }
+}
+
+bool LargeCalls::stopped() const {
+  const std::lock_guard lock(mutex_);
+  return stopped_;
+}
+
+size_t LargeCalls::waiting(uint32_t uid, Kind kind) const {
+  const std::lock_guard lock(mutex_);
+  const auto found = lines_.find({uid, kind});
+  return found == lines_.end() ? 0 : found->second.waiting.size();
+}
+
+bool LargeCalls::fits(const Line& line, size_t bytes) const {
+  return line.atWork == 0 || line.atWork + bytes <= bytesAtWork_;
+}
+
+void LargeCalls::admitWaiting(Line& line) {
+  while (!stopped_ && !line.waiting.empty() && fits(line, line.waiting.front()->bytes)) {
+    Waiting& first = *line.waiting.front();
+    line.waiting.pop_front();
+    line.atWork += first.bytes;
+    first.entered = true;
+    first.changed.notify_one();
+  }
+}
+
+void LargeCalls::removeIfUnused(Place::Key key) {
+  const auto found = lines_.find(key);
+  if (found->second.atWork == 0 && found->second.waiting.empty()) lines_.erase(found);
+}
+
+// What was decoded is kept by the C library, for every thread anew. Not while others are at work, nor often:
+// meanwhile nobody gets memory.
+bool LargeCalls::isTrimDue() {
+  if (!lines_.empty() || leftSinceTrim_ < bytesAtWork_) return false;
+  const auto now = heap_.now();
+  if (lastTrim_ && now - *lastTrim_ < kTrimEvery) return false;
+  lastTrim_ = now;
+  leftSinceTrim_ = 0;
+  return true;
 }
 
 void LargeCalls::leave(Place::Key key, size_t bytes) {
-  bool isTrimDue = false;
+  bool trimNow = false;
   {
     const std::lock_guard lock(mutex_);
-    const auto found = atWork_.find(key);
-    found->second -= bytes;
-    if (found->second == 0) atWork_.erase(found);
+    Line& line = lines_.find(key)->second;
+    line.atWork -= bytes;
     leftSinceTrim_ += bytes;
-    isTrimDue = leftSinceTrim_ >= bytesAtWork_;
-    if (isTrimDue) leftSinceTrim_ = 0;
-    changed_.notify_all();
+    admitWaiting(line);
+    removeIfUnused(key);
+    trimNow = isTrimDue();
   }
-  // The C library keeps what small values took, for every thread anew.
-  if (isTrimDue) ::malloc_trim(0);
+  if (trimNow) heap_.trim();
 }
 
 }  // namespace tarnel

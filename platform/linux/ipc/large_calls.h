@@ -4,6 +4,8 @@
 #include <condition_variable>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
+#include <list>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -13,18 +15,28 @@ namespace tarnel {
 
 // Large messages of one user's clients that are at work at the same time. What is decoded may take ten times
 // the bytes of its message and more, so many clients with large ones would make us hold that for each. Those
-// beyond the bound wait with their message as it came, behind calls of the same user and nobody else's.
+// beyond the bound wait with their message as it came, behind calls of the same user and nobody else's, in
+// the order in which they came, for a limited time.
 //
 // Threads: any.
 class LargeCalls {
  public:
+  using SteadyTime = std::chrono::steady_clock::time_point;
   enum class Kind {
-    prompt,  // returns without waiting for anybody outside
-    upload,  // holds what it was given until a server has answered
+    prompt,  // runs the session's and the adaptors' code, and waits for nobody outside
+    upload,  // may wait for a server until it has answered
   };
+  // What it needs of the process; tests put their own.
+  struct Heap {
+    // Gives what the C library keeps of freed memory back to the system. Stops every thread that allocates.
+    std::function<void()> trim = trimHeap;
+    std::function<SteadyTime()> now = [] { return std::chrono::steady_clock::now(); };
+  };
+  static constexpr std::chrono::seconds kTrimEvery{10};
 
   // bytesAtWork: of each user and kind. A message that is alone may always work.
-  explicit LargeCalls(size_t bytesAtWork) : bytesAtWork_(bytesAtWork) {}
+  explicit LargeCalls(size_t bytesAtWork) : LargeCalls(bytesAtWork, Heap()) {}
+  LargeCalls(size_t bytesAtWork, Heap heap) : bytesAtWork_(bytesAtWork), heap_(std::move(heap)) {}
 
   // Room for one message, given back when destroyed.
   class Place {
@@ -43,19 +55,42 @@ class LargeCalls {
     Key key_;
     size_t bytes_;
   };
-  // Waits for room; without a limit of time until there is some, else nothing when there was none.
-  std::optional<Place> enter(uint32_t uid, Kind kind, size_t bytes,
-                             std::optional<std::chrono::milliseconds> limit = std::nullopt);
+  // Waits at most `limit` for room. Nothing when there was none, or after stop().
+  std::optional<Place> enter(uint32_t uid, Kind kind, size_t bytes, std::chrono::milliseconds limit);
+
+  // Nobody waits any more, and nobody enters.
+  void stop();
+  bool stopped() const;
+  // How many stand in line, for tests.
+  size_t waiting(uint32_t uid, Kind kind) const;
 
  private:
+  struct Waiting {
+    explicit Waiting(size_t size) : bytes(size) {}
+    const size_t bytes;
+    bool entered = false;
+    std::condition_variable changed;
+  };
+  struct Line {
+    size_t atWork = 0;
+    std::list<Waiting*> waiting;  // the first to come is the first to go
+  };
+
+  static void trimHeap();
+  bool fits(const Line& line, size_t bytes) const;
+  void admitWaiting(Line& line);
+  void removeIfUnused(Place::Key key);
+  bool isTrimDue();
   void leave(Place::Key key, size_t bytes);
 
   const size_t bytesAtWork_;
-  std::mutex mutex_;
-  std::condition_variable changed_;
+  const Heap heap_;
+  mutable std::mutex mutex_;
   // All below guarded by mutex_.
-  std::map<Place::Key, size_t> atWork_;
+  std::map<Place::Key, Line> lines_;
   size_t leftSinceTrim_ = 0;
+  std::optional<SteadyTime> lastTrim_;
+  bool stopped_ = false;
 };
 
 }  // namespace tarnel

@@ -9,6 +9,7 @@
 
 #include "platform/ipc/dbus_codec.h"
 #include "platform/ipc/wire.h"
+#include "platform/ipc/wire_size.h"
 #include "platform/linux/ipc/connection_loop.h"
 #include "platform/linux/ipc/message_batch.h"
 #include "platform/linux/ipc/send_call.h"
@@ -166,6 +167,11 @@ MaybeError uploadFile(const SessionCall& call) {
         "it; not " +
             std::to_string(call.descriptors.size()));
   }
+  if (call.descriptorIndex != 0) {
+    return Error(wire::kErrorInvalidArguments, -1,
+                 "UploadFile names the descriptor by the index " + std::to_string(call.descriptorIndex) +
+                     "; one came with the message, and its index is 0");
+  }
   if (sd_bus_message_read(call.message, "s", &fileURL) < 0) {
     return Error(wire::kErrorInvalidArguments, -1, "the file's URL cannot be read");
   }
@@ -185,6 +191,13 @@ MaybeError sendSingleMessage(const SessionCall& call) {
   if (!sessionInfo) return sessionInfo.error();
   auto userInfo = wire::readMaybeDictionary(call.message);
   if (!userInfo) return userInfo.error();
+  // Unlike the payload, these stay with the session.
+  const size_t kept = wire::approximateSize(*sessionInfo) + wire::approximateSize(*userInfo);
+  if (kept > wire::kMaxKeptBytes) {
+    return Error(wire::kErrorTooLarge, -1,
+                 "what a session keeps may have " + std::to_string(wire::kMaxKeptBytes) +
+                     " bytes, and session info and user info take about " + std::to_string(kept));
+  }
   uint16_t category = 0;
   uint16_t type = 0;
   sd_bus_message_read_basic(call.message, 'q', &category);

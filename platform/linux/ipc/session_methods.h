@@ -29,6 +29,7 @@ struct SessionCall {
   ClientFileRegistry* clientFiles;       // null: none are taken
   uint32_t uid;                          // the client's user
   std::span<UniqueFd> descriptors = {};  // that came with it; a method takes them by moving
+  uint32_t descriptorIndex = 0;          // if there are any: which of them the last argument names
 };
 
 // Decodes the arguments and calls the session's operation; its reply answers the call, from any thread.
