@@ -51,16 +51,18 @@ class Uploads {
   };
   // Waits for room, at most limits().waitForRoom; nothing when there was none, or after stop(). The owner is
   // the user whose file it is.
-  std::optional<Place> enter(uint64_t bytes, uint32_t owner = 0);
+  std::optional<Place> enter(uint64_t bytes, uint32_t owner);
 
   // Uploads that wait for room.
   size_t waiting() const;
 
-  // Holds the calling thread until the request has ended or the uploads are stopped, which gives an error
-  // with kHttpClientGoingAway. Never call it on the client's thread.
+  // Starts the request and holds the calling thread until it has ended or the uploads are stopped, which
+  // gives an error with kHttpClientGoingAway; after that nothing is started any more. Never call it on the
+  // client's thread.
   HttpResult perform(HttpClient& http, HttpRequest request);
 
-  // The process is about to end: every wait here ends at once, now and later. Requests go on by themselves.
+  // The process is about to end: every wait here ends at once, now and later. Requests that were started go
+  // on by themselves.
   void stop();
 
  private:

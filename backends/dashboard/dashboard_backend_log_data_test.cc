@@ -199,5 +199,16 @@ TEST_F(DashboardBackendLogDataTest, EndOfTheDaemonEndsAWaitThatHangs) {
   EXPECT_EQ(EventNumberOf::of(*backend), 0);
 }
 
+TEST_F(DashboardBackendLogDataTest, WhileTheDaemonEndsNothingIsPosted) {
+  const auto backend = makeUploading();
+  world.uploads.stop();
+  EXPECT_FALSE(backend->uploadLogData(records));
+  EXPECT_TRUE(world.http.requests().empty());
+  expectLog(
+      LogLevel::error,
+      "DashboardBackend(uploadLogData): Error uploading log data array (TarnelHTTPErrorDomain (-1): the "
+      "daemon ends)");
+}
+
 }  // namespace
 }  // namespace tarnel

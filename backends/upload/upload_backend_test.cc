@@ -189,7 +189,7 @@ TEST_F(UploadBackendTest, RoomComesBackHoweverTheUploadEnds) {
   for (int i = 0; i < 3; ++i) EXPECT_TRUE(make(profile)->uploadFileAtPath("/x", "t"));
   world.clientFiles.files["t"].readError = Error(kClientFileErrorDomain, 5, "broken");
   for (int i = 0; i < 3; ++i) EXPECT_FALSE(make(profile)->uploadFileAtPath("/x", "t"));
-  EXPECT_TRUE(world.uploads.enter(most));
+  EXPECT_TRUE(world.uploads.enter(most, 0));
 }
 
 TEST_F(UploadBackendTest, AReplyThatSaysSuccessDeletesTheFile) {
