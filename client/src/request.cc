@@ -5,6 +5,7 @@
 #include <string_view>
 
 #include "platform/ipc/wire.h"
+#include "platform/ipc/wire_size.h"
 
 namespace tarnel::core {
 namespace {
@@ -206,6 +207,16 @@ Outcome measure(Request& request) {
     return failure(TARNEL_ERROR_TOO_LARGE, "the call takes " + std::to_string(request.bytes) +
                                                " bytes; the daemon takes at most " + std::to_string(most) +
                                                ": send less at once");
+  }
+  if (request.kind == Request::Kind::sendSingleMessage) {
+    // Counted as the daemon does.
+    const size_t kept = wire::approximateSize(request.sessionInfo) + wire::approximateSize(request.userInfo);
+    if (kept > wire::kMaxKeptBytes) {
+      return failure(TARNEL_ERROR_TOO_LARGE, "session info and user info take about " + std::to_string(kept) +
+                                                 " bytes; the daemon takes at most " +
+                                                 std::to_string(wire::kMaxKeptBytes) +
+                                                 ": put what is large into the payload");
+    }
   }
   return {};
 }

@@ -134,6 +134,15 @@ TEST_F(SessionTest, RefusesWhatTheDaemonWouldNotTakeBeforeSendingIt) {
   EXPECT_THAT(tooMuchInfo.message, HasSubstr("the daemon takes at most 65536"));
   EXPECT_EQ(session.fetchStatesAndWait(info, kLong).status.code, TARNEL_ERROR_TOO_LARGE);
 
+  // The same of a single message, whose payload does not count.
+  const auto half = Dictionary().set("s", std::string(1U << 15U, 'x'));
+  const auto tooMuchOfBoth = session.sendSingleMessage(half, half, 1, 1, {}, nullptr);
+  EXPECT_EQ(tooMuchOfBoth.code, TARNEL_ERROR_TOO_LARGE);
+  EXPECT_EQ(tooMuchOfBoth.message,
+            "session info and user info take about 65634 bytes; the daemon takes at most 65536: put what is "
+            "large into the payload");
+  EXPECT_EQ(session.sendSingleMessage({}, info, 1, 1, {}, nullptr).code, TARNEL_ERROR_TOO_LARGE);
+
   const auto notText = session.sendMessage(1, 1, Dictionary().set("bad", "\xC3("));
   EXPECT_EQ(notText.code, TARNEL_ERROR_INVALID_ARGUMENT);
   EXPECT_EQ(notText.message, "this cannot be sent: at key \"bad\": the text is not UTF-8");
@@ -143,6 +152,15 @@ TEST_F(SessionTest, RefusesWhatTheDaemonWouldNotTakeBeforeSendingIt) {
 
   EXPECT_TRUE(session.drain(kLong));
   EXPECT_TRUE(daemon_.received().empty());
+}
+
+TEST_F(SessionTest, ASingleMessagesPayloadIsNotHeldToWhatASessionKeeps) {
+  Session session(options());
+  const auto info = Dictionary().set("s", std::string(30'000, 'x'));
+  const auto payload = Dictionary().set("s", std::string(500'000, 'x'));
+  EXPECT_TRUE(session.sendSingleMessage(info, info, 1, 1, payload, nullptr));
+  ASSERT_TRUE(session.drain(kLong));
+  EXPECT_EQ(daemon_.received().size(), 1U);
 }
 
 TEST_F(SessionTest, TheLargestCallThatIsAcceptedArrives) {
