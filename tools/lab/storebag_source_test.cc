@@ -67,6 +67,16 @@ TEST_F(StorebagSourceTest, ThePortForDatagramsIsANumber) {
   EXPECT_EQ(*innerOf(lookup.storebag->outer), Value(Dictionary{{"port", 9}, {"again", 9}}));
 }
 
+TEST_F(StorebagSourceTest, TheExamplesAreSoundAsTheyAreServed) {
+  for (const char* name : {"brevan", "moldaro", "quintar"}) {
+    std::filesystem::copy_file(std::string(TARNEL_EXAMPLES_DIRECTORY "/storebags/") + name + ".json",
+                               folder_ + "/" + name + ".json");
+    const StorebagSource::Lookup lookup = source_.find(name);
+    ASSERT_TRUE(lookup.storebag) << lookup.error;
+    EXPECT_THAT(lookup.storebag->findings, IsEmpty()) << name;
+  }
+}
+
 TEST_F(StorebagSourceTest, TheBrokenOneFailsAtItsSignatureOnly) {
   put("a", "{\"version\": \"1\"}");
   const Result<Value> inner = innerOf(source_.find("a").storebag->brokenOuter);

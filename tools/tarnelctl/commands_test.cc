@@ -161,6 +161,16 @@ TEST_F(CommandTest, StorebagsAreMadeSignedVerifiedAndShown) {
   }
 }
 
+TEST_F(CommandTest, ThePlaceholderForAPortIsNamedBeforeTheDocumentFailsAtIt) {
+  std::ofstream(path("bag.json")) << "{\"port\": {{LAB_DATAGRAM_PORT}}}";
+  EXPECT_EQ(signStorebag({.input = path("bag.json"), .key = path("none")}, terminal_), ExitStatus::failed);
+  EXPECT_TRUE(err().starts_with(
+      "warning: {{LAB_DATAGRAM_PORT}}: only tarnel-lab puts a port there, as it serves a plain document: "
+      "write the port of your server\ntarnelctl: " +
+      path("bag.json") + ": "))
+      << err();
+}
+
 TEST_F(CommandTest, AForeignKeyDoesNotVerify) {
   ASSERT_EQ(makeStorebagKey({.output = path("a"), .bits = 2048}, terminal_), ExitStatus::ok);
   ASSERT_EQ(makeStorebagKey({.output = path("b"), .bits = 2048}, terminal_), ExitStatus::ok);

@@ -2,6 +2,7 @@
 
 #include <optional>
 #include <ostream>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -54,6 +55,18 @@ std::optional<std::string> read(const std::string& path, const Terminal& termina
   if (bytes) return *std::move(bytes);
   fail(terminal, bytes.error().localizedDescription());
   return std::nullopt;
+}
+
+void warnOfPlaceholders(std::string_view document, const Terminal& terminal) {
+  if (document.find("{{LAB_URL}}") != std::string_view::npos) {
+    terminal.err
+        << "warning: {{LAB_URL}}: only tarnel-lab puts an address there, as it serves a plain document: name "
+           "your server (storebag new --server)\n";
+  }
+  if (document.find("{{LAB_DATAGRAM_PORT}}") != std::string_view::npos) {
+    terminal.err << "warning: {{LAB_DATAGRAM_PORT}}: only tarnel-lab puts a port there, as it serves a plain "
+                    "document: write the port of your server\n";
+  }
 }
 
 // From a DER file, or from the publicKey.der of a bundle folder.
@@ -121,14 +134,10 @@ ExitStatus newStorebag(const StorebagOptions& options, const Terminal& terminal)
 ExitStatus signStorebag(const StorebagOptions& options, const Terminal& terminal) {
   const auto bytes = read(options.input, terminal);
   if (!bytes) return ExitStatus::failed;
+  warnOfPlaceholders(*bytes, terminal);
   const auto inner = parseDocument(*bytes);
   if (!inner) return fail(terminal, options.input + ": " + inner.error().localizedDescription());
   if (isSigned(*inner)) return fail(terminal, options.input + " is signed already: sign its inner document");
-  if (bytes->find("{{LAB_URL}}") != std::string::npos) {
-    terminal.err
-        << "warning: {{LAB_URL}}: only tarnel-lab puts an address there, as it serves a plain document: name "
-           "your server (storebag new --server)\n";
-  }
   if (report(*inner, terminal) && !options.force) {
     return fail(terminal, "not signed: mend the errors, or --force to sign it as it is");
   }
