@@ -52,7 +52,8 @@ std::string InputReader::line() {
 }
 
 std::string InputReader::shortText() {
-  const auto length = std::min<size_t>(byte(), rest_.size());
+  const size_t announced = byte();
+  const size_t length = std::min(announced, rest_.size());
   const auto text = asText(rest_.first(length));
   rest_ = rest_.subspan(length);
   return std::string(text);

@@ -13,6 +13,8 @@ namespace {
 
 // Fits, with its answers, into what a socket holds while nobody reads.
 constexpr size_t kLongestInput = 8192;
+// Small, so that some are large.
+constexpr size_t kLargeMessage = 256;
 constexpr std::string_view kAuthentication = "\0AUTH ANONYMOUS\r\nNEGOTIATE_UNIX_FD\r\nBEGIN\r\n"sv;
 
 // Stands before the session: things happen between the client's calls, and their replies are watched.
@@ -121,8 +123,16 @@ std::string readFrames(InputReader& input) {
   return stream;
 }
 
-void examineAnswers(const SessionWorld& world, const std::string& answers) {
+// Whole messages in what a client writes, as those see it who bound them.
+uint64_t messagesIn(std::string_view stream) {
+  InputFramer framer(wire::kMaxMessageBytes);
+  framer.admit(stream);
+  return framer.completed();
+}
+
+void examineAnswers(const SessionWorld& world, const std::string& answers, uint64_t framed) {
   const auto counts = countMessages(answers);
+  require(counts.returns + counts.errors <= framed, "nothing is answered that was not seen as a message");
   if (counts.returns > 0) reached("bytes: answered");
   if (counts.errors > 0) reached("bytes: answered with an error");
   if (world.fakes.log.startingWith("IpcConnection: Closing").size() > 0) reached("bytes: closed");
@@ -150,6 +160,7 @@ void runBytes(SessionWorld& world, InputReader& input, bool isFramed) {
   IpcLimits limits;
   limits.interruption = std::chrono::milliseconds(0);
   limits.unansweredCalls = kLongestInput;
+  limits.largeMessage = kLargeMessage;
   {
     const auto link = std::make_shared<ConnectionLink>(limits.queuedBytes);
     LargeCalls largeCalls(limits.largeBytesAtWork);
@@ -169,7 +180,7 @@ void runBytes(SessionWorld& world, InputReader& input, bool isFramed) {
     require(link->closed(), "the end of a connection closes its link");
   }
   client.drain();
-  examineAnswers(world, client.received());
+  examineAnswers(world, client.received(), messagesIn(stream));
   connection->invalidate();
 }
 
