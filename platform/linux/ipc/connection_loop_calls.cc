@@ -145,8 +145,9 @@ void ConnectionLoop::runCall(sd_bus_message* message, Run run) {
   try {
     if (const MaybeError error = run(call)) {
       current_ = nullptr;
-      if (error->domain() == wire::kErrorTooLarge)
+      if (error->domain() == wire::kErrorTooLarge) {
         return refuseTooLarge(message, error->localizedDescription());
+      }
       refuse(message, error->domain().c_str(), error->localizedDescription());
     }
   } catch (const std::exception& error) {
