@@ -178,13 +178,17 @@ void LinuxWorld::setUtilityQualityOfService() {
 }
 
 Log& LinuxWorld::startLogging(const char* processName, const char* facility) {
-  ::signal(SIGPIPE, SIG_IGN);
-  returnLargeBlocks();
   log_ = TarnelLogging::startLogging(processName, facility);
   return *log_;
 }
 
 void LinuxWorld::prepareForConfinement() {
+  // Both are the whole process's: they are set while it has one thread, before anything writes to a peer that
+  // may be gone or takes memory that would be kept.
+  ::signal(SIGPIPE, SIG_IGN);
+  if (!returnLargeBlocks()) {
+    TARNEL_LOG(*log_, warning, "main: this C library keeps large blocks of memory that were freed");
+  }
   raiseDescriptorLimit();
   preloadLazyFacilities();
   prepared_ = std::make_unique<Prepared>(log_);

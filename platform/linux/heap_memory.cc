@@ -4,11 +4,14 @@
 
 namespace tarnel {
 
-void returnLargeBlocks() {
-#ifdef M_MMAP_THRESHOLD
-  // What the C library begins with; setting it keeps it from growing with the blocks that are freed.
-  constexpr int kLargeBlockBytes = 128 << 10;
-  ::mallopt(M_MMAP_THRESHOLD, kLargeBlockBytes);
+bool returnLargeBlocks() {
+#if defined(M_MMAP_THRESHOLD) && defined(M_TRIM_THRESHOLD)
+  // Setting one of the two also ends the growth of the other. Left at what the library begins with, 128 KiB,
+  // the second would have the heap shrink after every batch of events and grow again with the next one.
+  constexpr int kTopBytes = 8 << 20;
+  return ::mallopt(M_MMAP_THRESHOLD, kLargeBlockBytes) != 0 && ::mallopt(M_TRIM_THRESHOLD, kTopBytes) != 0;
+#else
+  return false;
 #endif
 }
 

@@ -185,7 +185,8 @@ TEST_F(UploadTest, AnUploadThatHangsDelaysNobodyElse) {
   EXPECT_TRUE(exists(path));
 }
 
-// What is under way at the same time is bounded; the others take turns, and none is lost.
+// What is under way at the same time is bounded; the others take turns, and none is lost. Each file is a
+// block that the C library gives back when it is freed: without that, every thread would keep two of them.
 TEST_F(UploadTest, ManyLargeUploadsTakeTurnsInBoundedMemory) {
   constexpr size_t kMiB = size_t{1} << 20U;
   constexpr size_t kUploads = 8;
@@ -198,10 +199,10 @@ TEST_F(UploadTest, ManyLargeUploadsTakeTurnsInBoundedMemory) {
     return httpAnswer("200 OK", "success");
   }));
   serve(server.url("/up"));
-  instance.setConfiguration("[limits]\nmax_upload_bytes = 4194304\n[http]\nmax_queued_bytes = 8388608\n");
+  instance.setConfiguration("[limits]\nmax_upload_bytes = 6291456\n[http]\nmax_queued_bytes = 12582912\n");
   ASSERT_TRUE(instance.start());
   std::mt19937 random(1);
-  std::string contents(3 * kMiB, '\0');
+  std::string contents(5 * kMiB, '\0');
   std::generate(contents.begin(), contents.end(), [&random] { return static_cast<char>(random()); });
   std::vector<std::unique_ptr<TestSession>> sessions;
   std::vector<std::future<bool>> answers;
@@ -224,7 +225,8 @@ TEST_F(UploadTest, ManyLargeUploadsTakeTurnsInBoundedMemory) {
   for (auto& answer : answers) EXPECT_TRUE(answer.get());
   EXPECT_EQ(posts, kUploads);
   if (kMemoryIsMeasurable) {
-    EXPECT_LT(peakBytes() - before, 16 * kMiB);
+    // One file and its compressed copy, and as much again for everything else.
+    EXPECT_LT(peakBytes() - before, 4 * contents.size());
   }
 }
 
