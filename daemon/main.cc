@@ -29,17 +29,22 @@ int answerArguments(std::string_view argument) {
   return 2;
 }
 
-}  // namespace
-
-int main(int argc, char** argv) {
-  if (argc > 1) return answerArguments(argv[1]);
+// Catches what is thrown while the world still stands, so that nothing unwinds it.
+int run(tarnel::LinuxWorld& world) {
   try {
-    tarnel::LinuxWorld world;
-    const int status = tarnel::runService(world);
-    if (world.hasCallsLeftBehind()) std::_Exit(status);
-    return status;
+    return tarnel::runService(world);
   } catch (const std::exception& failure) {
     std::fprintf(stderr, "tarneld: cannot go on: %s\n", failure.what());
     return EXIT_FAILURE;
   }
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  if (argc > 1) return answerArguments(argv[1]);
+  tarnel::LinuxWorld world;
+  const int status = run(world);
+  if (world.hasCallsLeftBehind()) std::_Exit(status);
+  return status;
 }
