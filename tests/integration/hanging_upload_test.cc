@@ -12,6 +12,7 @@
 #include "client/include/tarnel/tarnel.h"
 #include "platform/fake/fake_world.h"
 #include "platform/linux/ipc/ipc_test_support.h"
+#include "tests/helpers/waiting.h"
 
 // Uploads from the client library through the IPC service to the upload backend, while the server that should
 // answer hangs.
@@ -21,7 +22,15 @@ namespace {
 
 using fake::FakeHttpClient;
 
-constexpr std::chrono::seconds kLong{30};
+constexpr std::chrono::seconds kLong = test::kDeadline;
+
+// Fails when it does not become true in time.
+template <class Condition>
+void waitUntil(const Condition& condition) {
+  const test::Deadline deadline;
+  while (!condition() && !deadline.passed()) std::this_thread::yield();
+  ASSERT_TRUE(condition());
+}
 
 class HangingUploadTest : public ::testing::Test {
  protected:
@@ -53,7 +62,7 @@ class HangingUploadTest : public ::testing::Test {
     return path;
   }
   void waitForRequests(size_t count) const {
-    while (world.http.pendingCount() < count) std::this_thread::yield();
+    waitUntil([this, count] { return world.http.pendingCount() >= count; });
   }
   static void expectThatMessagesFlow(client::Session& session) {
     for (uint16_t type = 0; type < 200; ++type) {
@@ -124,7 +133,7 @@ TEST_F(HangingUploadTest, AnUploadThatWaitsForRoomDelaysItsOwnSessionAlone) {
   waitForRequests(1);
   client::Session second(options());
   auto secondAnswer = upload(second, write("second", 30));
-  while (uploads.waiting() == 0) std::this_thread::yield();
+  waitUntil([this] { return uploads.waiting() != 0; });
   client::Session other(options());
   expectThatMessagesFlow(other);
   EXPECT_EQ(world.http.pendingCount(), 1U);
