@@ -80,6 +80,27 @@ TEST_F(ProtocolTest, GarbageInsteadOfAHandshake) {
   }
 }
 
+// The bounds hold for messages; what follows a line that ends the authentication for one side only must not
+// get past them.
+TEST_F(ProtocolTest, AnAuthenticationThatOnlySeemsToEndHidesNoLargeMessage) {
+  const std::string authenticated("\0AUTH ANONYMOUS 74\r\n", 20);
+  // The header of a message in which the calls hide.
+  const std::string cover("B\1\0\1\0\x0F\xF0\0\0\0\0\1\0\0\0\0", 16);
+  const std::string large = bytesOf(
+      {.member = "SetSessionInfo", .signature = "aa{sv}aa{sv}aavb", .bodySize = kMaxMessageBytes * 60});
+  const size_t before = instance.logSize();
+  for (const auto& [handshake, why] :
+       {std::pair{authenticated + "NOPE\nBEGIN\r\n" + cover + "\r\nBEGIN\r\n",
+                  "exceeds the limit of 1048576 bytes"},
+        std::pair{std::string("\0BEGIN\r\n", 8) + cover + "\r\nAUTH ANONYMOUS 74\r\nBEGIN\r\n",
+                  "its authentication did not end with BEGIN"}}) {
+    const RawBusClient client(instance.socketPath());
+    client.write(handshake + bytesOf({.member = "StartConfig"}) + large + std::string(2000, '\0'));
+    EXPECT_TRUE(client.isClosedByDaemon());
+    instance.waitForLog(why, before);
+  }
+}
+
 TEST_F(ProtocolTest, GarbageInsteadOfMessages) {
   expectClosedAfter(std::string(100'000, 'x'));
   expectClosedAfter(std::string(100'000, '\0'));
