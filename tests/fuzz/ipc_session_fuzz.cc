@@ -111,11 +111,20 @@ class Callers {
   MaybeDictionary readPayload() { return readMaybeDictionary(input_, SessionWorld::words()); }
 
   void step();
+  void happen();
+  void setInfo(size_t i);
   void start(size_t i);
+  void fetchStates(size_t i);
+  void fetchURL(size_t i);
+  void sendMessage(size_t i);
+  void sendDictionary(size_t i);
+  void flush(size_t i);
+  void finish(size_t i);
   void upload(size_t i);
   void uploadLogData(size_t i);
   void sendSingle(size_t i);
   void sendMany(size_t i);
+  void sendAsChild(size_t i);
   void noteAggregation();
 
   SessionWorld& world_;
@@ -203,83 +212,71 @@ void Callers::noteAggregation() {
   }
 }
 
+void Callers::happen() {
+  const auto pending = world_.replies.pending();
+  world_.happen(input_);
+  if (world_.replies.pending() < pending) reached("a late answer");
+}
+
+void Callers::setInfo(size_t i) {
+  auto info = readSessionInfo();
+  auto user = readUserInfo();
+  auto frameworks =
+      input_.below(2) == 1 ? std::optional(readArray(input_, SessionWorld::words())) : std::nullopt;
+  session(i).setSessionInfo(std::move(info), std::move(user), std::move(frameworks), input_.below(2) == 1);
+}
+
+void Callers::fetchStates(size_t i) {
+  mustAnswer([this, i] {
+    session(i).fetchStatesWithUserInfo(readUserInfo(),
+                                       world_.replies.owe<std::optional<std::vector<std::string>>>());
+  });
+}
+
+void Callers::fetchURL(size_t i) {
+  mustAnswer([this, i] { session(i).fetchDisplayURL(world_.replies.owe<MaybeString>()); });
+}
+
+void Callers::sendMessage(size_t i) {
+  mustAnswer([this, i] {
+    const auto type = static_cast<uint16_t>(input_.below(4));
+    session(i).sendMessageWithCategory(input_.byte(), type, readPayload(),
+                                       world_.replies.owe<MaybeSentObject>());
+  });
+}
+
+void Callers::sendDictionary(size_t i) {
+  mustAnswer([this, i] {
+    session(i).sendMessageWithDictionary(readDictionary(input_, SessionWorld::words()),
+                                         world_.replies.owe<MaybeSentObject>());
+  });
+}
+
+void Callers::flush(size_t i) {
+  session(i).flushMessagesWithCompletion(world_.replies.owe<MaybeString, MaybeError>());
+  if (world_.replies.pending() > 0) reached("a flush waits");
+}
+
+void Callers::finish(size_t i) {
+  mustAnswer([this, i] { session(i).finishSessionWithReply(world_.replies.owe<MaybeSentObject>()); });
+}
+
+void Callers::sendAsChild(size_t i) {
+  session(i).sendMessageWithCategory(2, 2, Dictionary{{"of a child", 1}}, nullptr);
+  noteAggregation();
+}
+
 void Callers::step() {
-  enum Call {
-    happening,
-    info,
-    starting,
-    states,
-    url,
-    message,
-    dictionary,
-    flush,
-    finish,
-    file,
-    logData,
-    single,
-    many,
-    child,
-    end,
-    calls
-  };
-  const auto call = input_.below(calls);
-  if (call == happening) {
-    const auto pending = world_.replies.pending();
-    world_.happen(input_);
-    if (world_.replies.pending() < pending) reached("a late answer");
-    return;
-  }
+  // The corpus knows them by their place; 0 is what happens without a client.
+  constexpr void (Callers::*kCalls[])(size_t) = {
+      &Callers::setInfo,     &Callers::start,          &Callers::fetchStates, &Callers::fetchURL,
+      &Callers::sendMessage, &Callers::sendDictionary, &Callers::flush,       &Callers::finish,
+      &Callers::upload,      &Callers::uploadLogData,  &Callers::sendSingle,  &Callers::sendMany,
+      &Callers::sendAsChild, &Callers::disconnect};
+  const auto call = input_.below(std::size(kCalls) + 1);
+  if (call == 0) return happen();
   const size_t i = input_.below(kMostClients);
-  switch (call) {
-    case info: {
-      auto session = readSessionInfo();
-      auto user = readUserInfo();
-      auto frameworks =
-          input_.below(2) == 1 ? std::optional(readArray(input_, SessionWorld::words())) : std::nullopt;
-      return this->session(i).setSessionInfo(std::move(session), std::move(user), std::move(frameworks),
-                                             input_.below(2) == 1);
-    }
-    case starting:
-      return start(i);
-    case states:
-      return mustAnswer([this, i] {
-        session(i).fetchStatesWithUserInfo(readUserInfo(),
-                                           world_.replies.owe<std::optional<std::vector<std::string>>>());
-      });
-    case url:
-      return mustAnswer([this, i] { session(i).fetchDisplayURL(world_.replies.owe<MaybeString>()); });
-    case message:
-      return mustAnswer([this, i] {
-        const auto type = static_cast<uint16_t>(input_.below(4));
-        session(i).sendMessageWithCategory(input_.byte(), type, readPayload(),
-                                           world_.replies.owe<MaybeSentObject>());
-      });
-    case dictionary:
-      return mustAnswer([this, i] {
-        session(i).sendMessageWithDictionary(readDictionary(input_, SessionWorld::words()),
-                                             world_.replies.owe<MaybeSentObject>());
-      });
-    case flush:
-      session(i).flushMessagesWithCompletion(world_.replies.owe<MaybeString, MaybeError>());
-      if (world_.replies.pending() > 0) reached("a flush waits");
-      return;
-    case finish:
-      return mustAnswer(
-          [this, i] { session(i).finishSessionWithReply(world_.replies.owe<MaybeSentObject>()); });
-    case file:
-      return upload(i);
-    case logData:
-      return uploadLogData(i);
-    case single:
-      return sendSingle(i);
-    case many:
-      return sendMany(i);
-    case child:
-      session(i).sendMessageWithCategory(2, 2, Dictionary{{"of a child", 1}}, nullptr);
-      return noteAggregation();
-    default:
-      disconnect(i);
-  }
+  (this->*kCalls[call - 1])(i);
 }
 
 }  // namespace
