@@ -1,5 +1,7 @@
 #include "session/backend_set.h"
 
+#include <exception>
+
 #include "client/include/tarnel/keys.h"
 #include "util/device_facts.h"
 
@@ -71,6 +73,23 @@ void introduce(TarnelBackend& backend, const Identity& identity, const MaybeDict
 
 }  // namespace
 
+TemporaryBackends::~TemporaryBackends() {
+  for (const auto& [name, backend] : backends_) cleanUp(name, *backend);
+}
+
+void TemporaryBackends::cleanUp(const std::string& name, TarnelBackend& backend) noexcept {
+  const auto report = [this, &name](const char* why) {
+    TARNEL_LOG(log_, error, "%s: %s was not cleaned up in order: %s", operation_, name.c_str(), why);
+  };
+  try {
+    backend.cleanup();
+  } catch (const std::exception& failure) {
+    report(failure.what());
+  } catch (...) {
+    report("unknown failure");
+  }
+}
+
 std::optional<BackendSet> createBackends(const Dependencies& dependencies, const BackendFactory& factory,
                                          const MaybeDictionary& storebag, const MaybeDictionary& sessionInfo,
                                          const MaybeDictionary& userInfo, std::string_view deviceID) {
@@ -83,14 +102,14 @@ std::optional<BackendSet> createBackends(const Dependencies& dependencies, const
     return std::nullopt;
   }
   const Identity identity = readIdentity(dependencies, *sessionInfo);
-  BackendSet backends;
+  TemporaryBackends made(dependencies.log, "createBackends");
   size_t unknown = 0;
   for (const auto& [name, profile] : *storebag) {
     if (!TarnelBackend::isBackendName(name) && ++unknown > kMaxUnknownNames) continue;
     auto backend = factory(dependencies, name, profile, identity.productFamily, identity.clientType);
     if (backend == nullptr) continue;
+    made.append(name, backend);
     introduce(*backend, identity, userInfo, deviceID);
-    backends.append(name, std::move(backend));
   }
   if (unknown > kMaxUnknownNames) {
     TARNEL_LOG(
@@ -98,7 +117,7 @@ std::optional<BackendSet> createBackends(const Dependencies& dependencies, const
         "createBackends: %zu keys of the storebag are no backends, of which only the first %zu are named",
         unknown, kMaxUnknownNames);
   }
-  return backends;
+  return made.release();
 }
 
 }  // namespace tarnel

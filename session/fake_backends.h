@@ -47,6 +47,8 @@ struct BackendScript {
   bool uploads = false;
   bool sendThrows = false;
   bool cleanupThrows = false;
+  bool cleanupThrowsNumber = false;
+  bool setUpThrows = false;
 };
 
 // Keeps what it is given. Like a real one it takes no lock.
@@ -78,6 +80,7 @@ class FakeBackend final : public TarnelBackend {
   void cleanup() override {
     journal_.add(name() + " cleanup");
     if (script_.cleanupThrows) throw std::runtime_error("cleanup went wrong");
+    if (script_.cleanupThrowsNumber) throw 5;
   }
   void updateState() override {
     journal_.add(name() + " updateState");
@@ -87,6 +90,7 @@ class FakeBackend final : public TarnelBackend {
   }
   void setUserInfoDict(const MaybeDictionary& userInfo) override {
     journal_.add(name() + " setUserInfoDict");
+    if (script_.setUpThrows) throw std::runtime_error("set-up went wrong");
     TarnelBackend::setUserInfoDict(userInfo);
   }
   void setCorrelatedSessionID(const MaybeString& correlatedSessionID) override {

@@ -1,7 +1,6 @@
 // Uploads, and single messages with session info of their own.
 
 #include <array>
-#include <exception>
 #include <utility>
 
 #include "client/include/tarnel/keys.h"
@@ -49,31 +48,6 @@ std::string pathOfURL(std::string_view url) {
 bool holds(const MaybeDictionary& dictionary, const char* key) {
   return dictionary && dictionary->contains(key);
 }
-
-// Cleans up every backend at its end, whatever sending or another's clean-up comes to.
-class TemporaryBackends {
- public:
-  TemporaryBackends(BackendSet backends, Log& log) : backends_(std::move(backends)), log_(log) {}
-  TemporaryBackends(const TemporaryBackends&) = delete;
-  TemporaryBackends& operator=(const TemporaryBackends&) = delete;
-  ~TemporaryBackends() {
-    for (const auto& [name, backend] : backends_) cleanUp(name, *backend);
-  }
-  const BackendSet& backends() const noexcept { return backends_; }
-
- private:
-  void cleanUp(const std::string& name, TarnelBackend& backend) noexcept {
-    try {
-      backend.cleanup();
-    } catch (const std::exception& failure) {
-      TARNEL_LOG(log_, error, "sendMessageWithSessionInfo: %s was not cleaned up in order: %s", name.c_str(),
-                 failure.what());
-    }
-  }
-
-  const BackendSet backends_;
-  Log& log_;
-};
 
 }  // namespace
 
@@ -159,7 +133,7 @@ void TarneldSession::sendMessageWithSessionInfo(const Dependencies& dependencies
     TARNEL_LOG(log, error, "sendMessageWithSessionInfo: No backends available to send single message");
     return;
   }
-  const TemporaryBackends temporary(*std::move(created), log);
+  const TemporaryBackends temporary(log, "sendMessageWithSessionInfo", *std::move(created));
   const Value* required = sessionInfo->find(kTarnelSessionInfoRequireUserInfo);
   if (userInfo && (required == nullptr || !required->boolValue())) {
     TARNEL_LOG(log, warning, "sendMessageWithSessionInfo: user info provided without requiring it.");

@@ -185,6 +185,29 @@ TEST_F(SessionUploads, EveryBackendOfASingleMessageIsCleanedUpWhateverIsThrown) 
                      "sendMessageWithSessionInfo: httppost was not cleaned up in order: cleanup went wrong"));
 }
 
+TEST_F(SessionUploads, ACleanUpThatThrowsWhateverItLikesEndsNothing) {
+  offer({"httppost", "dashboard"});
+  backends.scripts["httppost"].cleanupThrowsNumber = true;
+  EXPECT_EQ(single(info(9)), "finished");
+  EXPECT_EQ(backends.journal.lines().back(), "dashboard cleanup");
+  EXPECT_TRUE(logged(LogLevel::error,
+                     "sendMessageWithSessionInfo: httppost was not cleaned up in order: unknown failure"));
+}
+
+TEST_F(SessionUploads, BackendsThatWereMadeBeforeOneFailedAreCleanedUp) {
+  offer({"httppost", "dashboard"});
+  backends.scripts["httppost"].cleanupThrows = true;
+  backends.scripts["dashboard"].setUpThrows = true;
+  EXPECT_THROW(single(info(9)), std::runtime_error);
+  const auto lines = backends.journal.lines();
+  ASSERT_GE(lines.size(), 4U);
+  EXPECT_THAT(Lines(lines.end() - 4, lines.end()),
+              ElementsAre("httppost setUserInfoDict", "dashboard setUserInfoDict", "httppost cleanup",
+                          "dashboard cleanup"));
+  EXPECT_TRUE(
+      logged(LogLevel::error, "createBackends: httppost was not cleaned up in order: cleanup went wrong"));
+}
+
 TEST_F(SessionUploads, SingleMessageWithoutAnyBackendIsStillFinished) {
   delegate->storebag = sectionOf({"surprise"});
   EXPECT_EQ(single(info(9)), "finished");
