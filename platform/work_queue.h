@@ -56,8 +56,6 @@ class WorkQueue {
 };
 
 // Where queues come from. What comes from here must be gone before this is. Threads: any.
-//
-// This class itself is a source without any queues.
 class WorkQueues {
  public:
   WorkQueues() = default;

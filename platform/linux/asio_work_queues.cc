@@ -105,8 +105,8 @@ class SourceState : public std::enable_shared_from_this<SourceState> {
   virtual ~SourceState() = default;
 
   Executor& executor() const noexcept { return executor_; }
-  // No event is handled from now on, not even one that has happened and has its turn before whatever would be
-  // handed over now. True the first time.
+  // No event is handled after this when it is called on the queue, not even one that has happened already;
+  // from another thread one more may be. True the first time.
   bool markCancelled() { return !isCancelled_.exchange(true); }
   void begin(std::unique_ptr<Handlers> handlers) {
     if (isCancelled_.load()) return finish(*handlers);
