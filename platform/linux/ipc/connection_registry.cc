@@ -10,10 +10,11 @@
 
 namespace tarnel {
 
-ConnectionRegistry::ConnectionRegistry(const IpcLimits& limits)
+ConnectionRegistry::ConnectionRegistry(const IpcLimits& limits, std::function<void()> trimHeap)
     : limits_(limits),
       finishedEvent_(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
-      largeCalls_(limits.largeBytesAtWork) {
+      largeCalls_(limits.largeBytesAtWork,
+                  {.trim = std::move(trimHeap), .owed = [this] { eventfd_write(finishedEvent_.get(), 1); }}) {
   if (!finishedEvent_) throw std::system_error(errno, std::generic_category(), "eventfd");
 }
 

@@ -47,7 +47,8 @@ class ConnectionRegistry : public std::enable_shared_from_this<ConnectionRegistr
   };
   enum class Full { perUser, total };
 
-  explicit ConnectionRegistry(const IpcLimits& limits);
+  // trimHeap: what LargeCalls is to trim memory with.
+  ConnectionRegistry(const IpcLimits& limits, std::function<void()> trimHeap);
 
   // Of all connections. Lives as long as this.
   LargeCalls& largeCalls() noexcept { return largeCalls_; }
@@ -61,7 +62,8 @@ class ConnectionRegistry : public std::enable_shared_from_this<ConnectionRegistr
   bool start(std::shared_ptr<ConnectionLink> link, std::function<void()> body);
   size_t threads() const;
 
-  // Readable when a thread is over and waits for reap(); for the main loop.
+  // Readable when a thread is over and waits for reap(), or largeCalls().trimOwed() has something to do; for
+  // the main loop.
   int finishedDescriptor() const noexcept { return finishedEvent_.get(); }
   // Joins what is over; never waits for a thread that still runs.
   void reap();

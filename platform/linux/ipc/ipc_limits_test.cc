@@ -270,6 +270,23 @@ TEST(IpcLargeMessagesTest, LargeMessagesOfManyClientsAllArriveOneAfterTheOther) 
   EXPECT_EQ(most, 1);
 }
 
+TEST(IpcLargeMessagesTest, AfterThemMemoryIsGivenBackButNotAfterEach) {
+  IpcLimits limits;
+  limits.largeBytesAtWork = 100'000;
+  Service service(limits);
+  service.start();
+  BusClient client(service.path());
+  const std::string text(kLargeText, 'x');
+  const auto send = [&] {
+    return client.call("SendMessage", "qqaa{sv}", 1, 2, 1, 1, "k", "s", text.c_str()) != nullptr;
+  };
+  EXPECT_TRUE(send());
+  EXPECT_TRUE(send());
+  EXPECT_TRUE(eventually([&] { return service.trims == 1; }));
+  for (int i = 0; i < 10; ++i) EXPECT_TRUE(send());
+  EXPECT_EQ(service.trims, 1U);
+}
+
 TEST(IpcQueueTest, AClientThatNeverReadsItsCallsIsDropped) {
   IpcLimits limits;
   limits.queuedBytes = 100'000;

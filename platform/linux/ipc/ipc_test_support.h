@@ -186,6 +186,8 @@ class Service final : public IpcListenerDelegate {
 
   // Set before start(): prepares each new session.
   std::function<void(RecordingSession&)> prepare = [](RecordingSession&) {};
+  // How often memory was given back.
+  std::atomic<size_t> trims{0};
   // What the listener said at its end.
   std::atomic<size_t> callsLeftBehind{0};
 
@@ -270,6 +272,7 @@ class Service final : public IpcListenerDelegate {
     options.limits = limits_;
     options.readCredentials = readCredentials_;
     options.clientFiles = clientFiles_;
+    options.trimHeap = [this] { ++trims; };
     options.callsLeftBehind = [this](size_t calls) { callsLeftBehind = calls; };
     listener_ = std::make_unique<SdBusListener>(event, std::move(options), entitlements_, log_);
     listener_->setDelegate(this);

@@ -67,19 +67,27 @@ void LargeCalls::removeIfUnused(Place::Key key) {
   if (found->second.atWork == 0 && found->second.waiting.empty()) lines_.erase(found);
 }
 
-// What was decoded is kept by the C library, for every thread anew. Not while others are at work, nor often:
-// meanwhile nobody gets memory.
-bool LargeCalls::isTrimDue() {
-  if (!lines_.empty() || leftSinceTrim_ < bytesAtWork_) return false;
-  const auto now = heap_.now();
-  if (lastTrim_ && now - *lastTrim_ < kTrimEvery) return false;
-  lastTrim_ = now;
-  leftSinceTrim_ = 0;
-  return true;
+bool LargeCalls::isTrimOwed() const {
+  return lines_.empty() && leftSinceTrim_ >= bytesAtWork_;
+}
+
+std::optional<std::chrono::milliseconds> LargeCalls::trimOwed() {
+  {
+    const std::lock_guard lock(mutex_);
+    if (!isTrimOwed()) return std::nullopt;
+    const auto now = heap_.now();
+    if (lastTrim_ && now - *lastTrim_ < kTrimEvery) {
+      return std::chrono::ceil<std::chrono::milliseconds>(*lastTrim_ + kTrimEvery - now);
+    }
+    lastTrim_ = now;
+    leftSinceTrim_ = 0;
+  }
+  heap_.trim();
+  return std::nullopt;
 }
 
 void LargeCalls::leave(Place::Key key, size_t bytes) {
-  bool trimNow = false;
+  bool isOwed = false;
   {
     const std::lock_guard lock(mutex_);
     Line& line = lines_.find(key)->second;
@@ -87,9 +95,9 @@ void LargeCalls::leave(Place::Key key, size_t bytes) {
     leftSinceTrim_ += bytes;
     admitWaiting(line);
     removeIfUnused(key);
-    trimNow = isTrimDue();
+    isOwed = isTrimOwed();
   }
-  if (trimNow) heap_.trim();
+  if (isOwed) heap_.owed();
 }
 
 }  // namespace tarnel

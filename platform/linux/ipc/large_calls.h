@@ -30,8 +30,11 @@ class LargeCalls {
   struct Heap {
     // Gives what the C library keeps of freed memory back to the system. Stops every thread that allocates.
     std::function<void()> trim = trimHeap;
+    // Told, on any thread, that trimOwed() has something to do.
+    std::function<void()> owed = [] {};
     std::function<SteadyTime()> now = [] { return std::chrono::steady_clock::now(); };
   };
+  static void trimHeap();
   static constexpr std::chrono::seconds kTrimEvery{10};
 
   // bytesAtWork: of each user and kind. A message that is alone may always work.
@@ -58,6 +61,11 @@ class LargeCalls {
   // Waits at most `limit` for room. Nothing when there was none, or after stop().
   std::optional<Place> enter(uint32_t uid, Kind kind, size_t bytes, std::chrono::milliseconds limit);
 
+  // Trims the heap if that is owed: what was decoded is kept by the C library, for every thread anew. Not
+  // while any call is at work, nor more often than every kTrimEvery; a thread that waits for nobody's message
+  // does it. Returns after what time to call again, nothing when owed() will tell.
+  std::optional<std::chrono::milliseconds> trimOwed();
+
   // Nobody waits any more, and nobody enters.
   void stop();
   bool stopped() const;
@@ -76,11 +84,10 @@ class LargeCalls {
     std::list<Waiting*> waiting;  // the first to come is the first to go
   };
 
-  static void trimHeap();
   bool fits(const Line& line, size_t bytes) const;
   void admitWaiting(Line& line);
   void removeIfUnused(Place::Key key);
-  bool isTrimDue();
+  bool isTrimOwed() const;
   void leave(Place::Key key, size_t bytes);
 
   const size_t bytesAtWork_;

@@ -140,27 +140,39 @@ TEST_F(LineTest, AfterTheStopNobodyWaitsAndNobodyEnters) {
 
 TEST(LargeCallsTest, MemoryIsTrimmedSeldomAndOnlyWhenNobodyIsAtWork) {
   size_t trims = 0;
+  size_t told = 0;
   LargeCalls::SteadyTime now{};
-  LargeCalls calls(100, {.trim = [&trims] { ++trims; }, .now = [&now] { return now; }});
+  LargeCalls calls(
+      100, {.trim = [&trims] { ++trims; }, .owed = [&told] { ++told; }, .now = [&now] { return now; }});
   const auto work = [&calls](uint32_t uid, size_t bytes) { calls.enter(uid, Kind::prompt, bytes, kNone); };
   work(1, 99);
-  EXPECT_EQ(trims, 0U) << "there is not enough to give back";
+  EXPECT_EQ(told, 0U) << "there is not enough to give back";
+  EXPECT_EQ(calls.trimOwed(), std::nullopt);
   {
     const auto other = calls.enter(2, Kind::upload, 10, kNone);
     for (int i = 0; i < 10; ++i) work(1, 100);
-    EXPECT_EQ(trims, 0U) << "another user's call is at work";
+    EXPECT_EQ(told, 0U) << "another user's call is at work";
+    EXPECT_EQ(calls.trimOwed(), std::nullopt);
+    EXPECT_EQ(trims, 0U);
   }
+  EXPECT_EQ(told, 1U);
+  EXPECT_EQ(trims, 0U) << "not on the thread of a message";
+  EXPECT_EQ(calls.trimOwed(), std::nullopt);
   EXPECT_EQ(trims, 1U);
-  now += LargeCalls::kTrimEvery - milliseconds(1);
-  for (int i = 0; i < 10; ++i) work(1, 100);
-  EXPECT_EQ(trims, 1U) << "it was done a moment ago";
+  // A moment later it has to wait.
+  now += seconds(2);
+  work(1, 100);
+  EXPECT_EQ(told, 2U);
+  EXPECT_EQ(calls.trimOwed(), seconds(8));
+  now += seconds(8) - milliseconds(1);
+  EXPECT_EQ(calls.trimOwed(), milliseconds(1));
+  EXPECT_EQ(trims, 1U);
   now += milliseconds(1);
-  work(1, 1);
+  EXPECT_EQ(calls.trimOwed(), std::nullopt);
   EXPECT_EQ(trims, 2U);
-  now += LargeCalls::kTrimEvery;
-  work(1, 99);
-  EXPECT_EQ(trims, 2U);
-  EXPECT_EQ(LargeCalls::kTrimEvery, seconds(10));
+  now += seconds(20);
+  EXPECT_EQ(calls.trimOwed(), std::nullopt);
+  EXPECT_EQ(trims, 2U) << "nothing is owed";
 }
 
 }  // namespace

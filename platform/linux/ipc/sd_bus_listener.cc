@@ -35,12 +35,13 @@ SdBusListener::SdBusListener(sd_event* event, Options options, std::shared_ptr<E
       options_(std::move(options)),
       entitlements_(std::move(entitlements)),
       log_(std::move(log)),
-      registry_(std::make_shared<ConnectionRegistry>(options_.limits)) {}
+      registry_(std::make_shared<ConnectionRegistry>(options_.limits, options_.trimHeap)) {}
 
 SdBusListener::~SdBusListener() {
   accepting_.reset();
   reaping_.reset();
   pause_.reset();
+  trimming_.reset();
   const size_t left = registry_->stopAll();
   if (left == 0) return;
   log_->log(LogLevel::warning,
@@ -58,7 +59,7 @@ MaybeError SdBusListener::resume() {
   }
   reserve_ = openReserve();
   const auto reap = [](sd_event_source*, int, uint32_t, void* self) {
-    static_cast<SdBusListener*>(self)->registry_->reap();
+    static_cast<SdBusListener*>(self)->tidyUp();
     return 0;
   };
   const auto accept = [](sd_event_source*, int, uint32_t, void* self) {
@@ -75,6 +76,30 @@ MaybeError SdBusListener::watch(int descriptor, sd_event_io_handler_t handler, S
   if (r < 0) return eventFailure(r);
   source.reset(made);
   return std::nullopt;
+}
+
+void SdBusListener::tidyUp() {
+  registry_->reap();
+  if (trimming_ == nullptr) trimHeap();
+}
+
+// Here because this thread keeps no message waiting.
+void SdBusListener::trimHeap() {
+  const auto wait = registry_->largeCalls().trimOwed();
+  if (!wait) return;
+  const auto again = [](sd_event_source*, uint64_t, void* self) {
+    auto& listener = *static_cast<SdBusListener*>(self);
+    listener.trimming_.reset();
+    listener.trimHeap();
+    return 0;
+  };
+  sd_event_source* made = nullptr;
+  const auto microseconds = std::chrono::microseconds(*wait).count();
+  // Without a timer it is done after the next large call.
+  if (sd_event_add_time_relative(event_.get(), &made, CLOCK_MONOTONIC, static_cast<uint64_t>(microseconds), 0,
+                                 again, this) >= 0) {
+    trimming_.reset(made);
+  }
 }
 
 void SdBusListener::acceptWaiting() {

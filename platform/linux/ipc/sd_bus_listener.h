@@ -36,6 +36,8 @@ class SdBusListener final : public IpcListener {
     // Told by the destructor how many calls had to be left behind, if any: their threads still use the
     // delegate and all that it uses, so the process must end without destroying those.
     std::function<void(size_t)> callsLeftBehind;
+    // Gives freed memory back to the system; on the event loop's thread, now and then after large calls.
+    std::function<void()> trimHeap = LargeCalls::trimHeap;
   };
 
   // The event loop's reference is held.
@@ -61,6 +63,8 @@ class SdBusListener final : public IpcListener {
   using Source = std::unique_ptr<sd_event_source, UnrefSource>;
 
   MaybeError watch(int descriptor, sd_event_io_handler_t handler, Source& source);
+  void tidyUp();
+  void trimHeap();
   void acceptWaiting();
   bool acceptOne();
   void take(UniqueFd socket);
@@ -82,6 +86,7 @@ class SdBusListener final : public IpcListener {
   Source accepting_;
   Source reaping_;
   Source pause_;
+  Source trimming_;  // while memory waits to be given back
 
   // Closed connections are logged at most once a second, each line with the number since the last.
   std::optional<std::chrono::steady_clock::time_point> lastRefusalLine_;
