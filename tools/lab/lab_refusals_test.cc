@@ -18,16 +18,19 @@ using ::testing::HasSubstr;
 class LabRefusalsTest : public LabTest {};
 
 TEST_F(LabRefusalsTest, BodiesThatAreTooLargeAreRefusedWithoutHoldingThem) {
+  // The connection ends at the refusal: who is still sending may not come to read it (0), or only that it was
+  // to go on (100).
+  const auto isRefusal = AnyOf(413, 100, 0);
   start();
   HttpRequest request = goodRequest(goodMessage({}));
   request.body.assign((16U << 20U) + 1, ' ');
   setHeader(request, "Content-Length", std::to_string(request.body.size()));
   setHeader(request, "Expect", "");
   const Client::Reply reply = client().post(at("eventsURL"), request);
-  EXPECT_THAT(reply.status, AnyOf(413, 0)) << reply.problem;
+  EXPECT_THAT(reply.status, isRefusal) << reply.problem;
   setHeader(request, "Content-Length", "");
   request.headers.emplace_back("Transfer-Encoding", "chunked");
-  EXPECT_THAT(client().post(at("eventsURL"), request).status, AnyOf(413, 0));
+  EXPECT_THAT(client().post(at("eventsURL"), request).status, isRefusal);
   EXPECT_EQ(lab_->status().find("events")->int64Value(), 0);
 }
 
