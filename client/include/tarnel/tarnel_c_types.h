@@ -29,7 +29,8 @@ enum {
   TARNEL_OK = 0,
   /* An argument is missing, out of its range, not UTF-8, or nested deeper than 32 levels. */
   TARNEL_ERROR_INVALID_ARGUMENT = 1,
-  /* The call would not fit into a frame of 1 MiB (1,048,576 bytes). */
+  /* The call would not fit into a frame of 1 MiB (1,048,576 bytes), or gives a session more than 64 KiB
+   * (65,536 bytes) of session info and user info to keep. */
   TARNEL_ERROR_TOO_LARGE = 2,
   /* The queue holds as many calls or bytes as it may: wait for answers, or drop the message. */
   TARNEL_ERROR_QUEUE_FULL = 3,
