@@ -1,4 +1,5 @@
-#include <fcntl.h>
+#include "platform/linux/ipc/ipc_files_test_fixture.h"
+
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -8,10 +9,9 @@
 #include <fstream>
 #include <functional>
 #include <latch>
+#include <thread>
 #include <tuple>
 #include <vector>
-
-#include "platform/linux/ipc/ipc_test_support.h"
 
 // Files that clients hand over with their calls.
 
@@ -19,75 +19,6 @@ namespace tarnel {
 namespace {
 
 using ::testing::ElementsAre;
-using ::testing::HasSubstr;
-
-// The body of UploadFile: a text, and which of the descriptors.
-std::string uploadBody(const std::string& fileURL, uint32_t index = 0) {
-  const auto size = static_cast<uint32_t>(fileURL.size());
-  std::string body(reinterpret_cast<const char*>(&size), 4);
-  body += fileURL + '\0';
-  while (body.size() % 4 != 0) body += '\0';
-  return body.append(reinterpret_cast<const char*>(&index), 4);
-}
-
-std::string rawUpload(const std::string& fileURL, uint32_t announced = 1, uint32_t serial = 1) {
-  return rawCall("UploadFile", uploadBody(fileURL), "sh", UINT32_MAX, serial, announced);
-}
-
-class IpcFilesTest : public ::testing::Test {
- protected:
-  std::string write(const std::string& name, const std::string& text) const {
-    std::string path = service.folder().path() + '/' + name;
-    std::ofstream(path) << text;
-    return path;
-  }
-  static UniqueFd open(const std::string& path, int flags = O_RDONLY) {
-    UniqueFd file(::open(path.c_str(), flags | O_CLOEXEC));
-    EXPECT_TRUE(file) << path;
-    return file;
-  }
-  // What every upload does with its file.
-  void onFile(std::function<void(ClientFile&)> use) {
-    service.prepare = [this, use = std::move(use)](RecordingSession& session) {
-      session.uploadFile = [this, use](const std::string& token) {
-        const auto file = service.clientFiles().consume(token);
-        if (file != nullptr) use(*file);
-        return file != nullptr;
-      };
-    };
-    service.start();
-  }
-  std::optional<bool> upload(BusClient& client, const std::string& path, const UniqueFd& file) {
-    const auto reply = client.call("UploadFile", "sh", path.c_str(), file.get());
-    int success = -1;
-    if (reply == nullptr || sd_bus_message_read(reply.get(), "b", &success) <= 0) return std::nullopt;
-    return success == 1;
-  }
-  // The texts of all calls of the client's object that have come.
-  static std::vector<std::string> deletions(BusClient& client) {
-    std::vector<std::string> texts;
-    sd_bus_message* message = nullptr;
-    while (sd_bus_process(client.bus(), &message) > 0) {
-      const BusMessage held(message);
-      const char* text = nullptr;
-      if (message == nullptr ||
-          sd_bus_message_is_method_call(message, wire::kReplyInterface, wire::kDeleteFile.name) <= 0) {
-        continue;
-      }
-      EXPECT_STREQ(sd_bus_message_get_path(message), wire::kReplyPath);
-      EXPECT_EQ(sd_bus_message_get_expect_reply(message), 0);
-      EXPECT_GE(sd_bus_message_read(message, "s", &text), 0);
-      texts.emplace_back(text);
-    }
-    return texts;
-  }
-  std::string refusal(const std::string& token) {
-    EXPECT_EQ(service.clientFiles().consume(token), nullptr);
-    return service.log().lines().back().text;
-  }
-
-  Service service;
-};
 
 TEST_F(IpcFilesTest, AFileIsReadThroughWhatTheClientOpened) {
   const auto path = write("a b.log", "contents");
@@ -329,159 +260,6 @@ TEST_F(IpcFilesTest, AClientThatDiesMeanwhileKeepsItsFile) {
   isDead.count_down();
   EXPECT_TRUE(eventually([&] { return service.invalidations() == 1; }));
   EXPECT_TRUE(service.logged("ClientFiles: /x was uploaded and is kept: cannot call the client: "));
-}
-
-TEST_F(IpcFilesTest, DescriptorsFindTheirMessagesHoweverTheBytesAreCut) {
-  std::vector<std::string> contents;
-  onFile([&contents](ClientFile& file) { contents.push_back(*file.contents()); });
-  const auto one = open(write("1", "one"));
-  const auto two = open(write("2", "two"));
-  const RawClient client(service.path());
-  client.authenticateForDescriptors();
-  // Behind other messages, in one piece.
-  EXPECT_TRUE(client.writeWith(rawCall("StartConfig") + rawUpload("/1") + rawCall("StartConfig"), one.get()));
-  EXPECT_TRUE(eventually([&] { return service.session()->count() == 3; }));
-  // Byte by byte.
-  const auto call = rawUpload("/2");
-  EXPECT_TRUE(client.writeWith(call.substr(0, 1), two.get()));
-  for (const char byte : call.substr(1)) EXPECT_TRUE(client.write({&byte, 1}));
-  EXPECT_TRUE(eventually([&] { return service.session()->count() == 4; }));
-  // For two messages at once.
-  EXPECT_TRUE(client.writeWith(rawUpload("/1") + rawUpload("/1", 1, 2), one.get(), 2));
-  EXPECT_TRUE(eventually([&] { return service.session()->count() == 6; }));
-  service.stop();
-  EXPECT_THAT(contents, ElementsAre("one", "two", "one", "one"));
-}
-
-TEST_F(IpcFilesTest, ADescriptorThatIsAnnouncedAndMissingEndsTheConnection) {
-  onFile([](ClientFile&) {});
-  const RawClient client(service.path());
-  client.authenticateForDescriptors();
-  EXPECT_TRUE(client.write(rawUpload("/x")));
-  EXPECT_TRUE(isClosedByPeer(client.fd()));
-  const RawClient few(service.path());
-  few.authenticateForDescriptors();
-  EXPECT_TRUE(few.writeWith(rawUpload("/x", 5), 0, 5));
-  EXPECT_TRUE(isClosedByPeer(few.fd()));
-  EXPECT_TRUE(service.logged("a message announces 5 descriptors, and 4 came; at most 4 may"));
-  EXPECT_EQ(service.session(0), nullptr);
-}
-
-TEST_F(IpcFilesTest, ACallWithoutItsDescriptorIsRefused) {
-  onFile([](ClientFile&) {});
-  BusClient client(service.path());
-  auto call = client.newCall("UploadFile");
-  EXPECT_GE(sd_bus_message_append(call.get(), "s", "/x"), 0);
-  EXPECT_EQ(client.call(call), nullptr);
-  EXPECT_EQ(client.errorText, "UploadFile takes the arguments \"sh\", not \"s\"");
-  const RawClient raw(service.path());
-  raw.authenticateForDescriptors();
-  EXPECT_TRUE(raw.write(rawCall("UploadFile", uploadBody("/x"), "sh")));
-  EXPECT_TRUE(raw.writeWith(rawUpload("/x", 2), 0, 2));
-  EXPECT_TRUE(raw.write(rawCall("StartConfig")));
-  EXPECT_TRUE(eventually([&] { return service.accepted() == 2 && service.session(1)->count() == 1; }));
-  EXPECT_THAT(service.session(1)->calls(), ElementsAre("startConfig"));
-}
-
-TEST_F(IpcFilesTest, TheDescriptorIsNamedByTheOnlyIndexThereIs) {
-  onFile([](ClientFile&) {});
-  const auto file = open(write("x", "x"));
-  const RawClient client(service.path());
-  client.authenticateForDescriptors();
-  const auto upload = [](uint32_t index) {
-    return rawCall("UploadFile", uploadBody("/x", index), "sh", UINT32_MAX, 1, 1);
-  };
-  EXPECT_TRUE(client.writeWith(upload(1), file.get()));
-  // Also when the index comes in pieces.
-  const std::string call = upload(0x01000000);
-  EXPECT_TRUE(client.writeWith(call.substr(0, call.size() - 2), file.get()));
-  std::string answers;
-  std::array<char, 4096> piece{};
-  const auto readUntil = [&](const std::string& text) {
-    while (answers.find(text) == std::string::npos) {
-      const auto got = recv(client.fd().get(), piece.data(), piece.size(), 0);
-      if (got <= 0) return false;
-      answers.append(piece.data(), static_cast<size_t>(got));
-    }
-    return true;
-  };
-  EXPECT_TRUE(
-      readUntil("UploadFile names the descriptor by the index 1; one came with the message, and its "
-                "index is 0"))
-      << answers;
-  EXPECT_TRUE(client.write(call.substr(call.size() - 2, 1)));
-  EXPECT_TRUE(client.write(call.substr(call.size() - 1)));
-  EXPECT_TRUE(readUntil("by the index 16777216;")) << answers;
-  EXPECT_EQ(service.session()->count(), 0U);
-  EXPECT_TRUE(client.writeWith(upload(0), file.get()));
-  EXPECT_TRUE(eventually([&] { return service.session()->count() == 1; }));
-}
-
-// The bus library would leave it open, with nobody to close it.
-TEST_F(IpcFilesTest, TheDescriptorOfAMalformedMessageIsClosed) {
-  onFile([](ClientFile&) {});
-  const auto file = open(write("x", "x"));
-  auto call = rawUpload("/x");
-  const size_t path = call.find("/com/orvane");
-  ASSERT_NE(path, std::string::npos);
-  call[path] = '!';
-  const size_t before = openDescriptors();
-  for (int i = 0; i < 20; ++i) {
-    const RawClient client(service.path());
-    client.authenticateForDescriptors();
-    EXPECT_TRUE(client.writeWith(call, file.get()));
-    EXPECT_TRUE(isClosedByPeer(client.fd()));
-  }
-  EXPECT_TRUE(eventually([&] { return service.invalidations() == 20; }));
-  EXPECT_TRUE(eventually([before] { return openDescriptors() <= before; }));
-}
-
-TEST_F(IpcFilesTest, WithoutNegotiationNoDescriptorIsTaken) {
-  onFile([](ClientFile&) {});
-  const RawClient client(service.path());
-  client.authenticate();
-  EXPECT_TRUE(client.writeWith(rawUpload("/x"), 0));
-  EXPECT_TRUE(isClosedByPeer(client.fd()));
-}
-
-// A call whose answer takes its time must not keep descriptors open meanwhile.
-TEST_F(IpcFilesTest, NoOtherCallTakesDescriptors) {
-  std::vector<SentReply> held;
-  service.prepare = [&held](RecordingSession& session) {
-    session.answerSend = [&held](SentReply reply) { held.push_back(std::move(reply)); };
-  };
-  service.start();
-  const auto file = open(write("x", "x"));
-  const RawClient client(service.path());
-  client.authenticateForDescriptors();
-  EXPECT_TRUE(client.write(rawCall("StartConfig")));
-  EXPECT_TRUE(eventually([&] { return service.accepted() == 1 && service.session()->count() == 1; }));
-  const size_t before = openDescriptors();
-  const std::string body = std::string("\1\0\2\0\0\0\0\0", 8);
-  for (uint32_t i = 0; i < 50; ++i) {
-    EXPECT_TRUE(
-        client.writeWith(rawCall("SendMessage", body, "qqaa{sv}", UINT32_MAX, i + 1, 4), file.get(), 4));
-    EXPECT_TRUE(client.writeWith(rawCall("FinishSession", "", "", UINT32_MAX, i + 1, 1), file.get()));
-  }
-  EXPECT_TRUE(client.write(rawCall("StartConfig")));
-  EXPECT_TRUE(eventually([&] { return service.session()->count() == 2; }));
-  EXPECT_EQ(openDescriptors(), before);
-  service.stop();
-  EXPECT_THAT(held, ::testing::IsEmpty());
-}
-
-TEST_F(IpcFilesTest, DescriptorsThatNoMessageAnnouncesAreToldOnce) {
-  service.start();
-  const RawClient client(service.path());
-  client.authenticateForDescriptors();
-  for (int i = 0; i < 3; ++i) EXPECT_TRUE(client.writeWith(rawCall("StartConfig"), 0, 3));
-  EXPECT_TRUE(eventually([&] { return service.accepted() == 1 && service.session()->count() == 3; }));
-  service.stop();
-  size_t lines = 0;
-  for (const auto& line : service.log().lines()) {
-    if (line.text.find("that no message announces are closed") != std::string::npos) ++lines;
-  }
-  EXPECT_EQ(lines, 1U);
 }
 
 }  // namespace
