@@ -195,6 +195,14 @@ void RawHttpServer::serve(Connection& connection) {
   close(descriptor);
 }
 
+RawHttpServer::Handler RawHttpServer::hangingAfterRequest(std::promise<void>& came) {
+  return [&came](RawConnection& connection) {
+    connection.readRequest();
+    came.set_value();
+    connection.waitForClose();
+  };
+}
+
 RawHttpServer::Handler RawHttpServer::answering(
     std::function<std::string(const std::string& request)> answer) {
   return [answer = std::move(answer)](RawConnection& connection) {

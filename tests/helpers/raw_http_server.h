@@ -3,6 +3,7 @@
 #include <condition_variable>
 #include <cstdint>
 #include <functional>
+#include <future>
 #include <list>
 #include <memory>
 #include <mutex>
@@ -61,6 +62,9 @@ class RawHttpServer {
 
   // A handler that answers every request of a connection with what `answer` gives for it.
   static Handler answering(std::function<std::string(const std::string& request)> answer);
+  // A handler that reads one request, sets the promise, and never answers. For one connection; the promise
+  // outlives the server.
+  static Handler hangingAfterRequest(std::promise<void>& came);
 
  private:
   class Socket;

@@ -67,11 +67,7 @@ TEST_F(LogDataUploadTest, RecordsArriveAsAnArchive) {
 
 TEST_F(LogDataUploadTest, OneThatHangsDelaysNobodyElseNorTheEndOfTheDaemon) {
   std::promise<void> hangs;
-  const RawHttpServer server([&hangs](RawConnection& connection) {
-    connection.readRequest();
-    hangs.set_value();
-    connection.waitForClose();
-  });
+  const RawHttpServer server(RawHttpServer::hangingAfterRequest(hangs));
   serve(server.url("/logs"));
   ASSERT_TRUE(instance.start());
   auto options = optionsFor(instance);

@@ -155,11 +155,7 @@ TEST_F(UploadTest, EmptyAndOversizedFilesAreRefused) {
 // An upload holds its own client; everybody else's messages go on, and so does the end of the daemon.
 TEST_F(UploadTest, AnUploadThatHangsDelaysNobodyElse) {
   std::promise<void> hangs;
-  const RawHttpServer server([&hangs](RawConnection& connection) {
-    connection.readRequest();
-    hangs.set_value();
-    connection.waitForClose();
-  });
+  const RawHttpServer server(RawHttpServer::hangingAfterRequest(hangs));
   serve(server.url("/up"));
   ASSERT_TRUE(instance.start());
   const auto path = write("x.log", "text");

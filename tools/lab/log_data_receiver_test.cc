@@ -6,7 +6,7 @@
 
 #include "platform/archive.h"
 #include "platform/document.h"
-#include "platform/fake/fake_clock.h"
+#include "tools/lab/storing_receiver_test_fixture.h"
 #include "tools/lab/test_post.h"
 
 namespace tarnel::lab {
@@ -17,26 +17,15 @@ using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 using ::testing::StartsWith;
 
-class Silence final : public Notices {
- public:
-  void storebagServed(const ServedStorebag&) override {}
-  void warning(const std::string&) override {}
-};
-
 const Array& records() {
   static const Array kRecords = {Dictionary{{"time", Date{1700000000.5}}, {"level", 3}, {"text", "no route"}},
                                  Dictionary{{"data", Data{1, 2}}, {"text", "no route"}}};
   return kRecords;
 }
 
-class LogDataReceiverTest : public ::testing::Test {
+class LogDataReceiverTest : public StoringReceiverTest {
  protected:
-  LogDataReceiverTest() {
-    std::filesystem::remove_all(folder_);
-    std::filesystem::create_directories(folder_);
-    EXPECT_FALSE(files_.open());
-  }
-  ~LogDataReceiverTest() override { std::filesystem::remove_all(folder_); }
+  LogDataReceiverTest() : StoringReceiverTest("tarnel_log_data_") {}
 
   static HttpRequest requestWith(std::string archive) {
     HttpRequest request;
@@ -53,13 +42,6 @@ class LogDataReceiverTest : public ::testing::Test {
   }
   LogDataArrival receive(const Value& root) { return receive(requestWith(*archiveObject(root))); }
 
-  const std::string folder_ = ::testing::TempDir() + "tarnel_log_data_" +
-                              ::testing::UnitTest::GetInstance()->current_test_info()->name();
-  ArrivalStore store_{100};
-  Misbehaviours misbehaviours_;
-  fake::FakeClock clock_;
-  Silence notices_;
-  StoredFiles files_{folder_, notices_, {}};
   LogDataReceiver receiver_{files_, "http://127.0.0.1:8444/log-data", store_, misbehaviours_, clock_};
   HttpAnswer answer_;
 };

@@ -5,7 +5,7 @@
 #include <filesystem>
 
 #include "platform/document.h"
-#include "platform/fake/fake_clock.h"
+#include "tools/lab/storing_receiver_test_fixture.h"
 #include "tools/lab/test_post.h"
 
 namespace tarnel::lab {
@@ -17,20 +17,10 @@ using ::testing::IsEmpty;
 using ::testing::Not;
 using ::testing::StartsWith;
 
-class Silence final : public Notices {
- public:
-  void storebagServed(const ServedStorebag&) override {}
-  void warning(const std::string&) override {}
-};
-
-class UploadReceiverTest : public ::testing::Test {
+class UploadReceiverTest : public StoringReceiverTest {
  protected:
-  UploadReceiverTest() {
-    std::filesystem::remove_all(folder_);
-    std::filesystem::create_directories(folder_);
-    EXPECT_FALSE(files_.open());
-  }
-  ~UploadReceiverTest() override { std::filesystem::remove_all(folder_); }
+  // The folder's name holds the word by which an upload counts as taken.
+  UploadReceiverTest() : StoringReceiverTest("tarnel_success_") {}
 
   UploadArrival receive(const HttpRequest& request) {
     answer_ = receiver_.receive(request);
@@ -42,14 +32,6 @@ class UploadReceiverTest : public ::testing::Test {
   }
 
   static constexpr uint64_t kMaxBytes = 1U << 20U;
-  // Holds the word by which an upload counts as taken.
-  const std::string folder_ = ::testing::TempDir() + "tarnel_success_" +
-                              ::testing::UnitTest::GetInstance()->current_test_info()->name();
-  ArrivalStore store_{100};
-  Misbehaviours misbehaviours_;
-  fake::FakeClock clock_;
-  Silence notices_;
-  StoredFiles files_{folder_, notices_, {}};
   UploadReceiver receiver_{files_, kMaxBytes, store_, misbehaviours_, clock_};
   HttpAnswer answer_;
 };
