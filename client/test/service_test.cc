@@ -146,16 +146,7 @@ TEST(ClientAndService, TheServiceGoingAwayIsAnInterruption) {
 // Files that the library hands over; what the daemon does with each is `use`.
 class FilesAndService : public ::testing::Test {
  protected:
-  void onFile(std::function<void(ClientFile&)> use) {
-    service.prepare = [this, use = std::move(use)](RecordingSession& session) {
-      session.uploadFile = [this, use](const std::string& token) {
-        const auto file = service.clientFiles().consume(token);
-        if (file != nullptr) use(*file);
-        return file != nullptr;
-      };
-    };
-    service.start();
-  }
+  void onFile(std::function<void(ClientFile&)> use) { service.startOnFiles(std::move(use)); }
   std::string write(const std::string& name, const std::string& text = "text") const {
     std::string path = service.folder().path() + '/' + name;
     std::ofstream(path) << text;

@@ -22,6 +22,14 @@ HttpResult performWith(const HttpClientOptions& options, HttpRequest request) {
   return performAndWait(client, std::move(request));
 }
 
+// An answer that moves without an end.
+void goOnForEver(RawConnection& connection) {
+  connection.readRequest();
+  connection.write("HTTP/1.1 200 OK\r\nContent-Length: 1000000000\r\n\r\n");
+  while (connection.write("x")) {
+  }
+}
+
 // How long a request may take in all stands beside how long it may stand still, so that the error tells which
 // of the two came first.
 class StallTest : public testing::Test {
@@ -82,12 +90,7 @@ TEST_F(StallTest, endsEveryHopOfARequest) {
 TEST_F(StallTest, letsARequestGoOnWhileBytesMove) {
   options.noProgress = 500ms;
   options.longestRequest = 1200ms;
-  RawHttpServer body([](RawConnection& connection) {
-    connection.readRequest();
-    connection.write("HTTP/1.1 200 OK\r\nContent-Length: 1000000000\r\n\r\n");
-    while (connection.write("x")) {
-    }
-  });
+  RawHttpServer body(goOnForEver);
   options.maxAnswerBytes = options.maxHeldAnswerBytes = 2000000000;
   EXPECT_EQ(errorOf(performWith(options, get(body.url()))), "the request timed out after 1200 milliseconds");
 }
@@ -106,12 +109,7 @@ TEST_F(StallTest, doesNotCountTheWaitForATurn) {
   options.connectionsPerHost = 1;
   options.noProgress = 500ms;
   options.longestRequest = 1200ms;
-  RawHttpServer server([](RawConnection& connection) {
-    connection.readRequest();
-    connection.write("HTTP/1.1 200 OK\r\nContent-Length: 1000000000\r\n\r\n");
-    while (connection.write("x")) {
-    }
-  });
+  RawHttpServer server(goOnForEver);
   options.maxAnswerBytes = options.maxHeldAnswerBytes = 2000000000;
   Answers answers;  // outlives the client
   QuietLog log;

@@ -40,16 +40,7 @@ class IpcFilesTest : public ::testing::Test {
     return file;
   }
   // What every upload does with its file.
-  void onFile(std::function<void(ClientFile&)> use) {
-    service.prepare = [this, use = std::move(use)](RecordingSession& session) {
-      session.uploadFile = [this, use](const std::string& token) {
-        const auto file = service.clientFiles().consume(token);
-        if (file != nullptr) use(*file);
-        return file != nullptr;
-      };
-    };
-    service.start();
-  }
+  void onFile(std::function<void(ClientFile&)> use) { service.startOnFiles(std::move(use)); }
   std::optional<bool> upload(BusClient& client, const std::string& path, const UniqueFd& file) {
     const auto reply = client.call("UploadFile", "sh", path.c_str(), file.get());
     int success = -1;

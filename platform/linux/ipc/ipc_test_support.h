@@ -198,6 +198,17 @@ class Service final : public IpcListenerDelegate {
     EXPECT_FALSE(error) << error->description();
     return *this;
   }
+  // Starts it so that every upload that has a file hands it to `use`, and is a success.
+  void startOnFiles(std::function<void(ClientFile&)> use) {
+    prepare = [this, use = std::move(use)](RecordingSession& session) {
+      session.uploadFile = [this, use](const std::string& token) {
+        const auto file = clientFiles().consume(token);
+        if (file != nullptr) use(*file);
+        return file != nullptr;
+      };
+    };
+    start();
+  }
   void stop() {
     if (!thread_.joinable()) return;
     // What this thread did with the listener comes before its end, for all to see.
