@@ -306,8 +306,10 @@ void Backends::step() {
   }
 }
 
-// What a filter for every method removes or digests is not in an event, whether it came from the message or
-// from the user's information. The session's label may be set behind the filters.
+// What a filter for every method and status removes or digests is not in an event of a session whose user was
+// named from the beginning, whether it came from the message or from the user's information. Not looked at:
+// the session's label, which is set behind the filters; filters of one method or status, which a flush does
+// not apply to the user's information; sessions that held events before there were filters.
 void Backends::examineEvent(const Dictionary& event) const {
   for (const auto& [key, value] : event) {
     if (key == "_sessionID") continue;
@@ -361,7 +363,7 @@ void Backends::run() {
   backends_ = *std::move(made);
   require(backends_.size() <= 6, "there are six kinds of backends");
   updateStates();
-  // Without a user the table is not made.
+  // Without a user the table is not made, and what is held until one comes has not passed it.
   const Value* isRequired = info.find(kTarnelSessionInfoRequireUserInfo);
   if (!hasUser || isRequired == nullptr || !isRequired->boolValue()) filters_.clear();
   for (int steps = 0; steps < kMostSteps && !input_.atEnd(); ++steps) step();
