@@ -123,7 +123,7 @@ std::optional<Dictionary> fetchStorebagForEnvironmentAndClientType(const Depende
                                                                    int32_t clientType,
                                                                    StorebagFetchSlots slots) {
   Log& log = dependencies.log;
-  // Other types without a name are asked for under the text of a missing one.
+  // The agent lets no type without a name come here; others than 0 would be asked for as "(null)".
   if (clientType == 0) {
     TARNEL_LOG(log, error,
                "fetchStorebagForEnvironmentAndClientType: Could not find storebag name for client type %d",

@@ -26,8 +26,8 @@ std::optional<Dictionary> fetchStorebagWithName(const Dependencies& dependencies
 Dictionary fallbackStorebag();
 
 // Maximum age in seconds that the answer's Cache-Control states, held to 32 bits; the longest time where it
-// states none. The value is split at "=" and blanks alone, so "no-cache, max-age=600" counts and
-// "no-cache,max-age=600" does not.
+// states none. The value is split at "=" and blanks alone, so "no-cache,max-age=600" does not count; the
+// document's own "refresh_cycle" goes before it.
 int32_t maxAgeOfResponse(const HttpResponse* response);
 
 // The text as it can stand in a request: bytes that no URL may hold are percent-encoded, all else stays.

@@ -39,7 +39,7 @@ class DravikBackend final : public TarnelBackend {
  private:
   void loadAdaptor();
 
-  // In this order: what stands further down goes first.
+  // In this order: what stands further down goes first, and an instance needs its class, and that its bundle.
   std::shared_ptr<CodeBundle> clientBundle;
   std::shared_ptr<BundleClass> dravikAdaptorClass;
   std::unique_ptr<BundleInstance> dravikAdaptor;

@@ -18,7 +18,7 @@ namespace tarnel {
 class EventFilters {
  public:
   // createFiltersFromArray: replaces the table by the descriptions, in their order. Without any description
-  // the old table stays in force.
+  // the old table stays in force, so that an entry that names no fields takes no protection away.
   //
   // A description has "method" and "status" (numbers; absent: every one), "key" (the field's name, compared
   // ignoring case) and "action" ("remove" or "sha256"; anything else leaves the field as it is).

@@ -23,7 +23,7 @@ void logRemoval(Log& log, const std::string& key, const Value& value) {
 Dictionary messageFrom(double postTime, const MaybeString& clientId, const Array& events) {
   Dictionary message;
   message.set("postTime", postTime);
-  // Without an identifier the message ends here, without its events.
+  // Events that nobody's identifier stands for could not be told apart from a stranger's: they stay here.
   if (!clientId) return message;
   message.set("clientId", *clientId);
   message.set("events", events);

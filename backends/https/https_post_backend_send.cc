@@ -104,7 +104,7 @@ void HTTPSPostBackend::mergeIntoBatch(const Dictionary& fields, const char* oper
 
 MaybeString HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
   if (_batchedEvents && state() != ReportingState::enabled) {
-    // The counts per method stay.
+    // The counts per method stay: they are of what came since the last post.
     _batchedEvents.reset();
     _batchOverflowed = false;
   }

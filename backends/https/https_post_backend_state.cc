@@ -114,7 +114,8 @@ ReportingState HTTPSPostBackend::stateWithoutUserInfo(const std::vector<ProfileS
   return ReportingState::enabled;
 }
 
-// A refusal leaves in place what was set before it.
+// A refusal leaves in place what was set before it: the level, say, at which the sessions below still find
+// this one.
 ReportingState HTTPSPostBackend::stateForClient(const ProfileSection& client, const MaybeString& clientName,
                                                 const MaybeString& serviceID) {
   auto& log = dependencies().log;
@@ -158,7 +159,8 @@ bool HTTPSPostBackend::allowedByConsent(const ProfileSection& client) {
 bool HTTPSPostBackend::allowedByPlaceAndDevice(const ProfileSection& client,
                                                const MaybeString& country) const {
   auto& log = dependencies().log;
-  // Matched like a blacklist: without a list nobody reports, while a device without a country does.
+  // Matched like a blacklist: an entry has to name its countries, so without a list nobody reports. A device
+  // that knows no country cannot be said to be outside of them, so it does.
   if (!matchStringWithList(client.findTexts("locale_whitelist"), country, false)) {
     TARNEL_LOG(log, debug, "HTTPSPostBackend(updateBackendState): (%s) isn't in country code list %s",
                printable(country), listDescription(client, "locale_whitelist").c_str());

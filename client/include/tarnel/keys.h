@@ -7,7 +7,7 @@ namespace tarnel {
 
 // Session info.
 inline constexpr char kTarnelSessionInfoSessionID[] = "sessionID";              // unsigned integer, 32 bits
-inline constexpr char kTarnelSessionInfoClientType[] = "clientType";            // integer, 0 to 17
+inline constexpr char kTarnelSessionInfoClientType[] = "clientType";            // integer; 5 to 17 are served
 inline constexpr char kTarnelSessionInfoClientVersion[] = "clientVersion";      // unsigned integer, 16 bits
 inline constexpr char kTarnelSessionInfoRequireUserInfo[] = "requireUserInfo";  // boolean
 inline constexpr char kTarnelSessionInfoBatchEvent[] = "batchEvent";            // boolean

@@ -4,8 +4,8 @@
 /* Keys of the dictionaries that a client and the daemon exchange, for C. The same texts as in keys.h. */
 
 /* Session info. */
-#define TARNEL_SESSION_INFO_SESSION_ID "sessionID"              /* unsigned integer, 32 bits; mandatory */
-#define TARNEL_SESSION_INFO_CLIENT_TYPE "clientType"            /* integer, 0 to 17; mandatory */
+#define TARNEL_SESSION_INFO_SESSION_ID "sessionID"              /* unsigned integer, 32 bits */
+#define TARNEL_SESSION_INFO_CLIENT_TYPE "clientType"            /* integer; 5 to 17 have a storebag */
 #define TARNEL_SESSION_INFO_CLIENT_VERSION "clientVersion"      /* unsigned integer, 16 bits */
 #define TARNEL_SESSION_INFO_REQUIRE_USER_INFO "requireUserInfo" /* boolean */
 #define TARNEL_SESSION_INFO_BATCH_EVENT "batchEvent"            /* boolean */
