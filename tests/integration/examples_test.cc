@@ -1,6 +1,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <sstream>
 #include <string>
 
 #include "tests/helpers/lab_process.h"
@@ -48,13 +49,24 @@ INSTANTIATE_TEST_SUITE_P(Languages, ExamplesTest,
                          ::testing::Values(Example{"C", HELLO_C}, Example{"Cpp", HELLO_CPP}),
                          [](const auto& info) { return info.param.language; });
 
+// What an example prints where all goes well, but for the message itself.
+constexpr char kBeforeMessage[] = "configured, live backend: httppost\nsent, the daemon posts: {\n  ";
+constexpr char kAfterMessage[] = "\n}\nfinished\n";
+
+TEST(ExamplesDocumentTest, ShowsTheirOutput) {
+  std::istringstream output(std::string(kBeforeMessage) + "..." + kAfterMessage);
+  std::string shown;
+  for (std::string line; std::getline(output, line);) shown += "    " + line + "\n";
+  EXPECT_THAT(readWholeFile(std::string(kSourceDirectory) + "/docs/client-library.md"), HasSubstr(shown));
+}
+
 TEST_P(ExamplesTest, TheMessageArrivesAndEachStepIsTold) {
   ASSERT_TRUE(instance.start());
   const auto run = hello();
   EXPECT_EQ(run.end.status, 0) << run.errors;
   EXPECT_THAT(run.errors, IsEmpty());
-  EXPECT_THAT(run.output, AllOf(StartsWith("configured, live backend: httppost\nsent, the daemon posts: {"),
-                                HasSubstr("\"greeting\""), EndsWith("}\nfinished\n")));
+  EXPECT_THAT(run.output,
+              AllOf(StartsWith(kBeforeMessage), HasSubstr("\"greeting\""), EndsWith(kAfterMessage)));
 
   const auto arrivals = lab.waitForEvents(4);
   EXPECT_THAT(kindsOf(arrivals), UnorderedElementsAre("0/0", "7/3", "0/2", "0/1"));
@@ -98,8 +110,8 @@ TEST_P(ExamplesTest, WithoutAStorebagItSaysWhereToLook) {
 TEST_P(ExamplesTest, WithoutADaemonItSaysThatNoneListens) {
   const auto run = hello();
   EXPECT_EQ(run.end.status, 1);
-  EXPECT_THAT(run.errors, AllOf(StartsWith("hello: "),
-                                HasSubstr("no daemon is listening at " + instance.socketPath() + ": start ")));
+  EXPECT_THAT(run.errors, AllOf(StartsWith("hello: "), HasSubstr("no daemon is listening at " +
+                                                                 instance.socketPath() + ": start ")));
   EXPECT_THAT(run.output, IsEmpty());
 }
 
