@@ -186,6 +186,8 @@ class Service final : public IpcListenerDelegate {
 
   // Set before start(): prepares each new session.
   std::function<void(RecordingSession&)> prepare = [](RecordingSession&) {};
+  // Set before start(): what starts the threads of connections.
+  ConnectionRegistry::CreateThread createThread = pthread_create;
   // How often memory was given back.
   std::atomic<size_t> trims{0};
   // What the listener said at its end.
@@ -264,8 +266,7 @@ class Service final : public IpcListenerDelegate {
       accepted_.push_back({connection, session});
       return 0;
     });
-    connection->resume();
-    return true;
+    return connection->resume();
   }
 
  private:
@@ -283,6 +284,7 @@ class Service final : public IpcListenerDelegate {
     options.limits = limits_;
     options.readCredentials = readCredentials_;
     options.clientFiles = clientFiles_;
+    options.createThread = createThread;
     options.trimHeap = [this] { ++trims; };
     options.callsLeftBehind = [this](size_t calls) { callsLeftBehind = calls; };
     listener_ = std::make_unique<SdBusListener>(event, std::move(options), entitlements_, log_);
