@@ -49,6 +49,18 @@ TEST_F(IpcLifecycleTest, AConnectionThatGetsNoThreadIsClosedAndNothingOfItRuns) 
   EXPECT_NE(next.call("StartConfig", ""), nullptr);
 }
 
+TEST_F(IpcLifecycleTest, AConnectionWithoutAnObjectToCallIsClosedAndNothingOfItRuns) {
+  service.exportsObjects = false;
+  service.start();
+  const RawClient client(service.path());
+  EXPECT_TRUE(isClosedByPeer(client.fd()));
+  EXPECT_TRUE(eventually([&] { return service.listener().connections() == 0; }));
+  EXPECT_TRUE(eventually([&] { return service.session() == nullptr && service.connection(0) == nullptr; }));
+  EXPECT_EQ(service.listener().threads(), 0U);
+  EXPECT_EQ(service.invalidations(), 0U);
+  EXPECT_TRUE(service.logged("IpcConnection: No object is exported to pid "));
+}
+
 TEST_F(IpcLifecycleTest, RepliesAfterTheConnectionsDeathAreHarmless) {
   std::promise<SentReply> held;
   service.prepare = [&held](RecordingSession& session) {

@@ -186,6 +186,8 @@ class Service final : public IpcListenerDelegate {
 
   // Set before start(): prepares each new session.
   std::function<void(RecordingSession&)> prepare = [](RecordingSession&) {};
+  // Set before start(): whether connections get an object to call.
+  bool exportsObjects = true;
   // Set before start(): what starts the threads of connections.
   ConnectionRegistry::CreateThread createThread = pthread_create;
   // How often memory was given back.
@@ -257,7 +259,7 @@ class Service final : public IpcListenerDelegate {
     }
     auto session = std::make_shared<RecordingSession>();
     prepare(*session);
-    connection->setExportedObject(session);
+    if (exportsObjects) connection->setExportedObject(session);
     connection->setRemoteObjectInterface();
     connection->setInterruptionHandler([this] { locked([this] { return ++interruptions_; }); });
     // Keeps the session until it has run, as the daemon's does.
