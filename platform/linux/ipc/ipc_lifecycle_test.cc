@@ -40,6 +40,7 @@ TEST_F(IpcLifecycleTest, AConnectionThatGetsNoThreadIsClosedAndNothingOfItRuns) 
   EXPECT_TRUE(eventually([&] { return service.session() == nullptr && service.connection(0) == nullptr; }));
   EXPECT_EQ(service.listener().threads(), 0U);
   EXPECT_EQ(service.invalidations(), 0U);
+  EXPECT_EQ(service.notServed(), 1U);
   EXPECT_EQ(service.interruptions(), 0U);
   EXPECT_TRUE(service.logged("IpcConnection: Closing the connection of pid "));
   EXPECT_TRUE(service.logged(": no thread can be started: Resource temporarily unavailable"));
@@ -58,6 +59,7 @@ TEST_F(IpcLifecycleTest, AConnectionWithoutAnObjectToCallIsClosedAndNothingOfItR
   EXPECT_TRUE(eventually([&] { return service.session() == nullptr && service.connection(0) == nullptr; }));
   EXPECT_EQ(service.listener().threads(), 0U);
   EXPECT_EQ(service.invalidations(), 0U);
+  EXPECT_EQ(service.notServed(), 1U);
   EXPECT_TRUE(service.logged("IpcConnection: No object is exported to pid "));
 }
 

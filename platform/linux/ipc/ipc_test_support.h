@@ -233,6 +233,10 @@ class Service final : public IpcListenerDelegate {
   size_t rejected() const {
     return locked([this] { return rejected_; });
   }
+  // Connections whose resume() was false.
+  size_t notServed() const {
+    return locked([this] { return notServed_; });
+  }
   size_t invalidations() const {
     return locked([this] { return invalidations_; });
   }
@@ -268,7 +272,9 @@ class Service final : public IpcListenerDelegate {
       accepted_.push_back({connection, session});
       return 0;
     });
-    return connection->resume();
+    if (connection->resume()) return true;
+    locked([this] { return ++notServed_; });
+    return false;
   }
 
  private:
@@ -310,6 +316,7 @@ class Service final : public IpcListenerDelegate {
   mutable std::mutex mutex_;
   std::vector<Accepted> accepted_;
   size_t rejected_ = 0;
+  size_t notServed_ = 0;
   size_t invalidations_ = 0;
   size_t interruptions_ = 0;
   std::thread thread_;
