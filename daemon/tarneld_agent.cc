@@ -10,6 +10,30 @@ constexpr char kEntitlement[] = "com.orvane.private.tarneld";
 
 }  // namespace
 
+// A session's place on the list of live ones. It goes with this unless it is kept, which is when the
+// connection has a thread: only then will there be an invalidation, which takes the session off again.
+// Whatever stands in the way of that, nothing but the list knows the session yet, so that the agent's lock is
+// not wanted.
+class TarneldAgent::ListEntry {
+ public:
+  ListEntry(TarneldAgent& agent, const std::shared_ptr<TarneldSession>& session)
+      : agent_(agent), session_(session) {
+    agent_.addSession(session_);
+  }
+  ListEntry(const ListEntry&) = delete;
+  ListEntry& operator=(const ListEntry&) = delete;
+  ~ListEntry() {
+    if (!isKept_) agent_.removeSession(*session_);
+  }
+
+  void keep() noexcept { isKept_ = true; }
+
+ private:
+  TarneldAgent& agent_;
+  const std::shared_ptr<TarneldSession> session_;
+  bool isKept_ = false;
+};
+
 std::shared_ptr<TarneldAgent> TarneldAgent::init(const Dependencies& dependencies,
                                                  BackendFactory backendFactory,
                                                  StorebagFetcher storebagFetcher) {
@@ -41,7 +65,7 @@ bool TarneldAgent::shouldAcceptNewConnection(IpcListener& /*listener*/,
       TarneldSession::initWithSessionDelegate(dependencies_, shared_from_this(), connection, backendFactory_);
   connection->setExportedObject(session);
   connection->setRemoteObjectInterface();
-  addSession(session);
+  ListEntry entry(*this, session);
   connection->setInterruptionHandler([&log, weak = std::weak_ptr<TarneldSession>(session)] {
     if (const auto interrupted = weak.lock()) {
       TARNEL_LOG(log, debug, "listener: LNK connection to %s was interrupted",
@@ -50,8 +74,9 @@ bool TarneldAgent::shouldAcceptNewConnection(IpcListener& /*listener*/,
   });
   connection->setInvalidationHandler(
       [agent = shared_from_this(), session] { agent->connectionInvalidated(session); });
-  connection->resume();
-  return true;
+  const bool isServed = connection->resume();
+  if (isServed) entry.keep();
+  return isServed;
 }
 
 void TarneldAgent::connectionInvalidated(const std::shared_ptr<TarneldSession>& session) {

@@ -47,8 +47,11 @@ struct StorebagCacheEntry {
 // the process open while there is one, and is the sessions' only way to the storebag cache and to one
 // another.
 //
-// Threads: any. shouldAcceptNewConnection takes only the list's lock and so never waits for a storebag fetch,
-// which holds the agent's lock for up to 15 seconds. The two locks are never held together.
+// Threads: any. shouldAcceptNewConnection takes only the list's lock, also for a connection that cannot be
+// served, and so never waits for a storebag fetch, which holds the agent's lock for up to 15 seconds. Who
+// takes the agent's lock waits for one: the operations of TarneldSessionDelegate that say so, and the end of
+// an accepted connection; all of these run on connections' threads, never on the one that accepts. The two
+// locks are never held together.
 class TarneldAgent final : public IpcListenerDelegate,
                            public TarneldSessionDelegate,
                            public std::enable_shared_from_this<TarneldAgent> {
@@ -89,10 +92,8 @@ class TarneldAgent final : public IpcListenerDelegate,
   std::unordered_map<std::string, std::vector<std::shared_ptr<TarneldSession>>> correlatedSessions();
 
  private:
+  class ListEntry;
   using SessionList = std::vector<std::shared_ptr<TarneldSession>>;
-
-  static std::shared_ptr<TarneldSession> getFirstSessionWithHierarchy(int64_t hierarchy,
-                                                                      const SessionList& sessionList);
 
   void connectionInvalidated(const std::shared_ptr<TarneldSession>& session);
   void addSession(const std::shared_ptr<TarneldSession>& session);

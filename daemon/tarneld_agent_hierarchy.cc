@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <utility>
 
+#include "daemon/hierarchy_walks.h"
 #include "daemon/tarneld_agent.h"
 #include "util/device_facts.h"
 
@@ -13,18 +14,6 @@ bool lists(const std::vector<std::shared_ptr<TarneldSession>>& sessionList, cons
   return std::any_of(
       sessionList.begin(), sessionList.end(),
       [&session](const std::shared_ptr<TarneldSession>& candidate) { return candidate.get() == &session; });
-}
-
-// The lowest level above this one that any session stands at. Levels come out of a document and may be any
-// numbers: walks go from session to session, never from number to number.
-std::optional<int32_t> nextLevel(const std::vector<std::shared_ptr<TarneldSession>>& sessionList,
-                                 int32_t level) {
-  std::optional<int32_t> next;
-  for (const auto& session : sessionList) {
-    const int32_t candidate = session->getSessionHierarchy();
-    if (candidate > level && (!next || candidate < *next)) next = candidate;
-  }
-  return next;
 }
 
 }  // namespace
@@ -47,15 +36,6 @@ void TarneldAgent::userInfoUpdatedForSession(TarneldSession& session) {
   filedUnder_.emplace(&session, key);
 }
 
-std::shared_ptr<TarneldSession> TarneldAgent::getFirstSessionWithHierarchy(int64_t hierarchy,
-                                                                           const SessionList& sessionList) {
-  const auto found = std::find_if(sessionList.begin(), sessionList.end(),
-                                  [hierarchy](const std::shared_ptr<TarneldSession>& candidate) {
-                                    return candidate->getSessionHierarchy() == hierarchy;
-                                  });
-  return found == sessionList.end() ? nullptr : *found;
-}
-
 std::shared_ptr<TarneldSession> TarneldAgent::parentSessionForChild(TarneldSession& child)
     TARNEL_NO_THREAD_SAFETY_ANALYSIS {
   Log& log = dependencies_.log;
@@ -75,7 +55,7 @@ std::shared_ptr<TarneldSession> TarneldAgent::parentSessionForChild(TarneldSessi
                child.sessionID(), key.c_str());
     return nullptr;
   }
-  auto parent = getFirstSessionWithHierarchy(int64_t{level} - 1, *list);
+  auto parent = getFirstSessionWithHierarchy(int64_t{level} - 1, firstOfLevelsBeside(child, *list));
   if (parent == nullptr) {
     TARNEL_LOG(log, information,
                "parentSessionForChild: Unable to find session with hierarchy of %d for userInfoKey '%s'",
@@ -104,9 +84,10 @@ MaybeString TarneldAgent::parentSessionIDStringForSession(TarneldSession& sessio
                session.sessionID(), key.c_str());
     return std::nullopt;
   }
+  const auto others = firstOfLevelsBeside(session, *list);
   MaybeString text;
   for (int64_t level = int64_t{hierarchy} - 1; level >= 0; --level) {
-    const auto ancestor = getFirstSessionWithHierarchy(level, *list);
+    const auto ancestor = getFirstSessionWithHierarchy(level, others);
     if (ancestor == nullptr) {
       TARNEL_LOG(log, information,
                  "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): "
@@ -131,11 +112,7 @@ std::shared_ptr<TarneldSession> TarneldAgent::getAncestorWithAggregatorForSessio
   if (hierarchy < 1) return nullptr;
   const SessionList* list = correlatedList(userInfoKey(userInfo));
   if (list == nullptr) return nullptr;
-  for (auto level = nextLevel(*list, -1); level && *level < hierarchy; level = nextLevel(*list, *level)) {
-    auto ancestor = getFirstSessionWithHierarchy(*level, *list);
-    if (ancestor->hasAggregator()) return ancestor;
-  }
-  return nullptr;
+  return topMostAggregator(hierarchy, firstOfLevelsBeside(session, *list));
 }
 
 void TarneldAgent::updateDownstreamSessions(TarneldSession& session) {

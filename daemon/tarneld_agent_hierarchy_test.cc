@@ -21,6 +21,20 @@ class AgentHierarchy : public AgentTest {
   static const TarnelBackend& backendOf(const Client& client) {
     return *client.session->backends().find(kTarnelBackendHTTPPost);
   }
+  // Runs the step once, right after the line.
+  void whenLogged(const std::string& line, std::function<void()> step) {
+    world.log.whenWritten = [this, line, step = std::move(step)](std::string_view text) {
+      if (text != line) return;
+      const auto once = step;
+      world.log.whenWritten = nullptr;
+      once();
+    };
+  }
+  // The session decides its level anew.
+  void standAt(const Client& client, int32_t level) {
+    backends.scripts[kTarnelBackendHTTPPost].hierarchy = level;
+    client.session->updateReportingStates();
+  }
 };
 
 TEST_F(AgentHierarchy, SessionsAreFiledUnderTheLowerCasedNames) {
@@ -165,6 +179,27 @@ TEST_F(AgentHierarchy, LevelsOfAnyNumberEndTheWalksSoon) {
   EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*highest.session), nullptr);
 }
 
+// A session that configures changes its level on its own thread, also in the middle of another's walk.
+
+TEST_F(AgentHierarchy, ASessionThatRisesDuringAWalkIsNotItsOwnParent) {
+  const Client top = start("A", 1, 0);
+  const Client riser = start("B", 2, 2);
+  whenLogged("parentSessionForChild: Checking userInfoKey 'phone:call' for session 2",
+             [this, &riser] { standAt(riser, 1); });
+  EXPECT_EQ(agent->parentSessionForChild(*riser.session), nullptr);
+  EXPECT_EQ(riser.session->getSessionHierarchy(), 1);
+  EXPECT_EQ(agent->parentSessionForChild(*riser.session), top.session);
+}
+
+TEST_F(AgentHierarchy, ASessionThatRisesDuringAWalkIsNotItsOwnAncestor) {
+  const Client top = start("A", 1, 0);
+  const Client riser = start("B", 2, 2);
+  whenLogged("parentSessionIDStringForSession: Checking userInfoKey 'phone:call' for session 2",
+             [this, &riser] { standAt(riser, 1); });
+  EXPECT_FALSE(agent->parentSessionIDStringForSession(*riser.session));
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*riser.session), "A");
+}
+
 // Aggregation.
 
 TEST_F(AgentHierarchy, AncestorIsTheTopMostWithAnAggregator) {
@@ -219,6 +254,18 @@ TEST_F(AgentHierarchy, MessageOfAChildReachesTheAncestorsClient) {
       received.back().payload,
       (Dictionary{{"a", 1}, {kTarnelUserInfoClientName, "Phone"}, {kTarnelUserInfoServiceName, "Call"}}));
   EXPECT_THAT(child.connection->sentToClient(), IsEmpty());
+}
+
+TEST_F(AgentHierarchy, AMessageOfAChildWithoutPayloadReachesTheAncestorsClientWithNone) {
+  const Client parent = start("A", 1, 0, true);
+  const Client child = start("B", 2, 1);
+  const size_t before = parent.connection->sentToClient().size();
+  child.session->sendMessageWithCategory(3, 4, std::nullopt);
+  const auto received = parent.connection->sentToClient();
+  ASSERT_EQ(received.size(), before + 1);
+  EXPECT_EQ(received.back().messageInfo, info(2, 8));
+  EXPECT_EQ(received.back().category, 3);
+  EXPECT_EQ(received.back().payload, std::nullopt);
 }
 
 // Downstream.

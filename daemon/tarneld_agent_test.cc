@@ -1,6 +1,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <new>
 #include <thread>
 
 #include "daemon/test_agent_fixture.h"
@@ -136,6 +137,34 @@ TEST_F(AgentAcceptance, AcceptanceDoesNotWaitForTheAgentsLock) {
   const LockGuard guard(agent->agentLock());
   std::thread([this] { connect("<meanwhile>"); }).join();
   EXPECT_EQ(agent->sessionList().size(), 1U);
+}
+
+TEST_F(AgentAcceptance, AConnectionThatCannotBeServedLeavesNoSessionAndWaitsForNoLock) {
+  const auto connection = entitledConnection();
+  connection->canBeServed = false;
+  const LockGuard guard(agent->agentLock());
+  std::thread([this, &connection] {
+    EXPECT_FALSE(agent->shouldAcceptNewConnection(listener, connection));
+    const std::weak_ptr<ClientSessionInterface> session = connection->exportedObject;
+    // What a listener does with a connection that is not accepted.
+    connection->invalidationHandler = nullptr;
+    connection->exportedObject.reset();
+    EXPECT_TRUE(session.expired());
+  }).join();
+  EXPECT_THAT(agent->sessionList(), IsEmpty());
+  EXPECT_EQ(world.keepAlive.begun, 1);
+  EXPECT_EQ(world.keepAlive.ended, 1);
+  EXPECT_THAT(world.log.startingWith("listener: LNK connection"), IsEmpty());  // it is not invalidated
+}
+
+TEST_F(AgentAcceptance, AnAcceptanceThatThrowsLeavesNoSession) {
+  const auto connection = entitledConnection();
+  connection->whenResumed = [] { throw std::bad_alloc(); };
+  EXPECT_THROW(agent->shouldAcceptNewConnection(listener, connection), std::bad_alloc);
+  EXPECT_THAT(agent->sessionList(), IsEmpty());
+  EXPECT_EQ(world.keepAlive.ended, 1);
+  connection->invalidationHandler = nullptr;
+  connection->exportedObject.reset();
 }
 
 TEST_F(AgentAcceptance, InvalidationTakesTheTwoLocksOneAfterTheOther) {

@@ -1,7 +1,5 @@
 #include "session/backend_set.h"
 
-#include <exception>
-
 #include "client/include/tarnel/keys.h"
 #include "util/device_facts.h"
 
@@ -73,21 +71,9 @@ void introduce(TarnelBackend& backend, const Identity& identity, const MaybeDict
 
 }  // namespace
 
-TemporaryBackends::~TemporaryBackends() {
-  for (const auto& [name, backend] : backends_) cleanUp(name, *backend);
-}
-
-void TemporaryBackends::cleanUp(const std::string& name, TarnelBackend& backend) noexcept {
-  const auto report = [this, &name](const char* why) {
-    TARNEL_LOG(log_, error, "%s: %s was not cleaned up in order: %s", operation_, name.c_str(), why);
-  };
-  try {
-    backend.cleanup();
-  } catch (const std::exception& failure) {
-    report(failure.what());
-  } catch (...) {
-    report("unknown failure");
-  }
+void cleanUpEach(Log& log, const BackendSet& backends) noexcept {
+  withEach(log, "cleanup", backends,
+           [](const std::string& /*name*/, TarnelBackend& each) { each.cleanup(); });
 }
 
 std::optional<BackendSet> createBackends(const Dependencies& dependencies, const BackendFactory& factory,
@@ -102,7 +88,7 @@ std::optional<BackendSet> createBackends(const Dependencies& dependencies, const
     return std::nullopt;
   }
   const Identity identity = readIdentity(dependencies, *sessionInfo);
-  TemporaryBackends made(dependencies.log, "createBackends");
+  TemporaryBackends made(dependencies.log);
   size_t unknown = 0;
   for (const auto& [name, profile] : *storebag) {
     if (!TarnelBackend::isBackendName(name) && ++unknown > kMaxUnknownNames) continue;

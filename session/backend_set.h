@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "backends/tarnel_backend.h"
+#include "session/separately.h"
 #include "util/dependencies.h"
 
 namespace tarnel {
@@ -45,16 +46,35 @@ class BackendSet {
   std::vector<Entry> entries_;
 };
 
-// Backends that are cleaned up with this, each whatever another's clean-up comes to, unless they are
-// released. What clean-up throws is logged under the operation's name.
+// Takes the step(name, backend) with every backend of the set, each whatever another's comes to.
+// operation: for the log, where one fails.
+template <class Step>
+void withEach(Log& log, const char* operation, const BackendSet& backends, Step step) {
+  for (const auto& [name, backend] : backends) {
+    separately(log, operation, name.c_str(), [&step, &name = name, &each = *backend] { step(name, each); });
+  }
+}
+
+// What one backend answers to send(). A failure counts as an error that it returned.
+template <class Send>
+MaybeSentObject answerOf(Log& log, const char* operation, const std::string& name, Send send) {
+  MaybeSentObject sent;
+  if (MaybeError failure = separately(log, operation, name.c_str(), [&sent, &send] { sent = send(); })) {
+    sent = *std::move(failure);
+  }
+  return sent;
+}
+
+void cleanUpEach(Log& log, const BackendSet& backends) noexcept;
+
+// Backends that are cleaned up with this, unless they are released.
 class TemporaryBackends {
  public:
-  // operation: lasts as long as this does.
-  TemporaryBackends(Log& log, const char* operation, BackendSet backends = {})
-      : log_(log), operation_(operation), backends_(std::move(backends)) {}
+  explicit TemporaryBackends(Log& log, BackendSet backends = {})
+      : log_(log), backends_(std::move(backends)) {}
   TemporaryBackends(const TemporaryBackends&) = delete;
   TemporaryBackends& operator=(const TemporaryBackends&) = delete;
-  ~TemporaryBackends();
+  ~TemporaryBackends() { cleanUpEach(log_, backends_); }
 
   const BackendSet& backends() const noexcept { return backends_; }
   void append(std::string name, std::shared_ptr<TarnelBackend> backend) {
@@ -63,10 +83,7 @@ class TemporaryBackends {
   BackendSet release() noexcept { return std::exchange(backends_, {}); }
 
  private:
-  void cleanUp(const std::string& name, TarnelBackend& backend) noexcept;
-
   Log& log_;
-  const char* const operation_;
   BackendSet backends_;
 };
 

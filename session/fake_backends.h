@@ -45,7 +45,13 @@ struct BackendScript {
   MaybeError flushError;
   bool holdFlush = false;
   bool uploads = false;
+  // Each throws after it was noted in the journal, a flush before or after it has answered.
   bool sendThrows = false;
+  bool flushThrows = false;
+  bool flushThrowsAfterwards = false;
+  bool uploadThrows = false;
+  bool updateStateThrows = false;
+  bool correlatedSessionIDThrows = false;
   bool cleanupThrows = false;
   bool cleanupThrowsNumber = false;
   bool setUpThrows = false;
@@ -84,6 +90,7 @@ class FakeBackend final : public TarnelBackend {
   }
   void updateState() override {
     journal_.add(name() + " updateState");
+    if (script_.updateStateThrows) throw std::runtime_error("update went wrong");
     setHierarchy(script_.hierarchy);
     setSamplingThreshold(script_.threshold);
     setState(script_.decides);
@@ -95,6 +102,7 @@ class FakeBackend final : public TarnelBackend {
   }
   void setCorrelatedSessionID(const MaybeString& correlatedSessionID) override {
     journal_.add(name() + " setCorrelatedSessionID");
+    if (script_.correlatedSessionIDThrows) throw std::runtime_error("label went wrong");
     TarnelBackend::setCorrelatedSessionID(correlatedSessionID);
     for (Sent& event : sent) event.sessionID = correlatedSessionID;
   }
@@ -108,19 +116,23 @@ class FakeBackend final : public TarnelBackend {
   }
   MaybeString flushMessagesWithCompletion(FlushCompletion completion) override {
     journal_.add(name() + " flush");
+    if (script_.flushThrows) throw std::runtime_error("flush went wrong");
     if (script_.holdFlush) {
       heldFlushes.push_back(std::move(completion));
     } else {
       completion(script_.flushText, script_.flushError);
     }
+    if (script_.flushThrowsAfterwards) throw std::runtime_error("flush went wrong");
     return script_.flushText;
   }
   bool uploadFileAtPath(const std::string& path, const std::string& extensionToken) override {
     journal_.add(name() + " upload " + path + " with " + extensionToken);
+    if (script_.uploadThrows) throw std::runtime_error("upload went wrong");
     return script_.uploads;
   }
   bool uploadLogData(const Array& logData) override {
     journal_.add(name() + " uploadLogData of " + std::to_string(logData.size()));
+    if (script_.uploadThrows) throw std::runtime_error("upload went wrong");
     return script_.uploads;
   }
 

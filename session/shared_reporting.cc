@@ -45,7 +45,7 @@ void SharedReporting::publish(const BackendSet& backends) {
   hierarchy_.store(hierarchyOf(backends), std::memory_order_relaxed);
 }
 
-void SharedReporting::applyNotes(const BackendSet& backends) {
+void SharedReporting::applyNotes(Log& log, const BackendSet& backends) {
   if (!noted_.load(std::memory_order_acquire)) return;
   std::map<std::string, std::optional<Value>, std::less<>> thresholds;
   MaybeString correlatedSessionID;
@@ -55,11 +55,12 @@ void SharedReporting::applyNotes(const BackendSet& backends) {
     correlatedSessionID.swap(notedCorrelatedSessionID_);
     noted_.store(false, std::memory_order_relaxed);
   }
-  for (const auto& [name, backend] : backends) {
-    const auto threshold = thresholds.find(name);
-    if (threshold != thresholds.end()) backend->setSamplingThreshold(threshold->second);
-    if (correlatedSessionID) backend->setCorrelatedSessionID(correlatedSessionID);
-  }
+  withEach(log, "applyNotes", backends,
+           [&thresholds, &correlatedSessionID](const std::string& name, TarnelBackend& each) {
+             const auto threshold = thresholds.find(name);
+             if (threshold != thresholds.end()) each.setSamplingThreshold(threshold->second);
+             if (correlatedSessionID) each.setCorrelatedSessionID(correlatedSessionID);
+           });
 }
 
 void SharedReporting::setUserInfo(const MaybeDictionary& userInfo) {

@@ -46,8 +46,9 @@ class SharedReporting {
   void replaceBackends(const BackendSet& backends);
   // Owner: shows what the backends have just decided on their own. Thresholds noted before that are void.
   void publish(const BackendSet& backends);
-  // Owner: applies what other threads noted. Costs one atomic read when there is nothing.
-  void applyNotes(const BackendSet& backends);
+  // Owner: applies what other threads noted, to each backend whatever another comes to. Costs one atomic read
+  // when there is nothing.
+  void applyNotes(Log& log, const BackendSet& backends);
   // Owner: shows the user info. The stored copy shares its storage with the argument.
   void setUserInfo(const MaybeDictionary& userInfo);
 

@@ -27,11 +27,11 @@ TEST_F(SharedReportingTest, NotesWaitForTheOwnerAndAreAppliedOnce) {
   reporting_.noteCorrelatedSessionID("TOP.OWN");
   EXPECT_FALSE(backend_->samplingThreshold());
   EXPECT_FALSE(backend_->combinedSessionIDString());
-  reporting_.applyNotes(backends_);
+  reporting_.applyNotes(world_.log, backends_);
   EXPECT_EQ(backend_->samplingThreshold(), Value(0.25));
   EXPECT_EQ(backend_->combinedSessionIDString(), "TOP.OWN");
   backend_->setSamplingThreshold(Value(0.5));
-  reporting_.applyNotes(backends_);
+  reporting_.applyNotes(world_.log, backends_);
   EXPECT_EQ(backend_->samplingThreshold(), Value(0.5));
 }
 
@@ -40,7 +40,7 @@ TEST_F(SharedReportingTest, TheOwnersNewDecisionVoidsAThresholdNotedMeanwhileBut
   reporting_.noteCorrelatedSessionID("TOP.OWN");
   backend_->setSamplingThreshold(Value(0.5));
   reporting_.publish(backends_);
-  reporting_.applyNotes(backends_);
+  reporting_.applyNotes(world_.log, backends_);
   EXPECT_EQ(backend_->samplingThreshold(), Value(0.5));
   EXPECT_EQ(reporting_.reports().at(0).samplingThreshold, Value(0.5));
   EXPECT_EQ(backend_->combinedSessionIDString(), "TOP.OWN");
@@ -50,7 +50,7 @@ TEST_F(SharedReportingTest, ReplacedBackendsVoidEveryNote) {
   reporting_.noteSamplingThreshold(kTarnelBackendHTTPPost, Value(0.25));
   reporting_.noteCorrelatedSessionID("TOP.OWN");
   reporting_.replaceBackends(backends_);
-  reporting_.applyNotes(backends_);
+  reporting_.applyNotes(world_.log, backends_);
   EXPECT_FALSE(backend_->samplingThreshold());
   EXPECT_FALSE(backend_->combinedSessionIDString());
 }

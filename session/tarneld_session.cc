@@ -1,10 +1,10 @@
 #include "session/tarneld_session.h"
 
-#include <exception>
 #include <utility>
 
 #include "client/include/tarnel/keys.h"
 #include "platform/cryptography.h"
+#include "session/separately.h"
 #include "util/device_facts.h"
 
 namespace tarnel {
@@ -54,9 +54,15 @@ TarneldSession::~TarneldSession() {
 
 void TarneldSession::dealloc() noexcept {
   if (std::exchange(ended_, true)) return;
-  TARNEL_LOG(dependencies_.log, debug, "dealloc: TarneldSession dealloc: %u", sessionID());
-  attempt(&TarneldSession::sayFarewell);
-  attempt(&TarneldSession::cleanUp);
+  Log& log = dependencies_.log;
+  TARNEL_LOG(log, debug, "dealloc: TarneldSession dealloc: %u", sessionID());
+  separately(log, "dealloc", "the stop message", [this] { sendStopMessage(); });
+  separately(log, "dealloc", "the last flush", [this] { flushMessagesWithCompletion(nullptr); });
+  separately(log, "dealloc", "the end of aggregation", [this] { shutdownSessionAggregation(); });
+  _sessionInfo.reset();
+  setUserInfo(std::nullopt);
+  _frameworks.reset();
+  cleanUpEach(log, _backends);
   reporting_.replaceBackends({});
   _backends = {};
   _periodicServices.reset();
@@ -65,29 +71,10 @@ void TarneldSession::dealloc() noexcept {
   _sessionDelegate.reset();
 }
 
-// Whatever one step comes to, the next is done.
-void TarneldSession::attempt(void (TarneldSession::*step)()) noexcept {
-  try {
-    (this->*step)();
-  } catch (const std::exception& failure) {
-    TARNEL_LOG(dependencies_.log, error, "dealloc: session %u did not end in order: %s", sessionID(),
-               failure.what());
-  }
-}
-
-void TarneldSession::sayFarewell() {
+void TarneldSession::sendStopMessage() {
   Dictionary payload;
   if (_storebagVersion) payload.set("StorebagVersion", *_storebagVersion);
   internalSendMessage(payload, dependencies_.clock.timeOfDay(), kInternalMethod, kStop);
-  flushMessagesWithCompletion(nullptr);
-  shutdownSessionAggregation();
-}
-
-void TarneldSession::cleanUp() {
-  _sessionInfo.reset();
-  setUserInfo(std::nullopt);
-  _frameworks.reset();
-  for (const auto& [name, backend] : currentBackends()) backend->cleanup();
 }
 
 void TarneldSession::setSessionInfo(MaybeDictionary sessionInfo, MaybeDictionary userInfo,

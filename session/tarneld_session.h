@@ -155,9 +155,7 @@ class TarneldSession final : public ClientSessionInterface,
   MaybeDictionary withUserInfo(const MaybeDictionary& payload) const;
   // The backends as they are to be used now: with everything applied that other sessions noted.
   const BackendSet& currentBackends();
-  void attempt(void (TarneldSession::*step)()) noexcept;
-  void sayFarewell();
-  void cleanUp();
+  void sendStopMessage();
 
   const Dependencies& dependencies_;
   BackendFactory backendFactory_;
@@ -169,7 +167,7 @@ class TarneldSession final : public ClientSessionInterface,
   MaybeDictionary _userInfo;  // the owner's copy of what reporting_ shows
   std::optional<Array> _frameworks;
   BackendSet _backends;
-  std::shared_ptr<void> _periodicServices;  // held until the end; nothing fills it
+  std::shared_ptr<void> _periodicServices;  // of the session's time; no service is periodic now
   std::shared_ptr<TarneldSessionDelegate> _sessionDelegate;
   std::string _sessionIDString;
   MaybeString _storebagVersion;

@@ -26,7 +26,7 @@ bool sameNames(const MaybeDictionary& a, const MaybeDictionary& b) {
 }  // namespace
 
 const BackendSet& TarneldSession::currentBackends() {
-  reporting_.applyNotes(_backends);
+  reporting_.applyNotes(dependencies_.log, _backends);
   return _backends;
 }
 
@@ -39,17 +39,19 @@ void TarneldSession::createBackendsWithStorebag(const MaybeDictionary& storebag)
   for (const auto& [name, backend] : backends) backend->setCombinedSessionIDString(_sessionIDString);
   // A client that configures its session a second time loses nothing of the first.
   if (!_backends.empty()) internalFlushMessagesWithCompletion(nullptr);
-  for (const auto& [name, backend] : _backends) backend->cleanup();
+  cleanUpEach(dependencies_.log, _backends);
   reporting_.replaceBackends(backends);
   _backends = std::move(backends);
 }
 
 void TarneldSession::updateUserInfoForBackends() {
-  for (const auto& [name, backend] : currentBackends()) backend->setUserInfoDict(_userInfo);
+  withEach(dependencies_.log, "updateUserInfoForBackends", currentBackends(),
+           [this](const std::string& /*name*/, TarnelBackend& each) { each.setUserInfoDict(_userInfo); });
 }
 
 void TarneldSession::updateReportingStates() {
-  for (const auto& [name, backend] : currentBackends()) backend->updateState();
+  withEach(dependencies_.log, "updateReportingStates", currentBackends(),
+           [](const std::string& /*name*/, TarnelBackend& each) { each.updateState(); });
   reporting_.publish(_backends);
 }
 
@@ -98,7 +100,7 @@ void TarneldSession::updateSessionWithDefaultSessionInfo() {
   _sessionDelegate->userInfoUpdatedForSession(*this);
   updateReportingStates();
   _sessionDelegate->updateDownstreamSessions(*this);
-  reporting_.applyNotes(_backends);
+  reporting_.applyNotes(dependencies_.log, _backends);
 }
 
 void TarneldSession::receivedUserInfo(const MaybeDictionary& userInfo) {

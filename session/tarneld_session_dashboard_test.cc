@@ -2,8 +2,8 @@
 
 #include "session/test_session_fixture.h"
 
-// Sessions and the real dashboard backend. A session dispatches through the flagged send, the dashboard has
-// only an unflagged one: they are meant to miss each other.
+// Sessions and the real dashboard backend. A session dispatches through the flagged send and the dashboard
+// has only an unflagged one, so that no message of a client leaves the device as a datagram.
 
 namespace tarnel::fake {
 namespace {

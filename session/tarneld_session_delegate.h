@@ -17,7 +17,8 @@ class AgentLock : public RecursiveLock {};
 
 // A session's way to the agent: the storebag cache and the other sessions.
 //
-// Threads: any. Which operations take the agent's lock themselves is said at each.
+// Threads: any. Whether an operation takes the agent's lock, and so waits while another session fetches a
+// storebag, is said at each.
 class TarneldSessionDelegate {
  public:
   TarneldSessionDelegate() = default;
@@ -30,15 +31,21 @@ class TarneldSessionDelegate {
   virtual std::optional<Dictionary> storebagForSession(TarneldSession& session) = 0;
   // storebagVersionForSession: takes the lock. Never fetches.
   virtual MaybeString storebagVersionForSession(TarneldSession& session) = 0;
-  // parentSessionIDStringForSession: takes the lock. The ancestors' ids, top first, joined by full stops.
+  // parentSessionIDStringForSession: takes the lock, unless the session's level is 0. The ancestors' ids, top
+  // first, joined by full stops.
   virtual MaybeString parentSessionIDStringForSession(TarneldSession& session) = 0;
-  // userInfoUpdatedForSession: takes the lock. Files the session under its correlation key.
+  // userInfoUpdatedForSession: takes the lock, unless the session has no user info. Files the session under
+  // its correlation key.
   virtual void userInfoUpdatedForSession(TarneldSession& session) = 0;
-  // getAncestorWithAggregatorForSession: the caller holds the lock where the session's level is 1 or more.
+  // getAncestorWithAggregatorForSession: takes no lock. The caller holds it where the session has user info
+  // and stands at level 1 or more; without the one or the other nothing but the session itself is looked at,
+  // and there is no ancestor. On the session's own thread: another's could see level and user info change
+  // between the decision to lock and the look.
   virtual std::shared_ptr<TarneldSession> getAncestorWithAggregatorForSession(TarneldSession& session) = 0;
-  // updateDownstreamSessions: takes the lock. Re-syncs this session and the deeper ones of its key.
+  // updateDownstreamSessions: takes the lock, unless the session has no user info. Re-syncs this session and
+  // the deeper ones of its key.
   virtual void updateDownstreamSessions(TarneldSession& session) = 0;
-  // parentSessionForChild: the caller holds the lock.
+  // parentSessionForChild: takes no lock; the caller holds it.
   virtual std::shared_ptr<TarneldSession> parentSessionForChild(TarneldSession& child) = 0;
 
   virtual AgentLock& agentLock() = 0;

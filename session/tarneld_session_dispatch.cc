@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "client/include/tarnel/keys.h"
+#include "session/separately.h"
 #include "session/tarneld_session.h"
 #include "util/message_log.h"
 
@@ -67,7 +68,11 @@ MaybeSentObject TarneldSession::dispatch(uint16_t category, uint16_t type, const
   aggregateMessage(_sessionInfo, secondsFromTimeValue(now), category, type, payload);
   MaybeSentObject result;
   for (const auto& [name, backend] : currentBackends()) {
-    MaybeSentObject sent = backend->sendMessage(payload, now, Method{category}, RespCode{type}, flag);
+    MaybeSentObject sent =
+        answerOf(dependencies_.log, "sendMessageWithDictionary", name,
+                 [&payload, &now, category, type, flag, &each = *backend] {
+                   return each.sendMessage(payload, now, Method{category}, RespCode{type}, flag);
+                 });
     if (!sent) continue;
     std::string storage;
     writeToLogFile(dependencies_, "[%s -> sendMessageWithDictionary] %s", name.c_str(),
@@ -111,12 +116,16 @@ void TarneldSession::aggregateMessage(const MaybeDictionary& messageInfo, double
 
 void TarneldSession::sendToAggregator(const MaybeDictionary& messageInfo, double timestamp, uint16_t category,
                                       uint16_t type, const MaybeDictionary& payload) {
-  const auto proxy =
-      _connection->remoteObjectProxyWithErrorHandler([&log = dependencies_.log](const Error& error) {
-        TARNEL_LOG(log, error, "sendMessageWithDictionary: Failed to get remote object proxy: %s",
-                   error.description().c_str());
-      });
-  if (proxy != nullptr) proxy->sendMessageToClient(messageInfo, timestamp, category, type, payload);
+  const auto send = [this, &messageInfo, timestamp, category, type, &payload] {
+    const auto proxy =
+        _connection->remoteObjectProxyWithErrorHandler([&log = dependencies_.log](const Error& error) {
+          TARNEL_LOG(log, error, "sendMessageWithDictionary: Failed to get remote object proxy: %s",
+                     error.description().c_str());
+        });
+    if (proxy != nullptr) proxy->sendMessageToClient(messageInfo, timestamp, category, type, payload);
+  };
+  // Backends get a message, and a walk reaches the other sessions, also where a client cannot be told.
+  separately(dependencies_.log, "sendToAggregator", "the call of the client", send);
 }
 
 void TarneldSession::shutdownSessionAggregation() {

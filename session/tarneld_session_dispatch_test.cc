@@ -1,6 +1,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <stdexcept>
+
 #include "session/test_session_fixture.h"
 
 namespace tarnel::fake {
@@ -163,6 +165,19 @@ TEST_F(SessionDispatch, OtherBackendsAreOnlyLogged) {
   EXPECT_EQ(messageLog().size(), 4U);
 }
 
+TEST_F(SessionDispatch, ABackendThatThrowsKeepsTheMessageFromNoOther) {
+  offer({"dravik", "httppost", "dashboard"});
+  configureAndStart();
+  for (const char* name : {"dravik", "httppost"}) backends.scripts[name].sendThrows = true;
+  EXPECT_EQ(send(), MaybeSentObject(failure("send went wrong")));
+  EXPECT_THAT(backends.journal.lines(),
+              ElementsAre("dravik send 3/4", "httppost send 3/4", "dashboard send 3/4"));
+  EXPECT_TRUE(logged(LogLevel::error, "sendMessageWithDictionary: dravik failed: send went wrong"));
+  EXPECT_THAT(messageLog(),
+              ElementsAre("[dravik -> sendMessageWithDictionary] TarnelErrorDomain (-1): send went wrong",
+                          "[httppost -> sendMessageWithDictionary] TarnelErrorDomain (-1): send went wrong"));
+}
+
 TEST_F(SessionDispatch, ATextIsHandedToTheClientAsItStands) {
   offer({"httppost"});
   backends.scripts["httppost"].sends = kText;
@@ -206,6 +221,30 @@ TEST_F(SessionDispatch, NoPayloadReachesTheAggregatorAsNone) {
   configureAndStart(true);
   send(std::nullopt);
   EXPECT_FALSE(connection->sentToClient().back().payload);
+}
+
+TEST_F(SessionDispatch, NoPayloadReachesAnAncestorsAggregatorAsNone) {
+  offer({"httppost"});
+  backends.scripts["httppost"].hierarchy = 1;
+  const auto ancestorConnection = newConnection();
+  delegate->ancestor = newSession(ancestorConnection);
+  configureAndStart();
+  const size_t before = ancestorConnection->sentToClient().size();
+  send(std::nullopt);
+  ASSERT_EQ(ancestorConnection->sentToClient().size(), before + 1);
+  EXPECT_EQ(ancestorConnection->sentToClient().back().category, 3);
+  EXPECT_EQ(ancestorConnection->sentToClient().back().payload, std::nullopt);
+  delegate->ancestor.reset();
+}
+
+TEST_F(SessionDispatch, AClientThatCannotBeToldKeepsTheMessageFromNoBackend) {
+  offer({"httppost"});
+  configureAndStart(true);
+  connection->whenProxyIsAsked = [] { throw std::runtime_error("no memory"); };
+  send();
+  EXPECT_THAT(backends.journal.lines(), ElementsAre("httppost send 3/4"));
+  EXPECT_TRUE(logged(LogLevel::error, "sendToAggregator: the call of the client failed: no memory"));
+  connection->whenProxyIsAsked = nullptr;
 }
 
 TEST_F(SessionDispatch, AncestorGetsTheMessageInsteadOfTheOwnClient) {

@@ -5,6 +5,7 @@
 #include <utility>
 
 #include "client/include/tarnel/keys.h"
+#include "session/separately.h"
 #include "session/tarneld_session.h"
 #include "util/message_log.h"
 
@@ -51,9 +52,15 @@ void TarneldSession::internalFlushMessagesWithCompletion(FlushCompletion complet
   }
   const auto join = std::make_shared<FlushJoin>(dependencies_, backends.size(), std::move(completion));
   for (const auto& [name, backend] : backends) {
-    backend->flushMessagesWithCompletion([join, key = name](MaybeString text, MaybeError error) {
-      join->backendFlushed(key, std::move(text), std::move(error));
-    });
+    MaybeError failure =
+        separately(dependencies_.log, "internalFlushMessagesWithCompletion", name.c_str(),
+                   [&join, &name = name, &each = *backend] {
+                     each.flushMessagesWithCompletion([join, key = name](MaybeString text, MaybeError error) {
+                       join->backendFlushed(key, std::move(text), std::move(error));
+                     });
+                   });
+    // It will not answer any more. If it had, this is an error after the fact: the first of all answers.
+    if (failure) join->backendFlushed(name, std::nullopt, std::move(failure));
   }
 }
 

@@ -5,6 +5,7 @@
 
 #include "client/include/tarnel/keys.h"
 #include "client/shared/tarnel_logging.h"
+#include "session/separately.h"
 #include "session/tarneld_session.h"
 #include "util/device_facts.h"
 #include "util/message_log.h"
@@ -61,9 +62,10 @@ void TarneldSession::uploadFileWithURL(const std::string& fileURL, const std::st
                                        SuccessReply completionHandler) {
   const std::string path = pathOfURL(fileURL);
   bool success = false;
-  for (const auto& [name, backend] : currentBackends()) {
-    if (backend->uploadFileAtPath(path, extensionToken)) success = true;
-  }
+  withEach(dependencies_.log, "uploadFileWithURL", currentBackends(),
+           [&path, &extensionToken, &success](const std::string& /*name*/, TarnelBackend& each) {
+             if (each.uploadFileAtPath(path, extensionToken)) success = true;
+           });
   if (success) {
     TARNEL_LOG(dependencies_.log, debug, "uploadFileWithURL: File upload successful for %s", path.c_str());
   } else {
@@ -77,9 +79,10 @@ void TarneldSession::uploadFileWithURL(const std::string& fileURL, const std::st
 
 void TarneldSession::uploadLogData(Array logData, UploadReply completionHandler) {
   bool success = false;
-  for (const auto& [name, backend] : currentBackends()) {
-    if (backend->uploadLogData(logData)) success = true;
-  }
+  withEach(dependencies_.log, "uploadLogData", currentBackends(),
+           [&logData, &success](const std::string& /*name*/, TarnelBackend& each) {
+             if (each.uploadLogData(logData)) success = true;
+           });
   if (success) {
     TARNEL_LOG(dependencies_.log, debug, "uploadLogData: Log data array upload successful");
   } else {
@@ -133,16 +136,18 @@ void TarneldSession::sendMessageWithSessionInfo(const Dependencies& dependencies
     TARNEL_LOG(log, error, "sendMessageWithSessionInfo: No backends available to send single message");
     return;
   }
-  const TemporaryBackends temporary(log, "sendMessageWithSessionInfo", *std::move(created));
+  const TemporaryBackends temporary(log, *std::move(created));
   const Value* required = sessionInfo->find(kTarnelSessionInfoRequireUserInfo);
   if (userInfo && (required == nullptr || !required->boolValue())) {
     TARNEL_LOG(log, warning, "sendMessageWithSessionInfo: user info provided without requiring it.");
   }
   const TimeValue now = dependencies.clock.timeOfDay();
   for (const auto& [name, backend] : temporary.backends()) {
-    backend->updateState();
     const MaybeSentObject sent =
-        backend->sendMessage(payload, now, Method{category}, RespCode{type}, Flag::normal);
+        answerOf(log, "sendMessageWithSessionInfo", name, [&payload, &now, category, type, &each = *backend] {
+          each.updateState();
+          return each.sendMessage(payload, now, Method{category}, RespCode{type}, Flag::normal);
+        });
     if (!sent) continue;
     writeToLogFile(dependencies, "[%s -> sendMessageWithSessionInfo] %s", name.c_str(),
                    tarnel::description(*sent).c_str());

@@ -21,8 +21,8 @@ namespace tarnel {
 // acknowledges it; takes arrays of log records for upload.
 //
 // Its own send has no flag and is not the flagged one through which sessions dispatch: for a session this
-// backend's send is the base's, which does nothing. Only who calls the unflagged send makes datagrams. This
-// mismatch is deliberate.
+// backend's send is the base's, which does nothing. Datagrams come only from code that calls the unflagged
+// send: they are readable on their way, and dashboard servers do not expect the messages of sessions.
 //
 // A successful initializer sets a timer going whose handler keeps the backend alive until cleanup has done
 // its work, at most 9.5 seconds and a tick later.

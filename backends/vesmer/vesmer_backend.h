@@ -7,7 +7,8 @@
 namespace tarnel {
 
 // Records messages as events of the platform's power log, when its own, unflagged send is called. Sessions
-// call the flagged one, which is the base's and does nothing here: that is how this backend is meant to be.
+// call the flagged one, which is the base's and does nothing here: the power log, which others on the device
+// read, holds only what code records there by name, and no client can fill it with messages.
 //
 // Threads: the owning session's.
 class VesmerBackend final : public TarnelBackend {

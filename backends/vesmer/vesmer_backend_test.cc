@@ -55,7 +55,8 @@ TEST_F(VesmerBackendTest, MethodZeroAndEmptyPayloadsRecordNothing) {
   EXPECT_THAT(world.powerLog.events(), IsEmpty());
 }
 
-// Sessions call the flagged send; that it ends in the base is how this backend is meant to be.
+// Sessions call the flagged sends: as long as these end in the base, no client's message gets into the power
+// log.
 TEST_F(VesmerBackendTest, TheFlaggedSendsDoNothing) {
   const std::shared_ptr<TarnelBackend> base = backend;
   for (const Flag flag : {Flag::normal, Flag::realtime, Flag::important, Flag{3}}) {

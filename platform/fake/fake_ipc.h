@@ -37,6 +37,8 @@ class FakeIpcConnection final : public IpcConnection {
   std::map<std::string, bool, std::less<>> entitlements;
   // When set, there is no way to the client and proxies fail with this.
   MaybeError proxyError;
+  // Whether it can be served: false is a system that gives no thread.
+  bool canBeServed = true;
   // Run when the daemon resumes the connection, and when it asks for the client's object.
   Handler whenResumed;
   Handler whenProxyIsAsked;
@@ -77,9 +79,10 @@ class FakeIpcConnection final : public IpcConnection {
   void setRemoteObjectInterface() override { hasRemoteObjectInterface = true; }
   void setInterruptionHandler(Handler handler) override { interruptionHandler = std::move(handler); }
   void setInvalidationHandler(Handler handler) override { invalidationHandler = std::move(handler); }
-  void resume() override {
-    isResumed = true;
+  bool resume() override {
+    isResumed = canBeServed;
     if (whenResumed) whenResumed();
+    return isResumed;
   }
   std::shared_ptr<ClientSessionReplyInterface> remoteObjectProxyWithErrorHandler(
       ProxyErrorHandler errorHandler) override {

@@ -11,8 +11,7 @@ class Delegate final : public IpcListenerDelegate {
     connection->setInvalidationHandler([this, held = held] { ++invalidations; });
     connection->setInterruptionHandler([this] { ++interruptions; });
     connection->setRemoteObjectInterface();
-    if (connection->valueForEntitlement("e")) connection->resume();
-    return connection->valueForEntitlement("e");
+    return connection->valueForEntitlement("e") && connection->resume();
   }
   int invalidations = 0;
   int interruptions = 0;

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <algorithm>
+#include <functional>
 #include <mutex>
 #include <string>
 #include <string_view>
@@ -18,6 +19,9 @@ class FakeLog final : public Log {
     std::string text;
     friend bool operator==(const Line&, const Line&) = default;
   };
+
+  // Run after each line, with its text; set while nobody writes. May throw, as a log without memory does.
+  std::function<void(std::string_view text)> whenWritten;
 
   std::vector<Line> lines() const {
     const std::lock_guard guard(mutex_);
@@ -46,8 +50,11 @@ class FakeLog final : public Log {
 
  protected:
   void write(LogLevel level, std::string_view text) override {
-    const std::lock_guard guard(mutex_);
-    lines_.push_back({level, std::string(text)});
+    {
+      const std::lock_guard guard(mutex_);
+      lines_.push_back({level, std::string(text)});
+    }
+    if (whenWritten) whenWritten(text);
   }
 
  private:

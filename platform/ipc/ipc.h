@@ -41,11 +41,13 @@ class IpcConnection {
   virtual void setRemoteObjectInterface() = 0;
   // The peer went quiet without going away; may run more than once.
   virtual void setInterruptionHandler(Handler handler) = 0;
-  // The connection is gone for good. Runs exactly once, after the last call of the exported object has
-  // returned, and is released with everything it captured right after it ran.
+  // The connection, once resumed, is gone for good. Runs exactly once, on the connection's thread, after the
+  // last call of the exported object has returned, and is released with everything it captured right after it
+  // ran.
   virtual void setInvalidationHandler(Handler handler) = 0;
-  // Starts serving.
-  virtual void resume() = 0;
+  // Starts serving. False, logged, when that cannot be: nothing of the connection will run then, the handlers
+  // included, and the delegate gives up what it holds for it and returns false.
+  [[nodiscard]] virtual bool resume() = 0;
 
   // The peer's object. Calls are queued and never block; when one cannot be delivered the error handler
   // runs (on any thread). Null, after the error handler ran, when there is no way to the peer.
@@ -63,7 +65,8 @@ class IpcListenerDelegate {
   virtual ~IpcListenerDelegate() = default;
 
   // listener:shouldAcceptNewConnection:
-  // True keeps the connection (the delegate has called resume()); false closes it. Must not block.
+  // True keeps the connection (the delegate has called resume(), which was true); false closes it. Must not
+  // block.
   virtual bool shouldAcceptNewConnection(IpcListener& listener,
                                          std::shared_ptr<IpcConnection> connection) = 0;
 };

@@ -10,8 +10,10 @@
 
 namespace tarnel {
 
-ConnectionRegistry::ConnectionRegistry(const IpcLimits& limits, std::function<void()> trimHeap)
+ConnectionRegistry::ConnectionRegistry(const IpcLimits& limits, std::function<void()> trimHeap,
+                                       CreateThread createThread)
     : limits_(limits),
+      createThread_(std::move(createThread)),
       finishedEvent_(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
       largeCalls_(limits.largeBytesAtWork,
                   {.trim = std::move(trimHeap), .owed = [this] { eventfd_write(finishedEvent_.get(), 1); }}) {
@@ -40,26 +42,26 @@ size_t ConnectionRegistry::connections() const {
   return connections_;
 }
 
-bool ConnectionRegistry::start(std::shared_ptr<ConnectionLink> link, std::function<void()> body) {
+int ConnectionRegistry::start(std::shared_ptr<ConnectionLink> link, std::function<void()> body) {
   pthread_attr_t attributes;
   pthread_attr_init(&attributes);
   pthread_attr_setstacksize(&attributes, kConnectionStackBytes);
-  bool started = false;
+  int error = ECANCELED;
   {
     // The new thread reports its end under the same lock, so not before it is listed.
     const std::lock_guard lock(mutex_);
     if (!stopping_) {
       auto start = std::make_unique<Start>(Start{shared_from_this(), ++lastId_, std::move(body)});
       Thread thread{std::move(link)};
-      started = pthread_create(&thread.handle, &attributes, runThread, start.get()) == 0;
-      if (started) {
+      error = createThread_(&thread.handle, &attributes, runThread, start.get());
+      if (error == 0) {
         running_.emplace(start->id, std::move(thread));
         static_cast<void>(start.release());  // the thread's own now
       }
     }
   }
   pthread_attr_destroy(&attributes);
-  return started;
+  return error;
 }
 
 void* ConnectionRegistry::runThread(void* start) {

@@ -46,9 +46,12 @@ class ConnectionRegistry : public std::enable_shared_from_this<ConnectionRegistr
     uint32_t uid_;
   };
   enum class Full { perUser, total };
+  using CreateThread = std::function<int(pthread_t* thread, const pthread_attr_t* attributes,
+                                         void* (*run)(void*), void* argument)>;
 
-  // trimHeap: what LargeCalls is to trim memory with.
-  ConnectionRegistry(const IpcLimits& limits, std::function<void()> trimHeap);
+  // trimHeap: what LargeCalls is to trim memory with. createThread: pthread_create but for tests.
+  ConnectionRegistry(const IpcLimits& limits, std::function<void()> trimHeap,
+                     CreateThread createThread = pthread_create);
 
   // Of all connections. Lives as long as this.
   LargeCalls& largeCalls() noexcept { return largeCalls_; }
@@ -57,9 +60,9 @@ class ConnectionRegistry : public std::enable_shared_from_this<ConnectionRegistr
   std::variant<Place, Full> enter(uint32_t uid);
   size_t connections() const;
 
-  // Runs body on a new thread; link is how stopAll() reaches it. False when the system gives no thread, or
-  // the registry is being stopped.
-  bool start(std::shared_ptr<ConnectionLink> link, std::function<void()> body);
+  // Runs body on a new thread; link is how stopAll() reaches it. Returns 0, or the number of the error when
+  // the system gives no thread; ECANCELED when the registry is being stopped.
+  [[nodiscard]] int start(std::shared_ptr<ConnectionLink> link, std::function<void()> body);
   size_t threads() const;
 
   // Readable when a thread is over and waits for reap(), or largeCalls().trimOwed() has something to do; for
@@ -88,6 +91,7 @@ class ConnectionRegistry : public std::enable_shared_from_this<ConnectionRegistr
   void finished(uint64_t id);
 
   const IpcLimits limits_;
+  const CreateThread createThread_;
   const UniqueFd finishedEvent_;
   LargeCalls largeCalls_;
 

@@ -27,6 +27,42 @@ TEST_F(IpcLifecycleTest, APeerWithoutTheEntitlementIsClosed) {
   EXPECT_EQ(service.listener().threads(), 0U);
 }
 
+TEST_F(IpcLifecycleTest, AConnectionThatGetsNoThreadIsClosedAndNothingOfItRuns) {
+  std::atomic<bool> hasThreads{false};
+  service.createThread = [&hasThreads](pthread_t* thread, const pthread_attr_t* attributes,
+                                       void* (*run)(void*), void* argument) {
+    return hasThreads ? pthread_create(thread, attributes, run, argument) : EAGAIN;
+  };
+  service.start();
+  const RawClient client(service.path());
+  EXPECT_TRUE(isClosedByPeer(client.fd()));
+  EXPECT_TRUE(eventually([&] { return service.listener().connections() == 0; }));
+  EXPECT_TRUE(eventually([&] { return service.session() == nullptr && service.connection(0) == nullptr; }));
+  EXPECT_EQ(service.listener().threads(), 0U);
+  EXPECT_EQ(service.invalidations(), 0U);
+  EXPECT_EQ(service.notServed(), 1U);
+  EXPECT_EQ(service.interruptions(), 0U);
+  EXPECT_TRUE(service.logged("IpcConnection: Closing the connection of pid "));
+  EXPECT_TRUE(service.logged(": no thread can be started: Resource temporarily unavailable"));
+  // The next one is served.
+  hasThreads = true;
+  BusClient next(service.path());
+  EXPECT_NE(next.call("StartConfig", ""), nullptr);
+}
+
+TEST_F(IpcLifecycleTest, AConnectionWithoutAnObjectToCallIsClosedAndNothingOfItRuns) {
+  service.exportsObjects = false;
+  service.start();
+  const RawClient client(service.path());
+  EXPECT_TRUE(isClosedByPeer(client.fd()));
+  EXPECT_TRUE(eventually([&] { return service.listener().connections() == 0; }));
+  EXPECT_TRUE(eventually([&] { return service.session() == nullptr && service.connection(0) == nullptr; }));
+  EXPECT_EQ(service.listener().threads(), 0U);
+  EXPECT_EQ(service.invalidations(), 0U);
+  EXPECT_EQ(service.notServed(), 1U);
+  EXPECT_TRUE(service.logged("IpcConnection: No object is exported to pid "));
+}
+
 TEST_F(IpcLifecycleTest, RepliesAfterTheConnectionsDeathAreHarmless) {
   std::promise<SentReply> held;
   service.prepare = [&held](RecordingSession& session) {

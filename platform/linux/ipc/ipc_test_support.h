@@ -186,6 +186,10 @@ class Service final : public IpcListenerDelegate {
 
   // Set before start(): prepares each new session.
   std::function<void(RecordingSession&)> prepare = [](RecordingSession&) {};
+  // Set before start(): whether connections get an object to call.
+  bool exportsObjects = true;
+  // Set before start(): what starts the threads of connections.
+  ConnectionRegistry::CreateThread createThread = pthread_create;
   // How often memory was given back.
   std::atomic<size_t> trims{0};
   // What the listener said at its end.
@@ -229,6 +233,10 @@ class Service final : public IpcListenerDelegate {
   size_t rejected() const {
     return locked([this] { return rejected_; });
   }
+  // Connections whose resume() was false.
+  size_t notServed() const {
+    return locked([this] { return notServed_; });
+  }
   size_t invalidations() const {
     return locked([this] { return invalidations_; });
   }
@@ -255,7 +263,7 @@ class Service final : public IpcListenerDelegate {
     }
     auto session = std::make_shared<RecordingSession>();
     prepare(*session);
-    connection->setExportedObject(session);
+    if (exportsObjects) connection->setExportedObject(session);
     connection->setRemoteObjectInterface();
     connection->setInterruptionHandler([this] { locked([this] { return ++interruptions_; }); });
     // Keeps the session until it has run, as the daemon's does.
@@ -264,8 +272,9 @@ class Service final : public IpcListenerDelegate {
       accepted_.push_back({connection, session});
       return 0;
     });
-    connection->resume();
-    return true;
+    if (connection->resume()) return true;
+    locked([this] { return ++notServed_; });
+    return false;
   }
 
  private:
@@ -283,6 +292,7 @@ class Service final : public IpcListenerDelegate {
     options.limits = limits_;
     options.readCredentials = readCredentials_;
     options.clientFiles = clientFiles_;
+    options.createThread = createThread;
     options.trimHeap = [this] { ++trims; };
     options.callsLeftBehind = [this](size_t calls) { callsLeftBehind = calls; };
     listener_ = std::make_unique<SdBusListener>(event, std::move(options), entitlements_, log_);
@@ -306,6 +316,7 @@ class Service final : public IpcListenerDelegate {
   mutable std::mutex mutex_;
   std::vector<Accepted> accepted_;
   size_t rejected_ = 0;
+  size_t notServed_ = 0;
   size_t invalidations_ = 0;
   size_t interruptions_ = 0;
   std::thread thread_;

@@ -1,6 +1,7 @@
 #include "platform/linux/ipc/sd_bus_connection.h"
 
 #include <algorithm>
+#include <cstring>
 #include <utility>
 
 #include "platform/ipc/dbus_codec.h"
@@ -98,16 +99,19 @@ void SdBusConnection::setInvalidationHandler(Handler handler) {
   invalidationHandler_ = std::move(handler);
 }
 
-void SdBusConnection::resume() {
-  if (std::exchange(resumed_, true)) return;
+bool SdBusConnection::resume() {
+  if (resumed_) return true;
   if (object_ == nullptr) {
     log_->log(LogLevel::error, "IpcConnection: No object is exported to %s", description_.c_str());
-    invalidate();
-    return;
+    return false;
   }
-  if (registry_->start(link_, [self = shared_from_this()] { self->serve(); })) return;
-  log_->log(LogLevel::error, "IpcConnection: No thread can be started for %s", description_.c_str());
-  invalidate();
+  const int error = registry_->start(link_, [self = shared_from_this()] { self->serve(); });
+  resumed_ = error == 0;
+  if (!resumed_) {
+    log_->log(LogLevel::error, "IpcConnection: Closing the connection of %s: no thread can be started: %s",
+              description_.c_str(), strerror(error));
+  }
+  return resumed_;
 }
 
 void SdBusConnection::serve() {

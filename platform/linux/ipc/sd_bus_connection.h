@@ -36,8 +36,7 @@ class SdBusConnection final : public IpcConnection, public std::enable_shared_fr
   void setRemoteObjectInterface() override;
   void setInterruptionHandler(Handler handler) override;
   void setInvalidationHandler(Handler handler) override;
-  // Should the system give no thread, the connection is invalidated at once, on the caller's.
-  void resume() override;
+  bool resume() override;
   std::shared_ptr<ClientSessionReplyInterface> remoteObjectProxyWithErrorHandler(
       ProxyErrorHandler errorHandler) override;
 

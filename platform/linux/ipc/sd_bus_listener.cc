@@ -35,7 +35,8 @@ SdBusListener::SdBusListener(sd_event* event, Options options, std::shared_ptr<E
       options_(std::move(options)),
       entitlements_(std::move(entitlements)),
       log_(std::move(log)),
-      registry_(std::make_shared<ConnectionRegistry>(options_.limits, options_.trimHeap)) {}
+      registry_(
+          std::make_shared<ConnectionRegistry>(options_.limits, options_.trimHeap, options_.createThread)) {}
 
 SdBusListener::~SdBusListener() {
   accepting_.reset();

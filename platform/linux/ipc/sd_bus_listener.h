@@ -36,6 +36,8 @@ class SdBusListener final : public IpcListener {
     // Told by the destructor how many calls had to be left behind, if any: their threads still use the
     // delegate and all that it uses, so the process must end without destroying those.
     std::function<void(size_t)> callsLeftBehind;
+    // pthread_create but for tests.
+    ConnectionRegistry::CreateThread createThread = pthread_create;
     // Gives freed memory back to the system; on the event loop's thread, now and then after large calls.
     std::function<void()> trimHeap = LargeCalls::trimHeap;
   };
