@@ -7,6 +7,7 @@
 #include <string>
 #include <string_view>
 #include <utility>
+#include <vector>
 
 #include "platform/settings_store.h"
 
@@ -34,6 +35,15 @@ class FakeSettingsStore final : public SettingsStore {
     const std::lock_guard guard(mutex_);
     values_.erase({std::string(domain), std::string(key)});
     return std::nullopt;
+  }
+  std::vector<std::string> ownKeys(std::string_view domain, std::string_view prefix) override {
+    std::vector<std::string> keys;
+    if (broken) return keys;
+    const std::lock_guard guard(mutex_);
+    for (const auto& [place, value] : values_) {
+      if (place.first == domain && place.second.starts_with(prefix)) keys.push_back(place.second);
+    }
+    return keys;
   }
 
  private:

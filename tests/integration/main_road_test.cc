@@ -205,7 +205,7 @@ TEST_F(MainRoadTest, ConsentIsOffUntilSomebodyTurnsItOn) {
   EXPECT_THAT(TestSession(instance, {}).backends(), IsEmpty());
 }
 
-TEST_F(MainRoadTest, TheConsentingIdentifierIsMadeAnewAfterConsentWasWithheld) {
+TEST_F(MainRoadTest, TheConsentingIdentifierIsDrawnAnewWithEveryChangeOfConsent) {
   serveEntry(entry());
   lab.serve("moldaro", storebag("1", {{"httppost", profile({with(entry(), "override_dnu", 1)})}}));
   ASSERT_TRUE(instance.start());
@@ -251,6 +251,25 @@ TEST_F(MainRoadTest, TheConsentingIdentifierIsMadeAnewAfterConsentWasWithheld) {
   lab.reset();
   runSessions(4);
   EXPECT_EQ(identifiers(), last) << "both outlive the daemon";
+}
+
+// An event that is about no user is posted without consent, and under an identifier that joins nothing.
+TEST_F(MainRoadTest, EventsAboutNoUserHaveAnIdentifierUnderEitherDecision) {
+  serveEntry(entry());
+  ASSERT_TRUE(instance.start());
+  std::vector<std::string> identifiers;
+  for (const bool allowed : {false, true, false}) {
+    instance.setConsent(allowed);
+    lab.reset();
+    for (int i = 0; i < 2; ++i) TestSession(instance, {.requireUserInfo = false});
+    std::set<std::string> seen;
+    for (const auto& arrival : lab.waitForEvents(4)) seen.insert(textIn(arrival, "clientId"));
+    ASSERT_EQ(seen.size(), 1U) << allowed;
+    identifiers.push_back(*seen.begin());
+    EXPECT_EQ(identifiers.back().size(), 36U);
+  }
+  EXPECT_EQ(std::set<std::string>(identifiers.begin(), identifiers.end()).size(), 3U);
+  expectNoProblems();
 }
 
 TEST_F(MainRoadTest, ACustomClientIdentifierIsOneForEachClient) {
