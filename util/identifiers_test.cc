@@ -183,6 +183,14 @@ TEST_F(IdentifierRoomTest, ReplacingWhatIsNoTextNeedsNoFurtherRoom) {
   EXPECT_EQ(stored("uuid:" + nameOf(262144) + ":"), made);
 }
 
+// Both looked and found none; the second waits for the first, and then has its identifier too.
+TEST_F(IdentifiersTest, WhoWaitedForAnotherGetsWhatThatOneMade) {
+  std::string others;
+  world_.settings.afterNextRead = [this, &others] { others = identifier("App", "Media"); };
+  EXPECT_EQ(identifier("App", "Media"), "00000000-0000-0000-0000-000000000001");
+  EXPECT_EQ(others, "00000000-0000-0000-0000-000000000001");
+}
+
 TEST_F(IdentifiersTest, ThreadsThatAskAtOnceGetTheSame) {
   std::vector<std::string> results(4);
   std::vector<std::thread> threads;

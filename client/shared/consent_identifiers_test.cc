@@ -139,9 +139,18 @@ TEST_F(ConsentIdentifiersTest, WhatTheStoreCouldNotForgetDoesNotComeBack) {
     EXPECT_EQ(respecting(allowed), second) << "stable, though it cannot be stored";
     settings_.forgetsNothing = settings_.keepsNothingNew = false;
     EXPECT_EQ(respecting(allowed), second);
+    EXPECT_EQ(respecting(allowed), second);
     EXPECT_EQ(stored(allowed ? "dnu:respect" : "dnu:withheld"), second);
     EXPECT_EQ(stored(allowed ? "dnu:withheld" : "dnu:respect"), std::nullopt);
   }
+}
+
+TEST_F(ConsentIdentifiersTest, WhatAnotherProcessDrewIsUsedAndForgottenToo) {
+  respecting(true);
+  settings_.setObject(kDomain, "dnu:withheld", "drawn elsewhere");
+  EXPECT_EQ(respecting(false), "drawn elsewhere");
+  respecting(true);
+  EXPECT_EQ(stored("dnu:withheld"), std::nullopt);
 }
 
 TEST_F(ConsentIdentifiersTest, WhatCouldNotBeStoredIsForgottenToo) {
