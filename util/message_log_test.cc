@@ -270,6 +270,7 @@ TEST_F(MessageLogTest, NamesOfThreePartsCountAndOthersAreLeftAlone) {
                                            addFile("tarneld_1_messageLog.diag.old", 90000),
                                            addFile("xtarneld_1_messageLog.diag", 90000),
                                            addFile("tarneld_1_messageLog.diag_", 90000),
+                                           addFile("tarneld_1700000000-messageLog.diag", 90000),
                                            addFile("tarneld", 90000),
                                            addFile("_tarneld_messageLog.diag", 90000)};
   write();

@@ -178,6 +178,10 @@ TEST_F(ProcessValuesTest, NamesHaveIdentifiersOfTheirOwnInEachProcess) {
   EXPECT_NE(ProcessValues(log_, device_, settings_, random_).processLifetimeIdentifier("name"), made);
 }
 
+TEST_F(ProcessValuesTest, IdentifiersAreMadeOneAfterTheOther) {
+  EXPECT_TRUE(values_.lockIdentifierCreation().owns_lock());
+}
+
 // Whoever sees one cannot tell it from one that was drawn.
 TEST_F(ProcessValuesTest, IdentifiersOfNamesLookDrawn) {
   for (int i = 0; i < 100; ++i) {
