@@ -40,7 +40,7 @@ std::optional<Date> dateFromName(std::string_view middle, int64_t now) {
   const auto* end = middle.data() + middle.size();
   const auto parsed = std::from_chars(middle.data(), end, low);
   if (parsed.ec != std::errc() || parsed.ptr != end) return std::nullopt;
-  const auto age = static_cast<int32_t>(now - low);  // by whole turns of 32 bits
+  const auto age = static_cast<int32_t>(now - low);  // keeps the low 32 bits, as the name did
   return Date{static_cast<double>(now - age)};
 }
 
