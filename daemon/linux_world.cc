@@ -94,7 +94,8 @@ struct LinuxWorld::Prepared {
         settings(directories.configuration(), directories.state(), *log),
         deviceInformation(directories.configuration(), "", *log),
         consent(directories.configuration(), *log),
-        locale(configuration.country, [](const char* name) { return std::getenv(name); }),
+        locale(
+            configuration.country, [](const char* name) { return std::getenv(name); }, *log),
         clientBundle(bundleFolder),
         curl(*log, httpOptions(configuration)),
         http(curl),
@@ -107,7 +108,7 @@ struct LinuxWorld::Prepared {
         codeBundles(configuration.bundleRoot, *log),
         powerLog({.file = powerLogFile(directories, kJournalSocket)}, clock, *log),
         consentIdentifiers(settings, consent, random),
-        process(*log, deviceInformation, settings),
+        process(*log, deviceInformation, settings, random),
         workQueues(*log) {
     loop.setTimerHandler([this](uint64_t generation) { keepAlive.idleTimeElapsed(generation); });
   }

@@ -30,6 +30,9 @@ class SettingsStore {
   virtual MaybeError setObject(std::string_view domain, std::string_view key, const Value& value) = 0;
   // Removes the key from the process's own layer; no error when it was not there.
   virtual MaybeError removeObject(std::string_view domain, std::string_view key) = 0;
+  // The keys of the process's own layer that begin with the prefix, in any order; none when the store cannot
+  // be read.
+  virtual std::vector<std::string> ownKeys(std::string_view domain, std::string_view prefix) = 0;
 };
 
 }  // namespace tarnel

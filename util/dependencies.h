@@ -39,7 +39,7 @@ struct Dependencies {
   KeepAlive& keepAlive;
   CodeBundles& codeBundles;
   PowerLog& powerLog;
-  ConsentIdentifiers& consentIdentifiers;
+  ConsentIdentifierProvider& consentIdentifiers;
   ProcessValues& process;
   Uploads& uploads;
   WorkQueues& workQueues;

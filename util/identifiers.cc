@@ -1,24 +1,24 @@
 #include "util/identifiers.h"
 
-#include <mutex>
+#include <algorithm>
+#include <string_view>
 
 #include "util/process_values.h"
 
 namespace tarnel {
 namespace {
 
-// Names come from clients. Longer keys are not stored, so that none of them fills the settings alone.
-constexpr size_t kMaxKeyBytes = 512;
-
-// Held while an identifier is made, so that two sessions asking at once get the same one.
-constinit std::mutex creationMutex;
+constexpr char kKeyPrefix[] = "uuid:";
+// Identifier, quotes, equals sign and line end, with room to spare.
+constexpr size_t kBytesBesidesTheKey = 64;
+constexpr size_t kBytesOfAnEscape = 6;
 
 // Nothing when the store has no text under the key.
 MaybeString storedIdentifier(const Dependencies& dependencies, const std::string& key) {
   const auto value = dependencies.settings.objectForKey(kTarnelSettingsDomain, key);
   if (!value) return std::nullopt;
   const auto* text = value->string();
-  if (text == nullptr || text->empty()) {
+  if (text == nullptr) {
     TARNEL_LOG(dependencies.log, warning,
                "getPersistentIdentifierForCustomClientIDSuffix: ignoring the setting '%s' of %s: expected a "
                "text; remove it",
@@ -28,17 +28,38 @@ MaybeString storedIdentifier(const Dependencies& dependencies, const std::string
   return *text;
 }
 
-std::string storedOrNewIdentifier(const Dependencies& dependencies, const std::string& key) {
-  if (key.size() > kMaxKeyBytes) {
-    TARNEL_LOG(dependencies.log, warning,
-               "getPersistentIdentifierForCustomClientIDSuffix: a key of %zu bytes is not stored; names may "
-               "have %zu bytes together",
-               key.size(), kMaxKeyBytes);
-    return uuidText(dependencies.random.uuid());
+bool isEscaped(char character) {
+  const auto code = static_cast<unsigned char>(character);
+  return code < 0x20 || code == 0x7F || character == '"' || character == '\\';
+}
+
+// The most that an identifier takes in the settings file.
+size_t storedBytes(std::string_view key) {
+  const auto escapes = static_cast<size_t>(std::count_if(key.begin(), key.end(), isEscaped));
+  return kBytesBesidesTheKey + key.size() + escapes * (kBytesOfAnEscape - 1);
+}
+
+bool hasRoomFor(const Dependencies& dependencies, const std::string& key) {
+  size_t bytes = storedBytes(key);
+  for (const auto& other : dependencies.settings.ownKeys(kTarnelSettingsDomain, kKeyPrefix)) {
+    if (other != key) bytes += storedBytes(other);
   }
+  return bytes <= kMaxStoredIdentifierBytes;
+}
+
+std::string storedOrNewIdentifier(const Dependencies& dependencies, const std::string& key) {
   if (auto stored = storedIdentifier(dependencies, key)) return *std::move(stored);
-  const std::lock_guard lock(creationMutex);
+  const auto lock = dependencies.process.lockIdentifierCreation();
   if (auto stored = storedIdentifier(dependencies, key)) return *std::move(stored);
+  if (!hasRoomFor(dependencies, key)) {
+    TARNEL_LOG(
+        dependencies.log, warning,
+        "getPersistentIdentifierForCustomClientIDSuffix: the identifiers stored for clients would take "
+        "more than %zu bytes; this one lasts until the daemon ends. Remove some that nobody needs, "
+        "with: tarnelctl settings unset %s KEY",
+        kMaxStoredIdentifierBytes, kTarnelSettingsDomain);
+    return dependencies.process.processLifetimeIdentifier(key);
+  }
   std::string identifier = uuidText(dependencies.random.uuid());
   if (const auto error = dependencies.settings.setObject(kTarnelSettingsDomain, key, identifier)) {
     TARNEL_LOG(dependencies.log, warning,
@@ -53,16 +74,11 @@ std::string storedOrNewIdentifier(const Dependencies& dependencies, const std::s
 std::string getPersistentIdentifierForCustomClientIDSuffix(const Dependencies& dependencies,
                                                            const MaybeString& first,
                                                            const MaybeString& second) {
-  const std::string key = "uuid:" + first.value_or("") + ":" + second.value_or("");
+  const std::string key = kKeyPrefix + first.value_or("") + ":" + second.value_or("");
   std::string identifier = storedOrNewIdentifier(dependencies, key);
   TARNEL_LOG(dependencies.log, information,
              "getPersistentIdentifierForCustomClientIDSuffix: The value for %s: %s", key.c_str(),
              identifier.c_str());
-  return identifier;
-}
-
-const std::string& processLifetimeIdentifier(Random& random) {
-  static const std::string identifier = uuidText(random.uuid());
   return identifier;
 }
 

@@ -79,27 +79,116 @@ TEST_F(IdentifiersTest, StoreThatCannotBeReadGivesANewOneEveryTime) {
   EXPECT_EQ(identifier("App", "Media"), kept);
 }
 
-TEST_F(IdentifiersTest, ValueThatIsNoIdentifierIsReplaced) {
-  for (const Value& value : {Value(17), Value("")}) {
-    world_.log.clear();
-    world_.settings.setObject("com.orvane.tarnel", "uuid:App:Media", value);
-    const auto made = identifier("App", "Media");
-    EXPECT_EQ(made.size(), 36U);
-    EXPECT_EQ(stored("uuid:App:Media"), made);
-    EXPECT_TRUE(world_.log.contains(LogLevel::warning,
-                                    "getPersistentIdentifierForCustomClientIDSuffix: ignoring the setting "
-                                    "'uuid:App:Media' of com.orvane.tarnel: expected a text; remove it"));
+TEST_F(IdentifiersTest, ValueThatIsNoTextIsReplaced) {
+  world_.settings.setObject("com.orvane.tarnel", "uuid:App:Media", Value(17));
+  const auto made = identifier("App", "Media");
+  EXPECT_EQ(made.size(), 36U);
+  EXPECT_EQ(stored("uuid:App:Media"), made);
+  EXPECT_TRUE(world_.log.contains(LogLevel::warning,
+                                  "getPersistentIdentifierForCustomClientIDSuffix: ignoring the setting "
+                                  "'uuid:App:Media' of com.orvane.tarnel: expected a text; remove it"));
+}
+
+TEST_F(IdentifiersTest, AnyTextThatIsStoredIsTheIdentifier) {
+  for (const char* text : {"", "no UUID"}) {
+    world_.settings.setObject("com.orvane.tarnel", "uuid:App:Media", text);
+    EXPECT_EQ(identifier("App", "Media"), text);
+    EXPECT_EQ(stored("uuid:App:Media"), text);
+  }
+  EXPECT_EQ(world_.log.lines().size(), 2U) << "without a warning";
+}
+
+TEST_F(IdentifiersTest, LongKeysAreStoredLikeOthers) {
+  for (const size_t length : {500, 513, 5000, 65536}) {
+    const std::string name(length, 'x');
+    const auto made = identifier(name, "Media");
+    EXPECT_EQ(stored("uuid:" + name + ":Media"), made);
+    EXPECT_EQ(identifier(name, "Media"), made);
   }
 }
 
-TEST_F(IdentifiersTest, KeysThatAreTooLongAreNotStored) {
-  const std::string longest(512 - std::string("uuid:").size() - std::string(":").size(), 'x');
-  EXPECT_EQ(identifier(longest, std::nullopt), identifier(longest, std::nullopt));
-  EXPECT_NE(identifier(longest + "x", std::nullopt), identifier(longest + "x", std::nullopt));
-  EXPECT_EQ(stored("uuid:" + longest + "x:"), std::nullopt);
-  EXPECT_TRUE(world_.log.contains(LogLevel::warning,
-                                  "getPersistentIdentifierForCustomClientIDSuffix: a key of 513 bytes is not "
-                                  "stored; names may have 512 bytes together"));
+// --- what may be stored in all ---
+
+constexpr char kFull[] =
+    "getPersistentIdentifierForCustomClientIDSuffix: the identifiers stored for clients would take more than "
+    "262144 bytes; this one lasts until the daemon ends. Remove some that nobody needs, with: tarnelctl "
+    "settings unset com.orvane.tarnel KEY";
+constexpr size_t kBesidesName = 64 + 6;  // the entry, and "uuid:" with the second colon
+
+class IdentifierRoomTest : public IdentifiersTest {
+ protected:
+  // A name whose identifier takes so much.
+  static std::string nameOf(size_t bytes, char letter = 'x') {
+    return std::string(bytes - kBesidesName, letter);
+  }
+  bool isStored(const std::string& name) { return stored("uuid:" + name + ":").has_value(); }
+};
+
+TEST_F(IdentifierRoomTest, TheLastByteIsUsedAndNoMore) {
+  identifier(nameOf(262144 - 100), std::nullopt);
+  identifier(nameOf(101, 'y'), std::nullopt);
+  EXPECT_FALSE(isStored(nameOf(101, 'y')));
+  EXPECT_EQ(world_.log.count(LogLevel::warning, kFull), 1U);
+  identifier(nameOf(100), std::nullopt);
+  EXPECT_TRUE(isStored(nameOf(100)));
+  identifier(nameOf(100, 'z'), std::nullopt);
+  EXPECT_FALSE(isStored(nameOf(100, 'z')));
+  EXPECT_EQ(world_.log.count(LogLevel::warning, kFull), 2U);
+}
+
+TEST_F(IdentifierRoomTest, OneWithoutRoomLastsForTheProcessAndPushesNothingOut) {
+  const auto first = identifier(nameOf(262144), std::nullopt);
+  const auto second = identifier("App", "Media");
+  const auto third = identifier("App", "Music");
+  EXPECT_EQ(second.size(), 36U);
+  EXPECT_NE(second, third);
+  for (int i = 0; i < 1000; ++i) identifier("App" + std::to_string(i), "Media");
+  EXPECT_EQ(identifier("App", "Media"), second);
+  EXPECT_EQ(identifier("App", "Music"), third);
+  EXPECT_EQ(identifier(nameOf(262144), std::nullopt), first);
+  EXPECT_EQ(world_.settings.ownKeys("com.orvane.tarnel", "uuid:").size(), 1U);
+}
+
+TEST_F(IdentifierRoomTest, OneIsStoredOnceThereIsRoom) {
+  identifier(nameOf(262144), std::nullopt);
+  identifier("App", "Media");
+  world_.settings.removeObject("com.orvane.tarnel", "uuid:" + nameOf(262144) + ":");
+  const auto made = identifier("App", "Media");
+  EXPECT_EQ(stored("uuid:App:Media"), made);
+}
+
+// One control character takes six in the file.
+TEST_F(IdentifierRoomTest, WhatTheFileSpellsLongerCountsMore) {
+  for (const char escaped : {'\x01', '\x1F', '\x7F', '"', '\\'}) {
+    const std::string most((262144 - kBesidesName) / 6, escaped);
+    identifier(most + escaped, std::nullopt);
+    EXPECT_FALSE(isStored(most + escaped)) << int{escaped};
+    identifier(most, std::nullopt);
+    EXPECT_TRUE(isStored(most)) << int{escaped};
+    world_.settings.removeObject("com.orvane.tarnel", "uuid:" + most + ":");
+  }
+}
+
+TEST_F(IdentifierRoomTest, OtherSettingsDoNotCount) {
+  world_.settings.setObject("com.orvane.tarnel", std::string(300000, 'x'), "text");
+  world_.settings.setObject("com.example", "uuid:" + std::string(300000, 'x') + ":", "text");
+  const auto made = identifier("App", "Media");
+  EXPECT_EQ(stored("uuid:App:Media"), made);
+}
+
+// It has its place already.
+TEST_F(IdentifierRoomTest, ReplacingWhatIsNoTextNeedsNoFurtherRoom) {
+  world_.settings.setObject("com.orvane.tarnel", "uuid:" + nameOf(262144) + ":", Value(17));
+  const auto made = identifier(nameOf(262144), std::nullopt);
+  EXPECT_EQ(stored("uuid:" + nameOf(262144) + ":"), made);
+}
+
+// Both looked and found none; the second waits for the first, and then has its identifier too.
+TEST_F(IdentifiersTest, WhoWaitedForAnotherGetsWhatThatOneMade) {
+  std::string others;
+  world_.settings.afterNextRead = [this, &others] { others = identifier("App", "Media"); };
+  EXPECT_EQ(identifier("App", "Media"), "00000000-0000-0000-0000-000000000001");
+  EXPECT_EQ(others, "00000000-0000-0000-0000-000000000001");
 }
 
 TEST_F(IdentifiersTest, ThreadsThatAskAtOnceGetTheSame) {
@@ -110,12 +199,6 @@ TEST_F(IdentifiersTest, ThreadsThatAskAtOnceGetTheSame) {
   }
   for (auto& thread : threads) thread.join();
   EXPECT_EQ((std::set<std::string>(results.begin(), results.end()).size()), 1U);
-}
-
-TEST_F(IdentifiersTest, ProcessLifetimeIdentifierStays) {
-  const std::string made = processLifetimeIdentifier(world_.random);
-  EXPECT_EQ(made.size(), 36U);
-  EXPECT_EQ(processLifetimeIdentifier(world_.random), made);
 }
 
 }  // namespace

@@ -1,9 +1,10 @@
 #include "util/message_log.h"
 
-#include <array>
+#include <charconv>
 #include <cstdarg>
 #include <cstdint>
 #include <cstdio>
+#include <string>
 #include <string_view>
 #include <utility>
 
@@ -11,8 +12,8 @@ namespace tarnel {
 namespace {
 
 constexpr double kExpirySeconds = 86400;
-constexpr std::string_view kNameFirstPart = "tarneld";
-constexpr std::string_view kNameLastPart = "messageLog.diag";
+constexpr std::string_view kNameBegin = "tarneld_";
+constexpr std::string_view kNameEnd = "_messageLog.diag";
 
 struct LogFile {
   std::string path;
@@ -23,13 +24,31 @@ std::string dateText(const std::optional<Date>& date) {
   return date ? description(*date) : "(null)";
 }
 
-// Three parts between underscores; the middle one may be anything.
-bool isMessageLogName(std::string_view name) {
-  const auto first = name.find('_');
-  if (first == std::string_view::npos) return false;
-  const auto second = name.find('_', first + 1);
-  if (second == std::string_view::npos || name.find('_', second + 1) != std::string_view::npos) return false;
-  return name.substr(0, first) == kNameFirstPart && name.substr(second + 1) == kNameLastPart;
+// What stands between the two parts that every name has, if it has exactly three; it may be anything.
+std::optional<std::string_view> middlePart(std::string_view name) {
+  if (name.size() < kNameBegin.size() + kNameEnd.size()) return std::nullopt;
+  if (!name.starts_with(kNameBegin) || !name.ends_with(kNameEnd)) return std::nullopt;
+  name.remove_prefix(kNameBegin.size());
+  name.remove_suffix(kNameEnd.size());
+  return name.find('_') == std::string_view::npos ? std::optional(name) : std::nullopt;
+}
+
+// The time that a file was given with its name. Names have the low 32 bits of the seconds; of the times that
+// could be meant it is the one closest to now.
+std::optional<Date> dateFromName(std::string_view middle, int64_t now) {
+  int32_t low = 0;
+  const auto* end = middle.data() + middle.size();
+  const auto parsed = std::from_chars(middle.data(), end, low);
+  if (parsed.ec != std::errc() || parsed.ptr != end) return std::nullopt;
+  const auto age = static_cast<int32_t>(now - low);  // keeps the low 32 bits, as the name did
+  return Date{static_cast<double>(now - age)};
+}
+
+// Not every file system knows when a file was made.
+std::optional<Date> creationDate(const Dependencies& dependencies, const std::string& path,
+                                 std::string_view middle, int64_t now) {
+  const auto date = dependencies.files.creationDate(path);
+  return date ? date : dateFromName(middle, now);
 }
 
 std::vector<std::string> directoryEntries(const Dependencies& dependencies) {
@@ -59,13 +78,14 @@ void deleteLogFile(const Dependencies& dependencies, const LogFile& file) {
 }
 
 // The newest file that has not expired; the others are deleted.
-std::optional<LogFile> usableLogFile(const Dependencies& dependencies, double now) {
+std::optional<LogFile> usableLogFile(const Dependencies& dependencies, const TimeValue& now) {
   std::optional<LogFile> kept;
   for (const auto& name : directoryEntries(dependencies)) {
-    if (!isMessageLogName(name)) continue;
+    const auto middle = middlePart(name);
+    if (!middle) continue;
     LogFile file{dependencies.messageLogDirectory + "/" + name, std::nullopt};
-    file.created = dependencies.files.creationDate(file.path);
-    if (file.created && now - file.created->seconds > kExpirySeconds) {
+    file.created = creationDate(dependencies, file.path, *middle, now.seconds);
+    if (file.created && secondsFromTimeValue(now) - file.created->seconds > kExpirySeconds) {
       deleteLogFile(dependencies, file);
     } else if (!kept || !kept->created) {  // one without a date gives way, but is not deleted
       kept = std::move(file);
@@ -80,10 +100,9 @@ std::optional<LogFile> usableLogFile(const Dependencies& dependencies, double no
 }
 
 std::optional<LogFile> newLogFile(const Dependencies& dependencies, int64_t now) {
-  std::array<char, 64> name;
-  std::snprintf(name.data(), name.size(), "%s_%d_%s", kNameFirstPart.data(), static_cast<int32_t>(now),
-                kNameLastPart.data());
-  LogFile file{dependencies.messageLogDirectory + "/" + name.data(), std::nullopt};
+  const std::string middle = std::to_string(static_cast<int32_t>(now));
+  LogFile file{dependencies.messageLogDirectory + "/", std::nullopt};
+  file.path.append(kNameBegin).append(middle).append(kNameEnd);
   // Whether the file is there counts, not who made it.
   static_cast<void>(dependencies.files.createFile(file.path));
   if (!dependencies.files.fileExists(file.path)) {
@@ -91,7 +110,7 @@ std::optional<LogFile> newLogFile(const Dependencies& dependencies, int64_t now)
                file.path.c_str());
     return std::nullopt;
   }
-  file.created = dependencies.files.creationDate(file.path);
+  file.created = creationDate(dependencies, file.path, middle, now);
   TARNEL_LOG(dependencies.log, information, "writeToLogFile: Created new tarneld log file %s (%s)",
              file.path.c_str(), dateText(file.created).c_str());
   return file;
@@ -115,7 +134,7 @@ void appendFormatted(std::string& out, const char* format, std::va_list argument
 
 void writeToLogFile(const Dependencies& dependencies, const char* format, ...) {
   const TimeValue now = dependencies.clock.timeOfDay();
-  auto file = usableLogFile(dependencies, secondsFromTimeValue(now));
+  auto file = usableLogFile(dependencies, now);
   if (!file) file = newLogFile(dependencies, now.seconds);
   if (!file) return;
 

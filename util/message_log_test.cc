@@ -15,10 +15,10 @@ const std::string kDirectory = "/log/Retired";
 const std::string kNewFile = kDirectory + "/tarneld_1700000000_messageLog.diag";
 const std::string kNowText = "2023-11-14 22:13:20 +0000";
 
-// Everything the inner file system does, except that files cannot be removed.
-class UndeletableFiles final : public FileSystem {
+// Everything that the inner file system does.
+class OtherFiles : public FileSystem {
  public:
-  explicit UndeletableFiles(FileSystem& inner) : inner_(inner) {}
+  explicit OtherFiles(FileSystem& inner) : inner_(inner) {}
   Result<std::vector<std::string>> contentsOfDirectory(const std::string& path) override {
     return inner_.contentsOfDirectory(path);
   }
@@ -29,12 +29,24 @@ class UndeletableFiles final : public FileSystem {
   MaybeError appendToFile(const std::string& path, std::string_view text) override {
     return inner_.appendToFile(path, text);
   }
-  MaybeError removeFile(const std::string& /*path*/) override {
-    return Error(kFileErrorDomain, EACCES, "not permitted");
-  }
+  MaybeError removeFile(const std::string& path) override { return inner_.removeFile(path); }
 
  private:
   FileSystem& inner_;
+};
+
+class UndeletableFiles final : public OtherFiles {
+ public:
+  using OtherFiles::OtherFiles;
+  MaybeError removeFile(const std::string& /*path*/) override {
+    return Error(kFileErrorDomain, EACCES, "not permitted");
+  }
+};
+
+class UndatedFiles final : public OtherFiles {
+ public:
+  using OtherFiles::OtherFiles;
+  std::optional<Date> creationDate(const std::string& /*path*/) override { return std::nullopt; }
 };
 
 class MessageLogTest : public testing::Test {
@@ -155,17 +167,88 @@ TEST_F(MessageLogTest, OfTwoFilesOfOneDateTheFirstListedStays) {
   EXPECT_FALSE(exists(second));
 }
 
+// --- files whose making the file system does not know ---
+
+TEST_F(MessageLogTest, TheNameTellsTheDateThatTheFileSystemDoesNotKnow) {
+  for (const int64_t age : {86399, 86400, 0, -5}) {
+    world_.files.files.clear();
+    const auto name = "tarneld_" + std::to_string(1700000000 - age) + "_messageLog.diag";
+    const auto path = addFile(name, std::nullopt, "old\n");
+    write();
+    EXPECT_EQ(textOf(path), "old\n(" + kNowText + ") message\n") << age;
+    EXPECT_EQ(fileCount(), 1U) << age;
+  }
+  world_.files.files.clear();
+  const auto old = addFile("tarneld_1699913599_messageLog.diag", std::nullopt, "old\n");
+  write();
+  EXPECT_FALSE(exists(old));
+  EXPECT_TRUE(loggedDeletion(old, "2023-11-13 22:13:19 +0000"));
+  EXPECT_TRUE(exists(kNewFile));
+}
+
+// Each message changes the file, and with it the time of its last change.
+TEST_F(MessageLogTest, AFileThatIsWrittenAllTheTimeExpiresToo) {
+  write();
+  world_.files.files.at(kNewFile).creationDate.reset();
+  for (int hour = 0; hour < 24; ++hour) {
+    world_.clock.advance(3600);
+    write();
+  }
+  EXPECT_EQ(fileCount(), 1U);
+  world_.clock.advance(1);
+  write();
+  EXPECT_FALSE(exists(kNewFile));
+  EXPECT_EQ(fileCount(), 1U);
+}
+
+TEST_F(MessageLogTest, TheFileSystemKnowsBetterThanTheName) {
+  const auto young = addFile("tarneld_1_messageLog.diag", 60);
+  write();
+  EXPECT_TRUE(exists(young));
+}
+
+TEST_F(MessageLogTest, ANewFileWhoseMakingIsNotKnownHasTheDateOfItsName) {
+  UndatedFiles files(world_.files);
+  writeToLogFile(world_.withFiles(files), "message");
+  EXPECT_TRUE(logged(LogLevel::information,
+                     "writeToLogFile: Created new tarneld log file " + kNewFile + " (" + kNowText + ")"));
+}
+
+// The name has the low 32 bits alone.
+TEST_F(MessageLogTest, ANameOfLaterThanTheYear2038StillTellsTheDate) {
+  constexpr int64_t kLater = (int64_t{1} << 31) + 1000;
+  world_.clock.set({kLater, 0});
+  const auto before = addFile("tarneld_2147483000_messageLog.diag", std::nullopt);
+  const auto after = addFile("tarneld_-2147483000_messageLog.diag", std::nullopt);
+  const auto old = addFile("tarneld_2147397000_messageLog.diag", std::nullopt);
+  write();
+  EXPECT_FALSE(exists(old));
+  EXPECT_TRUE(loggedDeletion(old, description(Date{2147397000})));
+  EXPECT_FALSE(exists(before)) << "the older one";
+  EXPECT_EQ(textOf(after), "(" + description(Date{kLater}) + ") message\n");
+}
+
+TEST_F(MessageLogTest, ANameThatIsNoNumberOf32BitsHasNoDate) {
+  for (const char* middle : {"", "x", "1x", "x1", " 1", "1 ", "+1", "1.5", "--1", "2147483648", "-2147483649",
+                             "99999999999999999999"}) {
+    world_.files.files.clear();
+    const auto path = addFile("tarneld_" + std::string(middle) + "_messageLog.diag", std::nullopt);
+    write();
+    EXPECT_EQ(textOf(path), "(" + kNowText + ") message\n") << middle;
+  }
+}
+
 TEST_F(MessageLogTest, KeptFileWithoutADateIsReplacedButNotDeleted) {
-  const auto undated = addFile("tarneld_1_messageLog.diag", std::nullopt);
-  const auto dated = addFile("tarneld_2_messageLog.diag", 100);
+  const auto undated = addFile("tarneld_x_messageLog.diag", std::nullopt);
+  const auto dated = addFile("tarneld_y_messageLog.diag", 100);
   write();
   EXPECT_EQ(textOf(undated), "");
   EXPECT_EQ(textOf(dated), "(" + kNowText + ") message\n");
 }
 
 TEST_F(MessageLogTest, FileWithoutADateLosesAgainstADatedOne) {
-  const auto dated = addFile("tarneld_1_messageLog.diag", 100);
-  const auto undated = addFile("tarneld_2_messageLog.diag", std::nullopt);
+  const auto dated = addFile("tarneld_x_messageLog.diag", 100);
+  const auto undated = addFile("tarneld_y_messageLog.diag", std::nullopt);
   write();
   EXPECT_TRUE(exists(dated));
   EXPECT_FALSE(exists(undated));
@@ -173,7 +256,7 @@ TEST_F(MessageLogTest, FileWithoutADateLosesAgainstADatedOne) {
 }
 
 TEST_F(MessageLogTest, OnlyFileWithoutADateIsAppendedTo) {
-  const auto undated = addFile("tarneld_1_messageLog.diag", std::nullopt);
+  const auto undated = addFile("tarneld_x_messageLog.diag", std::nullopt);
   write();
   EXPECT_EQ(textOf(undated), "(" + kNowText + ") message\n");
 }
@@ -187,6 +270,7 @@ TEST_F(MessageLogTest, NamesOfThreePartsCountAndOthersAreLeftAlone) {
                                            addFile("tarneld_1_messageLog.diag.old", 90000),
                                            addFile("xtarneld_1_messageLog.diag", 90000),
                                            addFile("tarneld_1_messageLog.diag_", 90000),
+                                           addFile("tarneld_1700000000-messageLog.diag", 90000),
                                            addFile("tarneld", 90000),
                                            addFile("_tarneld_messageLog.diag", 90000)};
   write();

@@ -3,10 +3,13 @@
 #include <cstdint>
 #include <mutex>
 #include <string>
+#include <string_view>
 
 #include "platform/base/log.h"
 #include "platform/base/value.h"
+#include "platform/cryptography.h"
 #include "platform/device_information.h"
+#include "platform/random.h"
 #include "platform/settings_store.h"
 
 namespace tarnel {
@@ -25,7 +28,7 @@ enum class EnvironmentType : uint32_t {
 class ProcessValues {
  public:
   // Kept by reference; must outlive this object.
-  ProcessValues(Log& log, DeviceInformation& deviceInformation, SettingsStore& settings);
+  ProcessValues(Log& log, DeviceInformation& deviceInformation, SettingsStore& settings, Random& random);
 
   // True when the device's "ReleaseType" equals "Internal".
   bool isInternalBuild();
@@ -33,6 +36,13 @@ class ProcessValues {
   EnvironmentType currentEnvironmentType();
   // Setting "tarnel_storebag_url"; nothing when it is not set.
   const MaybeString& storebagURLOverride();
+  // A random UUID text.
+  const std::string& processLifetimeIdentifier();
+  // A UUID text that is the same whenever the same name is given, for any number of names: it is their digest
+  // with a secret of this process, so that nothing is kept for each, and none can be told from another.
+  std::string processLifetimeIdentifier(std::string_view name);
+  // Held while a persistent identifier is made, so that two sessions asking at once get the same one.
+  [[nodiscard]] std::unique_lock<std::mutex> lockIdentifierCreation();
 
  private:
   EnvironmentType userDefaultsEnvironment();
@@ -40,12 +50,18 @@ class ProcessValues {
   Log& log_;
   DeviceInformation& deviceInformation_;
   SettingsStore& settings_;
+  Random& random_;
+  std::mutex identifierCreation_;
   std::once_flag internalBuildOnce_;
   std::once_flag environmentOnce_;
   std::once_flag storebagURLOnce_;
+  std::once_flag lifetimeIdentifierOnce_;
+  std::once_flag secretOnce_;
   bool internalBuild_ = false;
   EnvironmentType environment_ = EnvironmentType::none;
   MaybeString storebagURL_;
+  std::string lifetimeIdentifier_;
+  Data secret_;
 };
 
 // Domain of the daemon's own settings.

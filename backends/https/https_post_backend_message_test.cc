@@ -45,11 +45,28 @@ TEST_F(HTTPSPostBackendMessageTest, PostTimeIsAFloatingPointNumber) {
   EXPECT_THAT(message(*makeUpdated(), {}), ::testing::StartsWith(R"({"postTime":1700000100.0,)"));
 }
 
+class FailingIdentifiers final : public ConsentIdentifierProvider {
+ public:
+  MaybeString getPersistentIdentifierForDNU(int /*respect*/) override { return std::nullopt; }
+};
+
 TEST_F(HTTPSPostBackendMessageTest, WithoutAClientIdentifierTheMessageStopsAtThePostTime) {
+  FailingIdentifiers none;
+  const Dependencies dependencies = world.withIdentifiers(none);
+  const auto backend = HTTPSPostBackend::initWithName(dependencies, "httppost", profile(), "Slate");
+  ASSERT_NE(backend, nullptr);
+  EXPECT_EQ(message(*backend, {Dictionary{{"a", 1}}}), R"({"postTime":1700000100.5})");
+}
+
+// Events that are about no user are posted also while consent is withheld, and need an identifier there.
+TEST_F(HTTPSPostBackendMessageTest, WhileConsentIsWithheldThereIsAnIdentifierToo) {
+  const auto agreed = respecting();
   world.consent.allowed = false;
   requireUserInfo = false;
-  const auto backend = makeUpdated();
-  EXPECT_EQ(message(*backend, {Dictionary{{"a", 1}}}), R"({"postTime":1700000100.5})");
+  const auto withheld = respecting();
+  EXPECT_NE(withheld, agreed);
+  EXPECT_EQ(message(*makeUpdated(), {Dictionary{{"a", 1}}}),
+            R"({"postTime":1700000100.5,"clientId":")" + withheld + R"(","events":[{"a":1}]})");
 }
 
 TEST_F(HTTPSPostBackendMessageTest, BooleansAreNumbers) {

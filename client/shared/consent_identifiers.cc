@@ -1,43 +1,59 @@
 #include "client/shared/consent_identifiers.h"
 
-#include <utility>
-
 namespace tarnel {
 
 namespace {
 
 constexpr char kDomain[] = "com.orvane.tarnel";
-constexpr char kRespectKey[] = "dnu:respect";
-constexpr char kOverrideKey[] = "dnu:override";
 
 }  // namespace
 
 ConsentIdentifiers::ConsentIdentifiers(SettingsStore& settings, Consent& consent, Random& random)
-    : settings_(settings), consent_(consent), random_(random) {}
+    : settings_(settings),
+      consent_(consent),
+      random_(random),
+      overriding_{.key = "dnu:override"},
+      agreed_{.key = "dnu:respect"},
+      withheld_{.key = "dnu:withheld"} {}
 
 MaybeString ConsentIdentifiers::getPersistentIdentifierForDNU(int respect) {
   const std::lock_guard guard(mutex_);
-  if (respect == 0) return storedOrNew(kOverrideKey);
+  if (respect == 0) return valueOf(overriding_);
   const bool allowed = consent_.isDiagnosticSubmissionAllowed();
-  if (!allowed || mustBeDropped_) dropRespecting();
-  if (!allowed) return std::nullopt;
-  // What could not be forgotten must not come back: such an identifier holds for this call alone.
-  return mustBeDropped_ ? uuidText(random_.uuid()) : storedOrNew(kRespectKey);
+  // A store that refuses is asked again with the next question; until then what it holds is stale.
+  static_cast<void>(forget(keptFor(!allowed)));
+  return valueOf(keptFor(allowed));
 }
 
-void ConsentIdentifiers::dropRespecting() {
-  mustBeDropped_ = settings_.removeObject(kDomain, kRespectKey).has_value();
+MaybeError ConsentIdentifiers::consentChanged() {
+  const std::lock_guard guard(mutex_);
+  return forget(keptFor(!consent_.isDiagnosticSubmissionAllowed()));
 }
 
-std::string ConsentIdentifiers::storedOrNew(const char* key) {
-  if (const auto stored = settings_.objectForKey(kDomain, key)) {
-    const std::string* text = stored->string();
-    if (text != nullptr && !text->empty()) return *text;
+std::string ConsentIdentifiers::valueOf(Kept& kept) {
+  const auto stored = kept.isStale ? std::nullopt : settings_.objectForKey(kDomain, kept.key);
+  if (stored && stored->string() != nullptr) {
+    kept.isForgotten = false;
+    return *stored->string();
   }
-  std::string identifier = uuidText(random_.uuid());
-  // Without a store it is as good as any, and the store has told its trouble.
-  static_cast<void>(settings_.setObject(kDomain, key, Value(identifier)));
+  if (!kept.unstored) kept.unstored = uuidText(random_.uuid());
+  std::string identifier = *kept.unstored;
+  // Even a failed attempt may leave something behind.
+  kept.isForgotten = false;
+  if (!settings_.setObject(kDomain, kept.key, Value(identifier))) {
+    kept.isStale = false;
+    kept.unstored.reset();
+  }
   return identifier;
+}
+
+MaybeError ConsentIdentifiers::forget(Kept& kept) {
+  kept.unstored.reset();
+  if (kept.isForgotten) return std::nullopt;
+  auto error = settings_.removeObject(kDomain, kept.key);
+  kept.isForgotten = !error;
+  kept.isStale = error.has_value();
+  return error;
 }
 
 }  // namespace tarnel

@@ -34,15 +34,19 @@ struct FakeWorld {
   FakeCodeBundles codeBundles;
   FakePowerLog powerLog;
   ConsentIdentifiers consentIdentifiers{settings, consent, random};
-  ProcessValues process{log, deviceInformation, settings};
+  ProcessValues process{log, deviceInformation, settings, random};
   FakeClientFiles clientFiles;
   Uploads uploads{clientFiles};
   FakeDatagramSockets datagramSockets;
   FakeWorkQueues workQueues;  // goes first: what its handlers hold uses the sockets
-  Dependencies dependencies = withFiles(files);
+  Dependencies dependencies = with(files, consentIdentifiers);
 
-  // The same world with another file system.
-  Dependencies withFiles(FileSystem& otherFiles) {
+  // The same world with another file system, or with another provider of identifiers.
+  Dependencies withFiles(FileSystem& otherFiles) { return with(otherFiles, consentIdentifiers); }
+  Dependencies withIdentifiers(ConsentIdentifierProvider& identifiers) { return with(files, identifiers); }
+
+ private:
+  Dependencies with(FileSystem& otherFiles, ConsentIdentifierProvider& identifiers) {
     return {.log = log,
             .clock = clock,
             .random = random,
@@ -56,7 +60,7 @@ struct FakeWorld {
             .keepAlive = keepAlive,
             .codeBundles = codeBundles,
             .powerLog = powerLog,
-            .consentIdentifiers = consentIdentifiers,
+            .consentIdentifiers = identifiers,
             .process = process,
             .uploads = uploads,
             .workQueues = workQueues,

@@ -38,11 +38,9 @@ MaybeError LinuxFileSystem::createDirectory(const std::string& path) {
 
 std::optional<Date> LinuxFileSystem::creationDate(const std::string& path) {
   struct statx status {};
-  if (::statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BTIME | STATX_MTIME, &status) != 0) {
-    return std::nullopt;
-  }
-  const bool hasBirth = (status.stx_mask & STATX_BTIME) != 0;
-  const statx_timestamp& time = hasBirth ? status.stx_btime : status.stx_mtime;
+  if (::statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BTIME, &status) != 0) return std::nullopt;
+  if ((status.stx_mask & STATX_BTIME) == 0) return std::nullopt;
+  const statx_timestamp& time = status.stx_btime;
   return Date{static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) / 1e9};
 }
 

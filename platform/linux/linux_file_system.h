@@ -15,7 +15,8 @@ class LinuxFileSystem final : public FileSystem {
 
   Result<std::vector<std::string>> contentsOfDirectory(const std::string& path) override;
   MaybeError createDirectory(const std::string& path) override;
-  // The time of birth where the file system keeps one, else of the last change.
+  // The time of birth; nothing where the file system keeps none. The time of the last change is no
+  // substitute: a file that is written daily would never get old.
   std::optional<Date> creationDate(const std::string& path) override;
   bool fileExists(const std::string& path) override;
   MaybeError createFile(const std::string& path) override;

@@ -204,7 +204,21 @@ MaybeError TomlSettingsStore::setObject(std::string_view domain, std::string_vie
 }
 
 MaybeError TomlSettingsStore::removeObject(std::string_view domain, std::string_view key) {
+  // Without a file there is nothing to remove, and no reason to make its directory.
+  if (isDomainName(domain) && !fileIdentity(path(SettingsLayer::own, domain)) && errno == ENOENT) {
+    return std::nullopt;
+  }
   return change(domain, [key](Dictionary& values) { return values.remove(key); });
+}
+
+std::vector<std::string> TomlSettingsStore::ownKeys(std::string_view domain, std::string_view prefix) {
+  std::vector<std::string> keys;
+  if (!isDomainName(domain)) return keys;
+  const std::lock_guard guard(mutex_);
+  for (const auto& [key, value] : refreshed(domain).own.values) {
+    if (key.starts_with(prefix)) keys.push_back(key);
+  }
+  return keys;
 }
 
 }  // namespace tarnel

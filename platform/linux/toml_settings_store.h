@@ -46,6 +46,7 @@ class TomlSettingsStore final : public SettingsStore {
   std::optional<Value> objectForKey(std::string_view domain, std::string_view key) override;
   MaybeError setObject(std::string_view domain, std::string_view key, const Value& value) override;
   MaybeError removeObject(std::string_view domain, std::string_view key) override;
+  std::vector<std::string> ownKeys(std::string_view domain, std::string_view prefix) override;
 
   // As objectForKey, with the layer that decided.
   std::optional<SettingsEntry> entryForKey(std::string_view domain, std::string_view key);

@@ -18,6 +18,7 @@ namespace {
 
 using testing::ElementsAre;
 using testing::StartsWith;
+using testing::UnorderedElementsAre;
 
 constexpr char kDomain[] = "com.orvane.tarnel";
 constexpr char kKey[] = "uuid:Foo:Bar";
@@ -59,6 +60,26 @@ TEST_F(TomlSettingsStoreTest, WhatWasStoredIsThereAfterARestart) {
   EXPECT_FALSE(store.objectForKey(kDomain, "missing"));
   EXPECT_FALSE(store.objectForKey("com.orvane.timed", kKey));
   EXPECT_THAT(logged(), ElementsAre());
+}
+
+TEST_F(TomlSettingsStoreTest, OwnKeysAreListedByTheirBeginning) {
+  folder_.write(kAdministrator, "\"uuid:admin:\" = \"X\"\n");
+  auto store = open();
+  EXPECT_THAT(store.ownKeys(kDomain, ""), ElementsAre());
+  for (const char* key : {"uuid:a:", "uuid:b:c", "uuid", "xuuid:", "dnu:respect"}) {
+    ASSERT_FALSE(store.setObject(kDomain, key, Value("X")));
+  }
+  EXPECT_THAT(store.ownKeys(kDomain, "uuid:"), UnorderedElementsAre("uuid:a:", "uuid:b:c"));
+  EXPECT_EQ(store.ownKeys(kDomain, "").size(), 5U);
+  EXPECT_THAT(store.ownKeys("com.orvane.timed", ""), ElementsAre());
+  folder_.write("state/x.toml", "a = 1\n");
+  EXPECT_THAT(store.ownKeys("../x", ""), ElementsAre()) << "no domain";
+}
+
+TEST_F(TomlSettingsStoreTest, RemovingFromNothingMakesNothing) {
+  EXPECT_FALSE(open().removeObject(kDomain, kKey));
+  EXPECT_FALSE(folder_.exists("state/settings"));
+  EXPECT_TRUE(open().removeObject("../x", kKey)) << "no domain";
 }
 
 TEST_F(TomlSettingsStoreTest, TheFileIsTomlForItsOwnerAlone) {

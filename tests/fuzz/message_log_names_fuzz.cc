@@ -18,11 +18,12 @@
 namespace tarnel::fuzz {
 
 const std::set<std::string_view> kMilestones = {
-    "foreign entry",   "own entry",        "appended to one that was there",
-    "new file",        "expired deleted",  "older deleted",
-    "without a date",  "directory made",   "listing failed",
-    "creating failed", "appending failed", "removing failed",
-    "name is taken",   "clock set back",   "year 2038"};
+    "foreign entry",   "own entry",          "appended to one that was there",
+    "new file",        "expired deleted",    "older deleted",
+    "without a date",  "date from the name", "directory made",
+    "listing failed",  "creating failed",    "appending failed",
+    "removing failed", "name is taken",      "clock set back",
+    "year 2038"};
 
 namespace {
 
@@ -38,6 +39,25 @@ bool isOwnName(const std::string& name) {
   constexpr std::string_view kFirst = "tarneld_";
   constexpr std::string_view kLast = "_messageLog.diag";
   return std::count(name.begin(), name.end(), '_') == 2 && name.starts_with(kFirst) && name.ends_with(kLast);
+}
+
+// A file's date in other words than the code's: when it was made, else the number of 32 bits in its name,
+// counted on or back by whole turns of 32 bits until it is closest to the clock.
+std::optional<Date> dateOf(const std::string& name, const fake::FakeFileSystem::File& file, int64_t now) {
+  if (file.creationDate) return file.creationDate;
+  const auto begin = name.find('_') + 1;
+  const auto text = name.substr(begin, name.rfind('_') - begin);
+  const auto digits = text.find_first_not_of('-') == 1 ? text.substr(1) : text;
+  if (digits.empty() || digits.find_first_not_of("0123456789") != std::string::npos) return std::nullopt;
+  const auto significant = digits.substr(std::min(digits.find_first_not_of('0'), digits.size()));
+  if (significant.size() > 10) return std::nullopt;
+  const int64_t number = Value(text).int64Value();
+  if (number < INT32_MIN || number > INT32_MAX) return std::nullopt;
+  constexpr int64_t kTurn = int64_t{1} << 32;
+  int64_t seconds = number + (now - number) / kTurn * kTurn;
+  while (now - seconds > INT32_MAX) seconds += kTurn;
+  while (now - seconds < INT32_MIN) seconds -= kTurn;
+  return Date{static_cast<double>(seconds)};
 }
 
 // Lets nothing out of the one directory, and nothing but the log's own files be changed in it.
@@ -129,6 +149,9 @@ class Run {
   const std::string& directory() const { return world_.dependencies.messageLogDirectory; }
   double now() { return secondsFromTimeValue(world_.clock.timeOfDay()); }
   std::string nameOf(const std::string& path) const { return path.substr(directory().size() + 1); }
+  std::optional<Date> dateAt(const Files& files, const std::string& path) {
+    return dateOf(nameOf(path), files.at(path), world_.clock.timeOfDay().seconds);
+  }
 
   void readClock(const std::string& line) {
     constexpr int64_t kFarthest = 1'000'000'000'000;
@@ -158,7 +181,8 @@ class Run {
     file.text = "what " + name + " held\n";
     if (letter != kNoDate) file.creationDate = Date{now() - kAges[letter]};
     reached(isOwnName(name) ? "own entry" : "foreign entry");
-    if (letter == kNoDate && isOwnName(name)) reached("without a date");
+    if (letter != kNoDate || !isOwnName(name)) return;
+    reached(dateOf(name, file, world_.clock.timeOfDay().seconds) ? "date from the name" : "without a date");
   }
 
   void writeOne() {
@@ -186,9 +210,10 @@ class Run {
     const auto& path = watched_.created.front();
     require(nameOf(path) == "tarneld_" + std::to_string(seconds) + "_messageLog.diag",
             "a new file has the time in its name");
-    const bool hasUsable = std::any_of(before.begin(), before.end(), [this](const auto& entry) {
-      const auto& made = entry.second.creationDate;
-      return isOwnName(nameOf(entry.first)) && (!made || now() - made->seconds <= kDay);
+    const bool hasUsable = std::any_of(before.begin(), before.end(), [this, &before](const auto& entry) {
+      if (!isOwnName(nameOf(entry.first))) return false;
+      const auto made = dateAt(before, entry.first);
+      return !made || now() - made->seconds <= kDay;
     });
     require(!hasUsable || fakes().listingError, "a new file is made only when none can be used");
     if (before.contains(path)) reached("name is taken");
@@ -207,10 +232,11 @@ class Run {
     }
     const bool isListed = !fakes().listingError && fakes().directories.contains(directory());
     for (const auto& [path, file] : before) {
-      if (!isOwnName(nameOf(path)) || !file.creationDate || !isListed) continue;
-      if (now() - file.creationDate->seconds <= kDay) continue;
+      if (!isOwnName(nameOf(path)) || !isListed) continue;
+      const auto made = dateAt(before, path);
+      if (!made || now() - made->seconds <= kDay) continue;
       // The new file may have the name of one that expired.
-      require(!after.contains(path) || after.at(path).creationDate != file.creationDate, "the expired go");
+      require(!after.contains(path) || !after.at(path).text.starts_with(file.text), "the expired go");
       reached("expired deleted");
     }
   }
@@ -219,9 +245,9 @@ class Run {
   std::optional<Date> newestOf(const Files& files) {
     std::optional<Date> newest;
     for (const auto& [path, file] : files) {
-      if (!isOwnName(nameOf(path)) || !file.creationDate) continue;
-      const double seconds = file.creationDate->seconds;
-      if (now() - seconds <= kDay && (!newest || seconds > newest->seconds)) newest = file.creationDate;
+      const auto made = isOwnName(nameOf(path)) ? dateAt(files, path) : std::nullopt;
+      if (made && now() - made->seconds <= kDay && (!newest || made->seconds > newest->seconds))
+        newest = made;
     }
     return newest;
   }
@@ -244,11 +270,11 @@ class Run {
     if (fakes().listingError || !watched_.created.empty()) return;
     reached("appended to one that was there");
     const auto newest = newestOf(before);
-    require(before.at(path).creationDate == newest, "the newest that has not expired is taken");
+    require(dateAt(before, path) == newest, "the newest that has not expired is taken");
     if (watched_.refuseRemoval || !newest) return;
     require(std::count_if(after.begin(), after.end(),
-                          [this](const auto& entry) {
-                            return isOwnName(nameOf(entry.first)) && entry.second.creationDate;
+                          [this, &after](const auto& entry) {
+                            return isOwnName(nameOf(entry.first)) && dateAt(after, entry.first);
                           }) == 1,
             "of those with a date one is left");
     if (!watched_.removed.empty()) reached("older deleted");

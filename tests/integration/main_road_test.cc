@@ -3,7 +3,6 @@
 
 #include <algorithm>
 #include <atomic>
-#include <map>
 #include <set>
 
 #include "tests/helpers/lab_process.h"
@@ -203,67 +202,6 @@ TEST_F(MainRoadTest, ConsentIsOffUntilSomebodyTurnsItOn) {
   instance.folder().remove("config/consent.toml");
   ASSERT_TRUE(instance.start());
   EXPECT_THAT(TestSession(instance, {}).backends(), IsEmpty());
-}
-
-TEST_F(MainRoadTest, TheConsentingIdentifierIsMadeAnewAfterConsentWasWithheld) {
-  serveEntry(entry());
-  lab.serve("moldaro", storebag("1", {{"httppost", profile({with(entry(), "override_dnu", 1)})}}));
-  ASSERT_TRUE(instance.start());
-  // Of one session: its client identifiers, by sender.
-  const auto identifiers = [&] {
-    std::map<std::string, std::set<std::string>> seen;
-    for (const auto& arrival : lab.events()) {
-      seen[textIn(eventOf(arrival), "_sender")].insert(textIn(arrival, "clientId"));
-    }
-    return seen;
-  };
-  const auto runSessions = [&](size_t events) {
-    { TestSession honours(instance, {.clientType = 8}); }
-    { TestSession overrides(instance, {.clientType = 9}); }
-    lab.waitForEvents(events);
-  };
-  runSessions(4);  // start and stop of both
-  auto first = identifiers();
-  ASSERT_EQ(first["OW"].size(), 1U);
-  ASSERT_EQ(first["FE"].size(), 1U);
-  EXPECT_NE(first["OW"], first["FE"]);
-
-  runSessions(8);
-  EXPECT_EQ(identifiers(), first) << "identifiers are stable while consent lasts";
-
-  instance.setConsent(false);
-  runSessions(10);
-  EXPECT_EQ(identifiers()["FE"], first["FE"]) << "the overriding identifier does not follow consent";
-  EXPECT_EQ(instance.folder().read("state/settings/com.orvane.tarnel.toml").find("dnu:respect"),
-            std::string::npos)
-      << "the consenting identifier is forgotten";
-
-  instance.setConsent(true);
-  lab.reset();
-  runSessions(4);
-  const auto last = identifiers();
-  EXPECT_EQ(last.at("FE"), first["FE"]);
-  EXPECT_NE(last.at("OW"), first["OW"]);
-  EXPECT_EQ(last.at("OW").size(), 1U);
-
-  instance.stop();
-  ASSERT_TRUE(instance.start());
-  lab.reset();
-  runSessions(4);
-  EXPECT_EQ(identifiers(), last) << "both outlive the daemon";
-}
-
-TEST_F(MainRoadTest, ACustomClientIdentifierIsOneForEachClient) {
-  serveEntry(with(without(without(entry(), "client"), "service"), "custom_clientId", 1));
-  ASSERT_TRUE(instance.start());
-  for (const char* name : {"One", "Two", "ONE"}) TestSession(instance, {.client = name});
-  std::map<std::string, std::set<std::string>> seen;
-  for (const auto& arrival : lab.waitForEvents(6)) {
-    seen[textIn(eventOf(arrival), "clientName")].insert(textIn(arrival, "clientId"));
-  }
-  ASSERT_EQ(seen["One"].size(), 1U);
-  ASSERT_EQ(seen["Two"].size(), 1U);
-  EXPECT_NE(seen["One"], seen["Two"]);
 }
 
 TEST_F(MainRoadTest, ASessionThatAwaitsItsUserHoldsItsEventsUntilHeIsKnown) {

@@ -91,12 +91,42 @@ TEST_F(CommandTest, ConsentIsOffUntilTurnedOn) {
   clear();
   EXPECT_EQ(showConsent(path("config"), true, terminal_), ExitStatus::ok);
   EXPECT_EQ(out(), "{\"diagnostics\":true}\n");
-  store_.setObject("com.orvane.tarnel", "dnu:respect", "old");
   EXPECT_EQ(storeConsent(path("config"), path("state"), false, store_, terminal_), ExitStatus::ok);
-  EXPECT_FALSE(store_.objectForKey("com.orvane.tarnel", "dnu:respect"));
   clear();
   EXPECT_EQ(showConsent(path("config"), false, terminal_), ExitStatus::ok);
   EXPECT_EQ(out(), "Submission of diagnostics is off.\n");
+}
+
+TEST_F(CommandTest, AChangeOfConsentForgetsTheIdentifierOfBefore) {
+  for (const bool allowed : {false, true}) {
+    store_.setObject("com.orvane.tarnel", "dnu:respect", "agreed");
+    store_.setObject("com.orvane.tarnel", "dnu:withheld", "withheld");
+    EXPECT_EQ(storeConsent(path("config"), path("state"), allowed, store_, terminal_), ExitStatus::ok);
+    EXPECT_EQ(store_.objectForKey("com.orvane.tarnel", "dnu:respect").has_value(), allowed);
+    EXPECT_EQ(store_.objectForKey("com.orvane.tarnel", "dnu:withheld").has_value(), !allowed);
+  }
+}
+
+TEST_F(CommandTest, AnIdentifierThatCannotBeForgottenIsReported) {
+  store_.setObject("com.orvane.tarnel", "dnu:respect", "agreed");
+  fs::remove(path("state/settings/com.orvane.tarnel.lock"));
+  fs::create_directory(path("state/settings/com.orvane.tarnel.lock"));
+  EXPECT_EQ(storeConsent(path("config"), path("state"), false, store_, terminal_), ExitStatus::failed);
+  EXPECT_NE(err().find("tarnelctl: the identifier of before could not be forgotten: " +
+                       path("state/settings/com.orvane.tarnel.lock")),
+            std::string::npos)
+      << err();
+  EXPECT_NE(err().find("; mend that and run this command again\n"), std::string::npos) << err();
+  clear();
+  EXPECT_EQ(showConsent(path("config"), false, terminal_), ExitStatus::ok);
+  EXPECT_EQ(out(), "Submission of diagnostics is off.\n");
+}
+
+TEST_F(CommandTest, ConsentBeforeTheFirstStartMakesNoSettings) {
+  for (const bool allowed : {false, true}) {
+    EXPECT_EQ(storeConsent(path("config"), path("state"), allowed, store_, terminal_), ExitStatus::ok);
+  }
+  EXPECT_TRUE(fs::is_empty(path("state")));
 }
 
 TEST_F(CommandTest, AFailedChangeNamesTheRemedy) {

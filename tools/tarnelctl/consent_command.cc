@@ -52,16 +52,19 @@ ExitStatus storeConsent(const std::string& configurationDirectory, const std::st
     terminal.err << "tarnelctl: " << error->localizedDescription() << remedyFor(*error) << '\n';
     return ExitStatus::failed;
   }
-  if (!allowed) {
+  const auto notForgotten = [&]() -> MaybeError {
     const ActingAsOwner owner(stateDirectory);
     TerminalLog log(terminal);
     FileConsent consent(configurationDirectory, log);
     SystemRandom random;
-    ConsentIdentifiers(store, consent, random).getPersistentIdentifierForDNU(1);
-  }
+    return ConsentIdentifiers(store, consent, random).consentChanged();
+  }();
   terminal.out << "Submission of diagnostics is now " << (allowed ? "on" : "off")
                << ". Sessions that start from now on follow it.\n";
-  return ExitStatus::ok;
+  if (!notForgotten) return ExitStatus::ok;
+  terminal.err << "tarnelctl: the identifier of before could not be forgotten: "
+               << notForgotten->localizedDescription() << "; mend that and run this command again\n";
+  return ExitStatus::failed;
 }
 
 }  // namespace tarnel::ctl
