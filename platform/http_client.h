@@ -27,9 +27,9 @@ struct HttpRequest {
   // From start to the last byte of the answer. Absent: the caller sets none, and the client's own limits
   // on connecting and on lack of progress end it.
   std::optional<std::chrono::milliseconds> timeout;
-  // Without it the request ends well as soon as it has been sent and the status and headers of the final
-  // answer are there, whatever becomes of the answer's body; `data` is then empty. For who looks at the
-  // status alone.
+  // Without it the request ends well with the status and headers of the final answer, as soon as those are
+  // there and the request is sent (or refused, from status 300 on), whatever becomes of the answer's body;
+  // `data` is empty then. For who looks at the status alone.
   bool wantsBody = true;
 };
 
@@ -82,8 +82,7 @@ inline constexpr char kHttpErrorDomain[] = "TarnelHTTPErrorDomain";
 inline constexpr int64_t kHttpClientGoingAway = -1;
 inline constexpr int64_t kHttpTooMuchQueued = -2;
 inline constexpr int64_t kHttpBadRequest = -3;  // URL, method or a header that cannot be sent
-inline constexpr int64_t kHttpNotBegun =
-    -4;  // no thread or no memory for it, or its turn did not come in time
+inline constexpr int64_t kHttpNotBegun = -4;    // no thread or no memory for it, or no turn in time
 
 // Whether the request was made and has ended by itself, whatever came of it: not when the client refused it,
 // never began it, or gave it up because it goes away (the negative codes).
