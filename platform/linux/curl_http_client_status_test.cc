@@ -142,6 +142,8 @@ TEST_F(StatusTest, aRedirectDecidesNothing) {
   EXPECT_EQ(errorOf(perform(statusOf(stalls.url()))), "no byte was sent or received for 100 milliseconds");
   RawHttpServer nowhere(hangingAfter("HTTP/1.1 307 X\r\nContent-Length: 9\r\n\r\n"));
   expectStatus(perform(statusOf(nowhere.url())), 307);
+  RawHttpServer empty(hangingAfter("HTTP/1.1 307 X\r\nLocation: \r\nContent-Length: 9\r\n\r\n"));
+  expectStatus(perform(statusOf(empty.url())), 307);
 }
 
 TEST_F(StatusTest, aServerThatRefusesEarlyIsBelieved) {

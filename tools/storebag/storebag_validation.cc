@@ -102,7 +102,7 @@ void checkDashboard(const Dictionary& profile, const std::string& path, Findings
   const Value* port = profile.find("port");
   if (port == nullptr) {
     findings.error(joined(path, "port"), "missing: the daemon makes no backend without the server's port");
-  } else if (!port->hasInteger() || !(port->doubleValue() >= 1 && port->doubleValue() < 65536)) {
+  } else if (!(port->doubleValue() >= 1 && port->doubleValue() < 65536)) {
     findings.error(joined(path, "port"), "must be a number from 1 to 65535");
   } else {
     checkLooseNumber(profile, "port", path, findings);
