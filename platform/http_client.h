@@ -27,6 +27,10 @@ struct HttpRequest {
   // From start to the last byte of the answer. Absent: the caller sets none, and the client's own limits
   // on connecting and on lack of progress end it.
   std::optional<std::chrono::milliseconds> timeout;
+  // Without it the request ends well with the status and headers of the final answer, as soon as those are
+  // there and the request is sent (or refused, from status 300 on), whatever becomes of the answer's body;
+  // `data` is empty then. For who looks at the status alone.
+  bool wantsBody = true;
 };
 
 struct HttpResponse {
@@ -37,8 +41,9 @@ struct HttpResponse {
   const std::string* header(std::string_view name) const;
 };
 
-// What a completion gets. A transport failure sets only `error`; otherwise `response` and `data` (empty
-// when the body was) are set. A status such as 404 or 500 is an answer, no error.
+// What a completion gets: `response` and `data` (empty when the body was), or an `error` without `data`.
+// Beside an error `response` is set when the final answer's headers had come before, as when its body broke
+// off. A status such as 404 or 500 is an answer, no error.
 struct HttpResult {
   std::optional<std::string> data;
   std::optional<HttpResponse> response;
@@ -46,7 +51,8 @@ struct HttpResult {
 };
 
 // The shared HTTP session of the process: TLS verified, http and https only, redirects followed within
-// these two and never from https to http, no cache, no cookies, answers bounded in size.
+// these two and never from https to http, no cache, no cookies, answers bounded in size. A request other than
+// GET and HEAD reaches a server at most once, redirects apart: it is not sent again when its connection ends.
 //
 // Threads: any thread may call. Completions run on the client's own thread, exactly once each, also when
 // the client goes away; they must not block.
@@ -71,10 +77,15 @@ std::string headerSafe(std::string_view text);
 HttpResult performAndWait(HttpClient& client, HttpRequest request);
 
 // Domain of the errors that a client reports for transport failures; a positive code is the HTTP library's
-// own, a negative one means that the client itself refused.
+// own, a negative one means that the client itself refused or gave up.
 inline constexpr char kHttpErrorDomain[] = "TarnelHTTPErrorDomain";
 inline constexpr int64_t kHttpClientGoingAway = -1;
 inline constexpr int64_t kHttpTooMuchQueued = -2;
 inline constexpr int64_t kHttpBadRequest = -3;  // URL, method or a header that cannot be sent
+inline constexpr int64_t kHttpNotBegun = -4;    // no thread or no memory for it, or no turn in time
+
+// Whether the request was made and has ended by itself, whatever came of it: not when the client refused it,
+// never began it, or gave it up because it goes away (the negative codes).
+bool wasCarriedOut(const HttpResult& result);
 
 }  // namespace tarnel

@@ -343,6 +343,18 @@ TEST_F(StorebagFetchTest, TransportFailureGivesNothing) {
   EXPECT_EQ(lastModified_, "then");
 }
 
+TEST_F(StorebagFetchTest, AnAnswerThatBreaksOffIsATransportFailureWhateverItsHeadersSay) {
+  auto result = FakeHttpClient::failure("cut short");
+  result.response = HttpResponse{200, {{"Last-Modified", kModified}, {"Cache-Control", "max-age=60"}}};
+  world_.http.setAnswer(result);
+  lastModified_ = "then";
+  EXPECT_EQ(fetch(), std::nullopt);
+  EXPECT_EQ(maxAge_, kUntouched);
+  EXPECT_FALSE(notModified_);
+  EXPECT_EQ(lastModified_, "then");
+  EXPECT_NE(fetch("calvisto"), std::nullopt);
+}
+
 TEST_F(StorebagFetchTest, TransportFailureForCalvistoGivesTheBuiltInStorebag) {
   world_.http.setAnswer(FakeHttpClient::failure("connection refused"));
   lastModified_ = "then";

@@ -20,8 +20,18 @@ constexpr milliseconds kShortestPeriod{1};
 constexpr milliseconds kLongestPeriod{3600000};
 constexpr milliseconds kTimerLeeway{100};
 
+// Any value asks for reliable delivery, whatever its kind; only one with a number says how often.
 milliseconds periodFrom(Log& log, const std::string& name, const Value& reliable) {
-  const int64_t wanted = reliable.int64Value();
+  if (!reliable.hasInteger()) {
+    TARNEL_LOG(log, warning,
+               "DashboardBackend(initWithName): %s: reliable is no number: delivery is reliable, and its "
+               "period %lld ms",
+               name.c_str(), static_cast<long long>(kDefaultPeriod.count()));
+    return kDefaultPeriod;
+  }
+  const auto* large = reliable.unsignedInteger();
+  const int64_t wanted =
+      large == nullptr ? reliable.int64Value() : static_cast<int64_t>(std::min<uint64_t>(*large, INT64_MAX));
   const int64_t period = std::clamp(wanted, kShortestPeriod.count(), kLongestPeriod.count());
   if (period != wanted) {
     TARNEL_LOG(log, warning,
@@ -30,6 +40,15 @@ milliseconds periodFrom(Log& log, const std::string& name, const Value& reliable
                name.c_str(), static_cast<long long>(wanted), static_cast<long long>(period));
   }
   return milliseconds(period);
+}
+
+// Of any kind: what has no number is 0.
+uint16_t portFrom(Log& log, const std::string& name, const Value& port) {
+  if (!port.hasInteger()) {
+    TARNEL_LOG(log, warning, "DashboardBackend(initWithName): %s: port is no number and counts as 0",
+               name.c_str());
+  }
+  return port.uint16Value();
 }
 
 MaybeString copied(const std::string* text) {
@@ -52,7 +71,7 @@ std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(const Dependenc
                                                                  const MaybeDictionary& profile,
                                                                  const MaybeString& productFamily) {
   const auto* ip = profile ? findString(*profile, "ip") : nullptr;
-  const auto* port = profile ? findNumber(*profile, "port") : nullptr;
+  const auto* port = profile ? profile->find("port") : nullptr;
   return initWithName(dependencies, name, profile, copied(ip), port == nullptr ? 0 : port->uint16Value(),
                       productFamily);
 }
@@ -97,17 +116,17 @@ std::optional<DashboardBackend::Server> DashboardBackend::serverFromProfile(cons
     TARNEL_LOG(dependencies.log, error, "DashboardBackend(initWithName): can't resolve server IP");
     return std::nullopt;
   }
-  const auto* port = section.findNumber("port");
+  const auto* port = profile.find("port");
   if (port == nullptr) {
     TARNEL_LOG(dependencies.log, error, "DashboardBackend(initWithName): can't resolve server port");
     return std::nullopt;
   }
   Server server{.ip = *ip,
-                .port = port->uint16Value(),
+                .port = portFrom(dependencies.log, name, *port),
                 .displayURL = copied(section.findString("display_url")),
                 .postURL = copied(section.findString("post_url")),
                 .reliable = std::nullopt};
-  if (const auto* reliable = section.findNumber("reliable")) {
+  if (const auto* reliable = profile.find("reliable")) {
     server.reliable = periodFrom(dependencies.log, name, *reliable);
   }
   return server;

@@ -39,7 +39,9 @@ class DashboardBackend final : public TarnelBackend {
   static constexpr uint32_t kMaxHandedOver = 256;
 
   // initWithName:profile:productFamily:
-  // The server is the profile's "ip" (dotted text) and "port".
+  // The server is the profile's "ip" (dotted text) and "port" (the low 16 bits of the integer in a value of
+  // any kind). A "reliable" of any kind asks for reliable delivery; its integer is the period in
+  // milliseconds.
   static std::shared_ptr<DashboardBackend> initWithName(const Dependencies& dependencies,
                                                         const std::string& name,
                                                         const MaybeDictionary& profile,

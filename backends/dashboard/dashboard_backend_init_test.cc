@@ -10,6 +10,15 @@ using Calls = std::vector<std::string>;
 
 class DashboardBackendInitTest : public DashboardBackendFixture {
  protected:
+  static std::vector<Value> valuesWithoutANumber() {
+    return {Value("soon"),
+            Value(""),
+            Value(),
+            Value(Array{200}),
+            Value(Dictionary{{"ms", 200}}),
+            Value(Date{200}),
+            Value(Data{50, 48, 48})};
+  }
   // Nothing was made, one line says why, and nothing is left once the queue has settled.
   void expectFailure(const std::shared_ptr<DashboardBackend>& backend, const std::string& text) {
     EXPECT_EQ(backend, nullptr);
@@ -53,14 +62,25 @@ TEST_F(DashboardBackendInitTest, ReliableProfileBindsBeforeItConnects) {
 }
 
 TEST_F(DashboardBackendInitTest, AnyReliableValueTurnsReliableDeliveryOn) {
-  for (const auto& [value, period] : std::vector<std::pair<Value, int>>{
-           {0, 1}, {-7, 1}, {false, 1}, {1, 1}, {2.9, 2}, {5, 5}, {INT64_MAX, 3600000}}) {
+  for (const auto& [value, period] : std::vector<std::pair<Value, int>>{{0, 1},
+                                                                        {-7, 1},
+                                                                        {false, 1},
+                                                                        {true, 1},
+                                                                        {1, 1},
+                                                                        {2.9, 2},
+                                                                        {5, 5},
+                                                                        {INT64_MAX, 3600000},
+                                                                        {UINT64_MAX, 3600000},
+                                                                        {"200", 200},
+                                                                        {" +250 ms", 250},
+                                                                        {"-3", 1},
+                                                                        {"99999999999999999999", 3600000}}) {
     world.log.clear();
     const auto backend = make(profileOf({{"reliable", value}}));
     ASSERT_NE(backend, nullptr);
     EXPECT_EQ(socket().calls.at(1), "bindToWildcard") << value.description();
     EXPECT_EQ(world.workQueues.timersMade.back().first, milliseconds(period)) << value.description();
-    const bool isBent = value.int64Value() != period;
+    const bool isBent = value.int64Value() != period;  // also of what no 64 bits with a sign hold
     EXPECT_EQ(world.log.lines().size(), isBent ? 1U : 0U) << value.description();
   }
   expectLog(
@@ -69,11 +89,43 @@ TEST_F(DashboardBackendInitTest, AnyReliableValueTurnsReliableDeliveryOn) {
       "and counts as 3600000 ms");
 }
 
-TEST_F(DashboardBackendInitTest, PortIsCutToSixteenBits) {
-  ASSERT_NE(make(profileOf({{"port", 0x2ABCD}})), nullptr);
-  EXPECT_EQ(socket().peer->port, 0xABCD);
-  ASSERT_NE(make(profileOf({{"port", -1}})), nullptr);
-  EXPECT_EQ(socket().peer->port, 0xFFFF);
+TEST_F(DashboardBackendInitTest, AReliableValueWithoutANumberHasTheUsualPeriod) {
+  for (const auto& value : valuesWithoutANumber()) {
+    world.log.clear();
+    ASSERT_NE(make(profileOf({{"reliable", value}})), nullptr) << value.description();
+    EXPECT_EQ(socket().calls.at(1), "bindToWildcard") << value.description();
+    EXPECT_EQ(world.workQueues.timersMade.back().first, milliseconds(500)) << value.description();
+    EXPECT_EQ(world.log.lines().size(), 1U);
+    expectLog(
+        LogLevel::warning,
+        "DashboardBackend(initWithName): dashboard: reliable is no number: delivery is reliable, and its "
+        "period 500 ms");
+  }
+}
+
+TEST_F(DashboardBackendInitTest, PortIsCutToSixteenBitsWhateverItsKind) {
+  for (const auto& [value, port] : std::vector<std::pair<Value, uint16_t>>{{0x2ABCD, 0xABCD},
+                                                                           {-1, 0xFFFF},
+                                                                           {8080.9, 8080},
+                                                                           {true, 1},
+                                                                           {"8080", 8080},
+                                                                           {"65537x", 1},
+                                                                           {UINT64_MAX, 0xFFFF}}) {
+    ASSERT_NE(make(profileOf({{"port", value}})), nullptr) << value.description();
+    EXPECT_EQ(socket().peer->port, port) << value.description();
+  }
+  EXPECT_TRUE(world.log.lines().empty());
+}
+
+TEST_F(DashboardBackendInitTest, APortWithoutANumberIsThereAndCountsAsZero) {
+  for (const auto& value : valuesWithoutANumber()) {
+    world.log.clear();
+    ASSERT_NE(make(profileOf({{"port", value}})), nullptr) << value.description();
+    EXPECT_EQ(socket().peer->port, 0) << value.description();
+    EXPECT_EQ(world.log.lines().size(), 1U);
+    expectLog(LogLevel::warning,
+              "DashboardBackend(initWithName): dashboard: port is no number and counts as 0");
+  }
 }
 
 TEST_F(DashboardBackendInitTest, AddressIsReadWithoutResolving) {
@@ -263,10 +315,9 @@ TEST_P(DashboardBackendWrongTypeTest, CountsAsAbsentWithOneWarning) {
   expectLog(LogLevel::warning, "DashboardBackend(initWithName): dashboard: " + key + " is not " +
                                    GetParam().expected + " and counts as absent");
   EXPECT_EQ(world.log.startingWith("DashboardBackend(initWithName): dashboard: ").size(), 1U);
-  if (key == "ip" || key == "port") {
+  if (key == "ip") {
     EXPECT_EQ(backend, nullptr);
-    expectLog(LogLevel::error, "DashboardBackend(initWithName): can't resolve server " +
-                                   std::string(key == "ip" ? "IP" : "port"));
+    expectLog(LogLevel::error, "DashboardBackend(initWithName): can't resolve server IP");
     return;
   }
   ASSERT_NE(backend, nullptr);
@@ -274,12 +325,10 @@ TEST_P(DashboardBackendWrongTypeTest, CountsAsAbsentWithOneWarning) {
   EXPECT_EQ(socket().calls, (Calls{"suppressBrokenPipeSignal", "connectTo"}));
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Keys, DashboardBackendWrongTypeTest,
-    ::testing::Values(WrongType{"ip", 127, "a text"}, WrongType{"port", "8125", "a number"},
-                      WrongType{"port", Value(), "a number"}, WrongType{"reliable", "200", "a number"},
-                      WrongType{"reliable", Value(), "a number"}, WrongType{"display_url", Array(), "a text"},
-                      WrongType{"post_url", Dictionary(), "a text"}));
+INSTANTIATE_TEST_SUITE_P(Keys, DashboardBackendWrongTypeTest,
+                         ::testing::Values(WrongType{"ip", 127, "a text"},
+                                           WrongType{"display_url", Array(), "a text"},
+                                           WrongType{"post_url", Dictionary(), "a text"}));
 
 TEST_F(DashboardBackendInitTest, SectionThatIsNoDictionaryHasNoServer) {
   EXPECT_EQ(

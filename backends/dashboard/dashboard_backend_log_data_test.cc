@@ -37,6 +37,7 @@ TEST_F(DashboardBackendLogDataTest, PostsTheArchiveOfTheArray) {
   ASSERT_EQ(world.http.requests().size(), 1U);
   const auto request = world.http.requests().front();
   EXPECT_EQ(request.method, "POST");
+  EXPECT_TRUE(request.wantsBody);
   EXPECT_EQ(request.url, "https://upload.example/logs");
   ASSERT_EQ(request.headers.size(), 1U);
   EXPECT_EQ(request.headers.front().name, "Content-Type");
@@ -125,6 +126,32 @@ TEST_F(DashboardBackendLogDataTest, WithoutAnAddressNothingIsPosted) {
   EXPECT_FALSE(makeExplicit()->uploadLogData(records));
   expectLog(LogLevel::error, text, 2);
   EXPECT_TRUE(world.http.requests().empty());
+}
+
+TEST_F(DashboardBackendLogDataTest, AnAddressOfAnotherKindIsNone) {
+  for (const auto& wrong : {Value(5), Value(true), Value(), Value(Array{"https://upload.example/logs"}),
+                            Value(Dictionary{{"url", "https://upload.example/logs"}})}) {
+    world.log.clear();
+    EXPECT_FALSE(make(profileOf({{"post_url", wrong}}))->uploadLogData(records)) << wrong.description();
+    expectLog(LogLevel::error, "DashboardBackend(uploadLogData): Post URL for log data array is nil");
+  }
+  EXPECT_TRUE(world.http.requests().empty());
+}
+
+TEST_F(DashboardBackendLogDataTest, AnAddressThatIsNoUrlIsHandedOverAsItStandsAndItsRefusalIsLogged) {
+  for (const char* wrong : {"", "no url", "ftp://upload.example/logs"}) {
+    world.log.clear();
+    world.http.clear();
+    world.http.setAnswer({std::nullopt, std::nullopt, Error(kHttpErrorDomain, kHttpBadRequest, "no URL")});
+    const auto backend = make(profileOf({{"post_url", wrong}}));
+    EXPECT_FALSE(backend->uploadLogData(records));
+    EXPECT_EQ(world.http.requests().at(0).url, wrong);
+    expectLog(
+        LogLevel::error,
+        "DashboardBackend(uploadLogData): Error uploading log data array (TarnelHTTPErrorDomain (-3): no "
+        "URL)");
+    EXPECT_EQ(EventNumberOf::of(*backend), 0);
+  }
 }
 
 TEST_F(DashboardBackendLogDataTest, RecordsThatCannotBeArchivedAreNotPosted) {

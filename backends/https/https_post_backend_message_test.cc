@@ -228,6 +228,7 @@ TEST_F(HTTPSPostBackendPostTest, SetsAllHeadersInOrder) {
   const auto backend = makeUpdated();
   const auto request = posted(*backend, std::string(1000, 'x'), Flag::normal, Method{3}, RespCode{8});
   EXPECT_EQ(request.method, "POST");
+  EXPECT_FALSE(request.wantsBody);
   EXPECT_EQ(request.url, "https://events.example/post");
   EXPECT_EQ(request.timeout, std::nullopt);
   EXPECT_THAT(

@@ -68,6 +68,7 @@ void HTTPSPostBackend::postJSONMessage(std::string message, Flag withFlag, std::
   request.url = *url;
   request.body = std::make_shared<const std::string>(std::move(useCompressed ? *compressed : message));
   request.headers = headersForPost(method, responseCode, request.body->size(), useCompressed);
+  request.wantsBody = false;
   dependencies().http.startDataTask(std::move(request), answerHandler(std::move(completion)));
 }
 

@@ -28,11 +28,6 @@ std::string lastPathComponent(std::string_view path) {
   return std::string(path);
 }
 
-// Whether the HTTP client itself refused the request for this reason: nothing of it was sent then.
-bool isRefusal(const MaybeError& error, int64_t code) {
-  return error && error->domain() == kHttpErrorDomain && error->code() == code;
-}
-
 }  // namespace
 
 std::shared_ptr<UploadBackend> UploadBackend::initWithName(const Dependencies& dependencies,
@@ -66,6 +61,10 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, const std::string&
     return false;
   }
   const uint64_t size = file->size();
+  if (size == 0) {
+    TARNEL_LOG(log, error, "UploadBackend(uploadFileAtPath): Input file is empty");
+    return false;
+  }
   if (size > uploads.limits().fileBytes) {
     TARNEL_LOG(log, error,
                "UploadBackend(uploadFileAtPath): %s has %" PRIu64 " bytes; at most %" PRIu64
@@ -92,7 +91,6 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, const std::string&
 }
 
 std::string UploadBackend::contentsOf(ClientFile& file, const std::string& path) const {
-  if (file.size() == 0) return {};
   auto contents = file.contents();
   if (!contents) {
     TARNEL_LOG(dependencies().log, warning, "UploadBackend(uploadFileAtPath): %s cannot be read: %s",
@@ -122,14 +120,14 @@ bool UploadBackend::post(const std::string& path, std::string compressed, Client
   request.headers = {{"Content-Type", "application/octet-stream"}, {"Content-Encoding", "gzip"}};
   request.body = std::make_shared<const std::string>(std::move(compressed));
   const auto result = dependencies().uploads.perform(dependencies().http, std::move(request));
-  if (isRefusal(result.error, kHttpBadRequest)) {
+  if (result.error && result.error->domain() == kHttpErrorDomain && result.error->code() == kHttpBadRequest) {
     TARNEL_LOG(log, error, "UploadBackend(uploadFileAtPath): Unable to create URL request");
     return false;
   }
   if (!result.data) {
     TARNEL_LOG(log, error, "UploadBackend(uploadFileAtPath): post %s",
                result.error ? result.error->description().c_str() : "(null)");
-    return !isRefusal(result.error, kHttpTooMuchQueued);
+    return wasCarriedOut(result);
   }
   const bool isText = isValidUtf8(*result.data);
   TARNEL_LOG(log, debug, "UploadBackend(uploadFileAtPath): sending to |%s|, Json output: %s",

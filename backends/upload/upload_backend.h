@@ -26,9 +26,9 @@ class UploadBackend final : public TarnelBackend {
 
   // uploadFileAtPath:extensionToken:
   // path: names the file to the server and in the log; it is read through what the token stands for. True
-  // when a request was made and has ended, whatever came of it; false when the HTTP client had no room for
-  // it and sent nothing. A file larger than the limit is refused before it is read; one that finds no room
-  // among the uploads under way, after a wait.
+  // when a request was made and has ended, whatever came of it; false when the HTTP client did not carry it
+  // out, or the daemon ended first. An empty file is refused at once. A file larger than the limit is refused
+  // before it is read; one that finds no room among the uploads under way, after a wait.
   bool uploadFileAtPath(const std::string& path, const std::string& extensionToken) override;
 
   const MaybeString& uploadURL() const noexcept { return _uploadURL; }

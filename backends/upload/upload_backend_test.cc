@@ -4,6 +4,8 @@
 #include <gtest/gtest.h>
 #include <zlib.h>
 
+#include <thread>
+
 #include "backends/https/https_post_backend_fixture.h"
 #include "client/include/tarnel/keys.h"
 
@@ -86,6 +88,7 @@ TEST_F(UploadBackendTest, TheRequestIsExactlyThis) {
   ASSERT_EQ(requests.size(), 1U);
   const auto& request = requests[0];
   EXPECT_EQ(request.method, "POST");
+  EXPECT_TRUE(request.wantsBody);
   EXPECT_EQ(request.url,
             "https://files.example/up?uuid=0123456789abcdef0123456789abcdef01234567&sequence=4294967295"
             "&description=Lumora%20AFRC%20log%20(Uploaded%20by%20QMX)&filename=a%20b.log.gz&raw=true");
@@ -141,6 +144,20 @@ TEST_F(UploadBackendTest, AnEmptyFileIsRefused) {
   EXPECT_THAT(world.http.requests(), IsEmpty());
 }
 
+TEST_F(UploadBackendTest, AnEmptyFileDoesNotWaitForRoom) {
+  auto all = world.uploads.enter(world.uploads.limits().bytesUnderWay, 1);
+  ASSERT_TRUE(all);
+  std::thread other([this] { EXPECT_TRUE(world.uploads.enter(1, 2)); });
+  while (world.uploads.waiting() == 0) std::this_thread::yield();
+  // Behind the other it would wait for ever.
+  EXPECT_FALSE(upload("/x", ""));
+  EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): Input file is empty"));
+  EXPECT_THAT(journal(), ElementsAre("consume t", "release t"));
+  EXPECT_EQ(world.uploads.waiting(), 1U);
+  all.reset();
+  other.join();
+}
+
 TEST_F(UploadBackendTest, AFileThatCannotBeReadCountsAsEmpty) {
   world.clientFiles.files["t"] = {.text = "x",
                                   .readError = Error(kClientFileErrorDomain, 5, "Input/output error")};
@@ -180,6 +197,27 @@ TEST_F(UploadBackendTest, WithoutRoomItIsRefusedUnread) {
              "UploadBackend(uploadFileAtPath): /x with 1 bytes found no room among the uploads under way, "
              "whose limit is 33554432 bytes"));
   EXPECT_THAT(journal(), ElementsAre("consume t", "release t"));
+}
+
+TEST_F(UploadBackendTest, WhenTheDaemonEndsAfterItGotRoomNothingIsSent) {
+  world.clientFiles.files["t"] = {.text = "x"};
+  world.clientFiles.onRead = [this] { world.uploads.stop(); };
+  EXPECT_FALSE(make(profile)->uploadFileAtPath("/x", "t"));
+  EXPECT_THAT(world.http.requests(), IsEmpty());
+  EXPECT_TRUE(logged(LogLevel::error,
+                     "UploadBackend(uploadFileAtPath): post TarnelHTTPErrorDomain (-1): the daemon ends"));
+  EXPECT_THAT(journal(), ElementsAre("consume t", "read t", "release t"));
+}
+
+TEST_F(UploadBackendTest, WhenTheDaemonEndsBeforeTheAnswerTheRequestIsNotCompleted) {
+  world.clientFiles.files["t"] = {.text = "x"};
+  world.http.holdAnswers(true);
+  std::thread end([this] {
+    while (world.http.pendingCount() == 0) std::this_thread::yield();
+    world.uploads.stop();
+  });
+  EXPECT_FALSE(make(profile)->uploadFileAtPath("/x", "t"));
+  end.join();
 }
 
 TEST_F(UploadBackendTest, RoomComesBackHoweverTheUploadEnds) {
@@ -236,13 +274,28 @@ TEST_F(UploadBackendTest, ATransportFailureKeepsTheFileAndIsStillTrue) {
   EXPECT_THAT(journal(), ElementsAre("consume t", "read t", "release t"));
 }
 
-TEST_F(UploadBackendTest, WhatTheHttpClientRefusesUnsentIsAFailure) {
+TEST_F(UploadBackendTest, AReplyThatBreaksOffIsATransportFailureWhateverItsStatus) {
   world.clientFiles.files["t"] = {.text = "x"};
-  world.http.setAnswer({std::nullopt, std::nullopt, Error(kHttpErrorDomain, kHttpTooMuchQueued, "no room")});
-  EXPECT_FALSE(make(profile)->uploadFileAtPath("/x", "t"));
+  auto result = FakeHttpClient::failure("cut short");
+  result.response = HttpResponse{200, {}};
+  world.http.setAnswer(result);
+  EXPECT_TRUE(make(profile)->uploadFileAtPath("/x", "t"));
   EXPECT_TRUE(
-      logged(LogLevel::error, "UploadBackend(uploadFileAtPath): post TarnelHTTPErrorDomain (-2): no room"));
+      logged(LogLevel::error, "UploadBackend(uploadFileAtPath): post TarnelHTTPErrorDomain (7): cut short"));
   EXPECT_THAT(journal(), ElementsAre("consume t", "read t", "release t"));
+}
+
+TEST_F(UploadBackendTest, WhatTheHttpClientDoesNotCarryOutIsAFailure) {
+  world.clientFiles.files["t"] = {.text = "x"};
+  for (const auto& [code, number] : std::vector<std::pair<int64_t, std::string>>{
+           {kHttpClientGoingAway, "-1"}, {kHttpTooMuchQueued, "-2"}, {kHttpNotBegun, "-4"}}) {
+    world.clientFiles.journal.clear();
+    world.http.setAnswer({std::nullopt, std::nullopt, Error(kHttpErrorDomain, code, "not now")});
+    EXPECT_FALSE(make(profile)->uploadFileAtPath("/x", "t"));
+    EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): post TarnelHTTPErrorDomain (" +
+                                            number + "): not now"));
+    EXPECT_THAT(journal(), ElementsAre("consume t", "read t", "release t"));
+  }
   // The code alone says nothing.
   world.http.setAnswer({std::nullopt, std::nullopt, Error("another", kHttpTooMuchQueued, "no room")});
   EXPECT_TRUE(make(profile)->uploadFileAtPath("/x", "t"));

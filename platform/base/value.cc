@@ -135,6 +135,14 @@ int64_t Value::int64Value() const noexcept {
   }
 }
 
+bool Value::hasInteger() const noexcept {
+  const auto* held = string();
+  if (held == nullptr) return isNumber();
+  auto text = numberText(*held);
+  if (text.starts_with('-')) text.remove_prefix(1);
+  return !text.empty() && text.front() >= '0' && text.front() <= '9';
+}
+
 uint64_t Value::uint64Value() const noexcept {
   return static_cast<uint64_t>(int64Value());
 }

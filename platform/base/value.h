@@ -184,6 +184,8 @@ class Value {
   // held to the 64-bit range first (not-a-number reads as 0); text reads as its leading integer (or real);
   // anything else reads as 0.
   int64_t int64Value() const noexcept;
+  // Whether int64Value() reads a number that is there: of a number, or of a text that begins with one.
+  bool hasInteger() const noexcept;
   uint64_t uint64Value() const noexcept;
   int32_t int32Value() const noexcept { return static_cast<int32_t>(int64Value()); }
   uint32_t uint32Value() const noexcept { return static_cast<uint32_t>(uint64Value()); }

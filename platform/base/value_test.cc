@@ -90,6 +90,18 @@ TEST(ValueTest, readsTheLeadingIntegerOfText) {
   EXPECT_EQ(Value().uint32Value(), 0U);
 }
 
+TEST(ValueTest, tellsANumberThatIsThereFromNone) {
+  for (const Value& one : {Value(0), Value(false), Value(2.5), Value(UINT64_MAX), Value("0"), Value(" \t+7x"),
+                           Value("-12"), Value("99999999999999999999")}) {
+    EXPECT_TRUE(one.hasInteger()) << one.description();
+  }
+  for (const Value& one :
+       {Value(), Value(""), Value("x1"), Value("+-7"), Value("-+7"), Value("-"), Value(".5"), Value(Date{5}),
+        Value(Data{49}), Value(Array{1}), Value(Dictionary{{"1", 1}})}) {
+    EXPECT_FALSE(one.hasInteger()) << one.description();
+  }
+}
+
 TEST(ValueTest, readsTheLeadingRealOfText) {
   const struct {
     const char* text;

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cerrno>
+#include <functional>
 #include <map>
 #include <memory>
 #include <string>
@@ -25,6 +26,7 @@ class FakeClientFiles final : public ClientFiles {
   std::map<std::string, File> files;
   // What was done, in order: "consume t", "read t", "delete t", "release t".
   std::vector<std::string> journal;
+  std::function<void()> onRead;  // called while a file is read
 
   std::unique_ptr<ClientFile> consume(const std::string& extensionToken) override {
     journal.push_back("consume " + extensionToken);
@@ -45,6 +47,7 @@ class FakeClientFiles final : public ClientFiles {
     }
     Result<std::string> contents() override {
       owner_.journal.push_back("read " + token_);
+      if (owner_.onRead) owner_.onRead();
       if (file_.readError) return *file_.readError;
       return file_.text.substr(0, size());
     }

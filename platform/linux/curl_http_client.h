@@ -24,6 +24,11 @@ struct HttpClientOptions {
   std::chrono::milliseconds longestRequest{
       std::chrono::hours(1)};  // of a request without a time-out of its own
 
+  // Longest a connection may have been idle to be used again. Common servers close theirs after 5 seconds;
+  // who sends into that loses the request. The library cuts off what is left of a second, so this is
+  // almost 4.
+  std::chrono::seconds idleConnection{3};
+
   size_t maxAnswerBytes = 8U << 20U;       // of one body; a larger one is an error
   size_t maxHeaderBytes = 256U << 10U;     // of all headers of one answer
   size_t maxHeldAnswerBytes = 64U << 20U;  // of all bodies that are arriving
@@ -32,6 +37,10 @@ struct HttpClientOptions {
   size_t connectionsPerHost = 6;           // requests on the wire, and so connections, to one host
   size_t connections = 32;                 // and to all hosts
   size_t maxRedirects = 10;
+
+  // How much of a body that nobody wants is read, and for how long, to keep its connection.
+  size_t maxUnwantedBytes = 64U << 10U;
+  std::chrono::milliseconds unwantedBody{1000};
 };
 
 // The process's HTTP client: one thread, which starts with the first request, carries all transfers.
@@ -42,8 +51,11 @@ struct HttpClientOptions {
 // POST's after 301 and 302 too: what was posted must arrive. Only 303, by which the server has taken the
 // request, goes on as GET without the body and its "Content-" headers. "Authorization" and "Cookie" stay
 // behind when scheme, host or port change. Answers come as they were sent (nothing is decompressed). No proxy
-// is used, whatever the environment says. A request on a kept connection that the server closed before it
-// answered anything is sent once more on a new one.
+// is used, whatever the environment says.
+//
+// A kept connection is looked at before it is used, and not used again when it has ended. When it ends later,
+// without a byte of an answer, GET and HEAD are sent again on a new one. Of anything else nobody can tell
+// whether the server took it: it fails, unless no byte of its body was sent.
 //
 // Threads: any thread may call; the object must not be destroyed by a completion. A completion that throws is
 // logged and otherwise ignored.

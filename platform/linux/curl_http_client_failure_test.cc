@@ -1,4 +1,5 @@
 #include <curl/curl.h>
+#include <pthread.h>
 
 #include <atomic>
 #include <latch>
@@ -118,7 +119,9 @@ TEST(HttpFailureTest, timesOutAlsoWhileWaitingForAConnection) {
   client.startDataTask(get(server.url("/holds")), holding.completion());
   HttpRequest second = get(server.url("/waits"));
   second.timeout = 60ms;
-  EXPECT_EQ(errorOf(performAndWait(client, second)), "the request timed out after 60 milliseconds");
+  const HttpResult waited = performAndWait(client, second);
+  EXPECT_EQ(errorOf(waited), "the request timed out after 60 milliseconds");
+  EXPECT_EQ(waited.error->code(), kHttpNotBegun);
   EXPECT_EQ(holding.count(), 0U);
 }
 
@@ -140,29 +143,37 @@ TEST(HttpFailureTest, endsARequestWithoutATimeOutOfItsOwn) {
 }
 
 TEST(HttpFailureTest, reportsConnectionsThatBreak) {
-  const std::string whole = "HTTP/1.1 200 OK\r\nX: y\r\nContent-Length: 10\r\n\r\n12345";
-  for (size_t bytes = 0; bytes < whole.size(); bytes += 7) {
+  const std::string head = "HTTP/1.1 200 OK\r\nX: y\r\nContent-Length: 10\r\n\r\n";
+  const std::string whole = head + "12345";
+  for (size_t bytes = 0; bytes < whole.size(); bytes += bytes < head.size() ? 7 : 1) {
     for (const bool withReset : {false, true}) {
       RawHttpServer server([&whole, bytes, withReset](RawConnection& connection) {
         connection.readRequest();
         connection.write(std::string_view(whole).substr(0, bytes));
         if (withReset) connection.reset();
       });
-      EXPECT_NE(errorOf(perform(get(server.url()))), "no error") << bytes;
+      // A reset may overtake what was sent before.
+      const HttpResult result = perform(get(server.url()));
+      const bool isKnown = withReset ? result.response.has_value() : bytes >= head.size();
+      EXPECT_NE(errorOf(result, isKnown ? 200 : 0), "no error") << bytes;
     }
   }
 }
 
 TEST(HttpFailureTest, reportsAnswersThatAreNotHttp) {
   for (const auto& bytes : {"hello\r\n\r\n"s, "\0\0\0\0"s, "HTTP/1.1 abc\r\n\r\n"s, "SSH-2.0-x\r\n"s,
-                            "HTTP/1.1 200 OK\r\nContent-Length: -5\r\n\r\n"s,
-                            "HTTP/1.1 200 OK\r\nTransfer-Encoding: chunked\r\n\r\nzz\r\n"s}) {
+                            "HTTP/1.1 200 OK\r\nContent-Length: -5\r\n\r\n"s}) {
     RawHttpServer server([&bytes](RawConnection& connection) {
       connection.readRequest();
       connection.write(bytes);
     });
     EXPECT_NE(errorOf(perform(get(server.url()))), "no error") << bytes;
   }
+  RawHttpServer server([](RawConnection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 200 OK\r\nTransfer-Encoding: chunked\r\n\r\nzz\r\n");
+  });
+  EXPECT_NE(errorOf(perform(get(server.url())), 200), "no error");
 }
 
 TEST(HttpFailureTest, boundsAnswers) {
@@ -176,7 +187,7 @@ TEST(HttpFailureTest, boundsAnswers) {
   EXPECT_EQ(performWith(options, get(fits.url())).data->size(), 1000U);
   RawHttpServer announced(serving(1001));
   const HttpResult result = performWith(options, get(announced.url()));
-  EXPECT_EQ(errorOf(result), "the answer is larger than 1000 bytes");
+  EXPECT_EQ(errorOf(result, 200), "the answer is larger than 1000 bytes");
   EXPECT_EQ(result.error->code(), CURLE_FILESIZE_EXCEEDED);
   RawHttpServer endless([](RawConnection& connection) {
     connection.readRequest();
@@ -184,7 +195,7 @@ TEST(HttpFailureTest, boundsAnswers) {
     while (connection.write("xxxxxxxxxxxxxxxx")) {
     }
   });
-  EXPECT_EQ(errorOf(performWith(options, get(endless.url()))), "the answer is larger than 1000 bytes");
+  EXPECT_EQ(errorOf(performWith(options, get(endless.url())), 200), "the answer is larger than 1000 bytes");
 }
 
 TEST(HttpFailureTest, boundsHeaders) {
@@ -220,7 +231,7 @@ TEST(HttpFailureTest, boundsWhatAllAnswersHoldTogether) {
   CurlHttpClient client(log, options);
   client.startDataTask(get(server.url("/1")), answers.completion());
   client.startDataTask(get(server.url("/2")), answers.completion());
-  EXPECT_EQ(errorOf(answers.waitFor(1)[0]),
+  EXPECT_EQ(errorOf(answers.waitFor(1)[0], 200),
             "the answers that are arriving are larger than 1000 bytes together");
 }
 
@@ -278,6 +289,42 @@ TEST(HttpFailureTest, completesEveryRequestWhenTheClientGoesAway) {
   }
   ASSERT_EQ(late.count(), 1U);
   EXPECT_EQ(late.waitFor(1)[0].error->code(), kHttpClientGoingAway);
+}
+
+// New threads get a stack that no address space has room for.
+class NoNewThreads {
+ public:
+  NoNewThreads() {
+    pthread_getattr_default_np(&before_);
+    pthread_attr_t huge;
+    pthread_attr_init(&huge);
+    pthread_attr_setstacksize(&huge, size_t{1} << 46U);
+    pthread_setattr_default_np(&huge);
+    pthread_attr_destroy(&huge);
+  }
+  NoNewThreads(const NoNewThreads&) = delete;
+  NoNewThreads& operator=(const NoNewThreads&) = delete;
+  ~NoNewThreads() {
+    pthread_setattr_default_np(&before_);
+    pthread_attr_destroy(&before_);
+  }
+
+ private:
+  pthread_attr_t before_;
+};
+
+TEST(HttpFailureTest, withoutAThreadNothingIsBegun) {
+  RawHttpServer server(RawHttpServer::answering([](const std::string&) { return httpAnswer("200 OK"); }));
+  QuietLog log;
+  CurlHttpClient client(log, plainOptions());
+  {
+    const NoNewThreads none;
+    const HttpResult result = performAndWait(client, post(server.url(), "body"));
+    EXPECT_EQ(errorOf(result), "the HTTP thread cannot be started");
+    EXPECT_EQ(result.error->code(), kHttpNotBegun);
+    EXPECT_FALSE(wasCarriedOut(result));
+  }
+  EXPECT_FALSE(performAndWait(client, post(server.url(), "body")).error) << "the next one tries again";
 }
 
 TEST(HttpFailureTest, goesAwayWithoutEverHavingWorked) {

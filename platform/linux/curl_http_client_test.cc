@@ -137,48 +137,6 @@ TEST_F(CurlHttpClientTest, keepsAConnectionForTheNextRequest) {
   EXPECT_EQ(server.connectionCount(), 1U);
 }
 
-// Answers as many requests of its first connection as it is told, and no other until the second connection.
-class ForgetfulServer {
- public:
-  explicit ForgetfulServer(int answersFirst) : answersFirst_(answersFirst) {}
-
-  size_t connectionCount() const { return server_.connectionCount(); }
-  std::string url() const { return server_.url(); }
-  int requests() const { return requests_; }
-
- private:
-  std::atomic<int> connections_ = 0;
-  std::atomic<int> requests_ = 0;
-  const int answersFirst_;
-  RawHttpServer server_{[this](RawConnection& connection) {
-    const bool isFirst = connections_++ == 0;
-    int answered = 0;
-    while (connection.readRequest()) {
-      ++requests_;
-      if (isFirst && answered++ == answersFirst_) return;
-      connection.write(httpAnswer("200 OK", "fine"));
-    }
-  }};
-};
-
-// The server may have closed a connection that it kept for long enough, and never seen the request: losing it
-// would be worse than sending it twice.
-TEST_F(CurlHttpClientTest, sendsAPostAgainWhenAKeptConnectionEndsWithoutAByteOfAnAnswer) {
-  ForgetfulServer server(1);
-  ASSERT_FALSE(perform(post(server.url(), "first")).error);
-  const HttpResult second = perform(post(server.url(), "second"));
-  ASSERT_TRUE(second.data);
-  EXPECT_EQ(second.data, "fine");
-  EXPECT_EQ(server.requests(), 3);
-  EXPECT_EQ(server.connectionCount(), 2U);
-}
-
-TEST_F(CurlHttpClientTest, sendsAPostOnceWhenItsNewConnectionEndsWithoutAnAnswer) {
-  ForgetfulServer server(0);
-  EXPECT_NE(errorOf(perform(post(server.url(), "first"))), "no error");
-  EXPECT_EQ(server.requests(), 1);
-}
-
 TEST_F(CurlHttpClientTest, usesNoProxyWhateverTheEnvironmentSays) {
   EchoServer server;
   setenv("http_proxy", "http://127.0.0.1:1/", 1);

@@ -86,10 +86,10 @@ inline HttpRequest post(std::string url, std::string body) {
   return request;
 }
 
-// The answer must be an error; its description.
-inline std::string errorOf(const HttpResult& result) {
+// The answer must be an error; its description. Its status must have been known when one is given, else not.
+inline std::string errorOf(const HttpResult& result, int status = 0) {
   EXPECT_FALSE(result.data);
-  EXPECT_FALSE(result.response);
+  EXPECT_EQ(result.response ? result.response->statusCode : 0, status);
   if (!result.error) return "no error";
   EXPECT_EQ(result.error->domain(), kHttpErrorDomain);
   return result.error->localizedDescription();

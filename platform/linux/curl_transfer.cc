@@ -1,6 +1,7 @@
 #include "platform/linux/curl_transfer.h"
 
 #include <openssl/ssl.h>
+#include <sys/socket.h>
 
 #include <algorithm>
 #include <utility>
@@ -22,8 +23,18 @@ std::string_view trimmed(std::string_view text) {
   return text.substr(first, text.find_last_not_of(kBlanks) - first + 1);
 }
 
-bool isRedirect(long status) {
+bool isRedirect(int status) {
   return status == 301 || status == 302 || status == 303 || status == 307 || status == 308;
+}
+
+Error tooLarge(std::string text) {
+  return {kHttpErrorDomain, CURLE_FILESIZE_EXCEEDED, std::move(text)};
+}
+
+// The server may have taken the request, and only the answer was lost.
+Error notSentAgain() {
+  return {kHttpErrorDomain, CURLE_GOT_NOTHING,
+          "the server gave no answer; what was sent may have arrived and is not sent again"};
 }
 
 }  // namespace
@@ -48,34 +59,41 @@ std::string CurlTransfer::host() const {
 void CurlTransfer::dropAnswer() {
   context_.heldAnswerBytes -= data_.size();
   data_.clear();
+  received_ = 0;
   headers_.clear();
   headerBytes_ = 0;
   headersEnded_ = false;
 }
 
-MaybeError CurlTransfer::begin(CurlEasy easy) {
+std::optional<std::string> CurlTransfer::begin(CurlEasy easy) {
   easy_ = std::move(easy);
-  if (easy_ == nullptr) return Error(kHttpErrorDomain, CURLE_OUT_OF_MEMORY, "out of memory");
+  if (easy_ == nullptr) return "out of memory";
   curl_easy_reset(easy_.get());
   moved_.reset();
   sent_ = 0;
+  bodyRead_ = 0;
   set(CURLOPT_PRIVATE, this);
   set(CURLOPT_URL, request_.url.c_str());
   setMethodAndBody();
   setHeaders();
   setConnection();
   if (setUp_ == CURLE_OK) return std::nullopt;
-  return Error(kHttpErrorDomain, setUp_,
-               std::string("cannot set the request up: ") + curl_easy_strerror(setUp_));
+  return curl_easy_strerror(setUp_);
 }
 
+// The library sends a request again by itself when a kept connection ends without a byte of an answer. A body
+// is therefore handed out once: the library is given no way to rewind it, and once it was read neither a
+// connection is opened (onOpenSocket) nor a sending begun (onConnected). What changes something without
+// having a body takes a new connection, on which nothing is sent again.
 void CurlTransfer::setMethodAndBody() {
+  const bool hasBody = request_.body != nullptr && !request_.body->empty();
+  const bool isRepeatable = request_.method == "GET" || request_.method == "HEAD";
+  if (!hasBody && !isRepeatable) set(CURLOPT_FRESH_CONNECT, 1L);
   if (request_.body != nullptr || request_.method == "POST") {
-    static const std::string none;
-    const std::string& body = request_.body != nullptr ? *request_.body : none;
     set(CURLOPT_POST, 1L);
-    set(CURLOPT_POSTFIELDS, body.data());
-    set(CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body.size()));
+    set(CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(hasBody ? request_.body->size() : 0));
+    set(CURLOPT_READFUNCTION, &CurlTransfer::onRead);
+    set(CURLOPT_READDATA, this);
     if (request_.method != "POST") set(CURLOPT_CUSTOMREQUEST, request_.method.c_str());
   } else if (request_.method == "HEAD") {
     set(CURLOPT_NOBODY, 1L);
@@ -119,6 +137,7 @@ void CurlTransfer::setConnection() {
   set(CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
   set(CURLOPT_HTTP_CONTENT_DECODING, 0L);
   set(CURLOPT_TCP_KEEPALIVE, 1L);
+  set(CURLOPT_MAXAGE_CONN, static_cast<long>(options.idleConnection.count()));
   set(CURLOPT_CONNECTTIMEOUT_MS, static_cast<long>(options.connectTimeout.count()));
   set(CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_2));
   // The certificates were parsed once; the library would read its own file for every connection.
@@ -126,6 +145,8 @@ void CurlTransfer::setConnection() {
   set(CURLOPT_CAPATH, static_cast<char*>(nullptr));
   set(CURLOPT_SSL_CTX_FUNCTION, &CurlTransfer::onTls);
   set(CURLOPT_SSL_CTX_DATA, context_.certificates);
+  set(CURLOPT_OPENSOCKETFUNCTION, &CurlTransfer::onOpenSocket);
+  set(CURLOPT_OPENSOCKETDATA, this);
   set(CURLOPT_PREREQFUNCTION, &CurlTransfer::onConnected);
   set(CURLOPT_PREREQDATA, this);
   set(CURLOPT_NOPROGRESS, 0L);
@@ -143,11 +164,35 @@ CURLcode CurlTransfer::onTls(CURL* /*easy*/, void* context, void* certificates) 
   return CURLE_OK;
 }
 
+// What the library is about to do, it would do for a second sending.
+bool CurlTransfer::refuseSecondSending() {
+  if (bodyRead_ == 0) return false;
+  refusal_ = notSentAgain();
+  return true;
+}
+
+curl_socket_t CurlTransfer::onOpenSocket(void* self, curlsocktype /*purpose*/, curl_sockaddr* address) {
+  if (static_cast<CurlTransfer*>(self)->refuseSecondSending()) return CURL_SOCKET_BAD;
+  return socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
+}
+
 // Comes before a hop's first byte, on a new connection as on a kept one.
 int CurlTransfer::onConnected(void* self, char* /*remote*/, char* /*local*/, int /*remotePort*/,
                               int /*localPort*/) {
-  static_cast<CurlTransfer*>(self)->noteMoved();
-  return CURL_PREREQFUNC_OK;
+  auto* const transfer = static_cast<CurlTransfer*>(self);
+  transfer->noteMoved();
+  return transfer->refuseSecondSending() ? CURL_PREREQFUNC_ABORT : CURL_PREREQFUNC_OK;
+}
+
+size_t CurlTransfer::onRead(char* into, size_t size, size_t count, void* self) {
+  return static_cast<CurlTransfer*>(self)->readBody(into, size * count);
+}
+
+size_t CurlTransfer::readBody(char* into, size_t atMost) {
+  if (request_.body == nullptr) return 0;
+  const size_t count = request_.body->copy(into, atMost, bodyRead_);
+  bodyRead_ += count;
+  return count;
 }
 
 int CurlTransfer::onProgress(void* self, curl_off_t /*downTotal*/, curl_off_t /*down*/,
@@ -169,15 +214,16 @@ size_t CurlTransfer::onHeader(char* bytes, size_t size, size_t count, void* self
 size_t CurlTransfer::receiveBody(std::string_view bytes) {
   noteMoved();
   const HttpClientOptions& options = context_.options;
-  if (bytes.size() > options.maxAnswerBytes - data_.size()) {
-    refusal_ = Error(kHttpErrorDomain, CURLE_FILESIZE_EXCEEDED,
-                     "the answer is larger than " + std::to_string(options.maxAnswerBytes) + " bytes");
+  const size_t most = isAnswered() ? options.maxUnwantedBytes : options.maxAnswerBytes;
+  if (received_ > most || bytes.size() > most - received_) {
+    refusal_ = tooLarge("the answer is larger than " + std::to_string(most) + " bytes");
     return 0;
   }
+  received_ += bytes.size();
+  if (!request_.wantsBody) return bytes.size();
   if (context_.heldAnswerBytes + bytes.size() > options.maxHeldAnswerBytes) {
-    refusal_ = Error(kHttpErrorDomain, CURLE_FILESIZE_EXCEEDED,
-                     "the answers that are arriving are larger than " +
-                         std::to_string(options.maxHeldAnswerBytes) + " bytes together");
+    refusal_ = tooLarge("the answers that are arriving are larger than " +
+                        std::to_string(options.maxHeldAnswerBytes) + " bytes together");
     return 0;
   }
   context_.heldAnswerBytes += bytes.size();
@@ -189,17 +235,17 @@ size_t CurlTransfer::receiveHeader(std::string_view line) {
   noteMoved();
   headerBytes_ += line.size();
   if (headerBytes_ > context_.options.maxHeaderBytes) {
-    refusal_ = Error(
-        kHttpErrorDomain, CURLE_FILESIZE_EXCEEDED,
-        "the answer's headers are larger than " + std::to_string(context_.options.maxHeaderBytes) + " bytes");
+    refusal_ = tooLarge("the answer's headers are larger than " +
+                        std::to_string(context_.options.maxHeaderBytes) + " bytes");
     return 0;
   }
-  if (!data_.empty()) return line.size();  // trailers
+  if (received_ != 0) return line.size();  // trailers
   if (line.starts_with("HTTP/")) {
     headers_.clear();  // what came before belonged to an interim answer
     headersEnded_ = false;
   } else if (line == "\r\n" || line == "\n") {
     headersEnded_ = true;
+    if (!request_.wantsBody && hasFinalHeaders()) context_.answered.push_back(id_);
   } else if ((line.starts_with(' ') || line.starts_with('\t')) && !headers_.empty()) {
     const auto folded = trimmed(line);
     if (!folded.empty()) headers_.back().value.append(" ").append(folded);
@@ -215,22 +261,44 @@ MaybeError CurlTransfer::incompleteAnswer() const {
   return Error(kHttpErrorDomain, CURLE_PARTIAL_FILE, "the connection closed inside the answer's headers");
 }
 
-Result<CurlTransfer::Next> CurlTransfer::followRedirect() {
+int CurlTransfer::status() const {
   long status = 0;
-  char* target = nullptr;
   curl_easy_getinfo(easy_.get(), CURLINFO_RESPONSE_CODE, &status);
+  return static_cast<int>(status);
+}
+
+// An interim answer's headers are not final, nor are those that lead elsewhere.
+bool CurlTransfer::hasFinalHeaders() const {
+  if (!headersEnded_ || status() < 200) return false;
+  return !isRedirect(status()) ||
+         std::none_of(headers_.begin(), headers_.end(), [](const HttpHeader& header) {
+           return equalIgnoringCase(header.name, "Location") && !header.value.empty();
+         });
+}
+
+bool CurlTransfer::isAnswered() const {
+  if (request_.wantsBody || !hasFinalHeaders()) return false;
+  // A server that says no before it has read all is sent no more; one that says yes early goes on reading.
+  if (status() >= 300 || request_.body == nullptr) return true;
+  curl_off_t sent = 0;
+  curl_easy_getinfo(easy_.get(), CURLINFO_SIZE_UPLOAD_T, &sent);
+  return static_cast<size_t>(sent) >= request_.body->size();
+}
+
+Result<CurlTransfer::Next> CurlTransfer::followRedirect() {
+  char* target = nullptr;
   curl_easy_getinfo(easy_.get(), CURLINFO_REDIRECT_URL, &target);
-  if (!isRedirect(status) || target == nullptr) return Next::finished;
+  if (!isRedirect(status()) || target == nullptr) return Next::finished;
   if (++redirects_ > context_.options.maxRedirects) {
     return Error(kHttpErrorDomain, CURLE_TOO_MANY_REDIRECTS,
                  "more than " + std::to_string(context_.options.maxRedirects) + " redirects");
   }
-  if (auto refused = redirectTo(target, status)) return *refused;
+  if (auto refused = redirectTo(target, status())) return *refused;
   dropAnswer();
   return Next::hop;
 }
 
-MaybeError CurlTransfer::redirectTo(const std::string& url, long status) {
+MaybeError CurlTransfer::redirectTo(const std::string& url, int status) {
   const auto from = originOf(request_.url);
   const auto to = originOf(url);
   if (!from || !to) {
@@ -258,21 +326,26 @@ MaybeError CurlTransfer::redirectTo(const std::string& url, long status) {
   return std::nullopt;
 }
 
-HttpResult CurlTransfer::result(CURLcode code) {
+Error CurlTransfer::errorOf(CURLcode code) {
+  if (refusal_) return *std::move(refusal_);
+  if (code == CURLE_SEND_FAIL_REWIND) return notSentAgain();
+  const std::string detail(errorText_.data());
+  return {kHttpErrorDomain, code, curl_easy_strerror(code) + (detail.empty() ? "" : ": " + detail)};
+}
+
+HttpResult CurlTransfer::failure(Error error) {
   HttpResult result;
-  if (refusal_) {
-    result.error = std::move(refusal_);
-  } else if (code != CURLE_OK) {
-    const std::string detail(errorText_.data());
-    result.error =
-        Error(kHttpErrorDomain, code, curl_easy_strerror(code) + (detail.empty() ? "" : ": " + detail));
-  } else {
-    long status = 0;
-    curl_easy_getinfo(easy_.get(), CURLINFO_RESPONSE_CODE, &status);
-    context_.heldAnswerBytes -= data_.size();
-    result.data = std::exchange(data_, std::string());
-    result.response = HttpResponse{static_cast<int>(status), std::move(headers_)};
-  }
+  if (hasFinalHeaders()) result.response = takeResponse();
+  result.error = std::move(error);
+  return result;
+}
+
+HttpResult CurlTransfer::result(CURLcode code) {
+  if (code != CURLE_OK && !isAnswered()) return failure(errorOf(code));
+  HttpResult result;
+  context_.heldAnswerBytes -= data_.size();
+  result.data = std::exchange(data_, std::string());
+  result.response = takeResponse();
   return result;
 }
 

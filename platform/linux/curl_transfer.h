@@ -11,6 +11,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/http_client.h"
 #include "platform/linux/curl_http_client.h"
@@ -29,6 +30,7 @@ struct TransferContext {
   const HttpClientOptions& options;
   X509_STORE* certificates = nullptr;
   size_t heldAnswerBytes = 0;
+  std::vector<uint64_t> answered;  // those that want no body and whose final headers have come
 };
 
 // One request on its way, redirects included. Threads: the client's own only.
@@ -43,8 +45,8 @@ class CurlTransfer {
   // Scheme, name and port of the server that the request goes to next.
   std::string host() const;
 
-  // Prepares a handle for the request as it stands; comes before every hop.
-  MaybeError begin(CurlEasy easy);
+  // Prepares a handle for the request as it stands; comes before every hop. What is returned is the problem.
+  std::optional<std::string> begin(CurlEasy easy);
   CURL* handle() const { return easy_.get(); }
   // When a byte of the hop last moved in either direction; nothing while it waits for its connection.
   std::optional<std::chrono::steady_clock::time_point> lastMoved() const { return moved_; }
@@ -58,8 +60,14 @@ class CurlTransfer {
   enum class Next { finished, hop };
   Result<Next> followRedirect();
 
+  // Whether the result is certain before the answer's body has come: nobody wants it, the final headers are
+  // there, and the request is sent or not wanted any more.
+  bool isAnswered() const;
+
   // The final answer, or why there is none.
   HttpResult result(CURLcode code);
+  // The error, beside what is known of the final answer.
+  HttpResult failure(Error error);
 
   HttpClient::Completion takeCompletion() { return std::move(completion_); }
   CurlEasy takeHandle() { return std::move(easy_); }
@@ -75,13 +83,21 @@ class CurlTransfer {
   void addHeaderLine(const std::string& line);
   void setConnection();
   void dropAnswer();
-  MaybeError redirectTo(const std::string& url, long status);
+  int status() const;
+  bool hasFinalHeaders() const;
+  HttpResponse takeResponse() { return {status(), std::move(headers_)}; }
+  Error errorOf(CURLcode code);
+  MaybeError redirectTo(const std::string& url, int status);
 
+  size_t readBody(char* into, size_t atMost);
   size_t receiveBody(std::string_view bytes);
   size_t receiveHeader(std::string_view line);
   void noteMoved() { moved_ = std::chrono::steady_clock::now(); }
+  bool refuseSecondSending();
+  static curl_socket_t onOpenSocket(void* self, curlsocktype purpose, curl_sockaddr* address);
   static int onConnected(void* self, char* remote, char* local, int remotePort, int localPort);
   static int onProgress(void* self, curl_off_t downTotal, curl_off_t down, curl_off_t upTotal, curl_off_t up);
+  static size_t onRead(char* into, size_t size, size_t count, void* self);
   static size_t onBody(char* bytes, size_t size, size_t count, void* self);
   static size_t onHeader(char* bytes, size_t size, size_t count, void* self);
   static CURLcode onTls(CURL* easy, void* context, void* certificates);
@@ -98,12 +114,14 @@ class CurlTransfer {
   size_t redirects_ = 0;
   std::optional<std::chrono::steady_clock::time_point> moved_;
   curl_off_t sent_ = 0;
+  size_t bodyRead_ = 0;  // by the library, in this hop
 
   std::vector<HttpHeader> headers_;
   size_t headerBytes_ = 0;
   bool headersEnded_ = false;
-  std::string data_;
-  MaybeError refusal_;  // why a callback ended the transfer
+  size_t received_ = 0;  // of the body
+  std::string data_;     // empty when it is not wanted
+  MaybeError refusal_;   // why a callback ended the transfer
 };
 
 }  // namespace tarnel::detail

@@ -22,6 +22,10 @@ std::string headerSafe(std::string_view text) {
   return out;
 }
 
+bool wasCarriedOut(const HttpResult& result) {
+  return !result.error || result.error->domain() != kHttpErrorDomain || result.error->code() >= 0;
+}
+
 HttpResult performAndWait(HttpClient& client, HttpRequest request) {
   // Shared, so that the answer still has a place when it is signalled and this call returns at once.
   struct Wait {

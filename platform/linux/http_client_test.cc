@@ -20,6 +20,18 @@ TEST(HttpResponseTest, findsTheFirstHeaderIgnoringCase) {
   EXPECT_EQ(response.header(""), nullptr);
 }
 
+TEST(HttpResultTest, saysWhetherTheRequestWasCarriedOut) {
+  const auto failure = [](const char* domain, int64_t code) {
+    return HttpResult{std::nullopt, std::nullopt, Error(domain, code, "text")};
+  };
+  EXPECT_TRUE(wasCarriedOut({"", HttpResponse{500, {}}, std::nullopt}));
+  EXPECT_TRUE(wasCarriedOut(failure(kHttpErrorDomain, 7)));
+  EXPECT_TRUE(wasCarriedOut(failure("another", kHttpTooMuchQueued)));
+  for (const int64_t code : {kHttpClientGoingAway, kHttpTooMuchQueued, kHttpBadRequest, kHttpNotBegun}) {
+    EXPECT_FALSE(wasCarriedOut(failure(kHttpErrorDomain, code))) << code;
+  }
+}
+
 TEST(HeaderSafeTest, removesControlCharactersOnly) {
   EXPECT_EQ(headerSafe("evil\r\nX-Other: 1\0\t\x7F\x1F end"s), "evilX-Other: 1 end");
   EXPECT_EQ(headerSafe("caf\xC3\xA9 ~"), "caf\xC3\xA9 ~");

@@ -1,6 +1,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <map>
 #include <mutex>
 
@@ -161,8 +162,7 @@ TEST_F(ReportingServerTest, BrokenAnswersAreToldAndForgotten) {
       {"reset at once", resetting(""), failed},
       {"reset after one byte", resetting("H"), failed},
       {"reset in the headers", resetting(head), failed},
-      {"reset in the body", resetting(head + "\r\nxxx"), failed},
-      {"closed in the body", saying(head + "\r\nxxx"), failed},
+      {"closed in the body", saying(head + "\r\nxxx")},
       {"no HTTP", saying("SSH-2.0-x\r\n"), failed},
       {"garbage in the body", saying(httpAnswer("200 OK", std::string(1000, '\xff')), true)},
       {"silence",
@@ -177,10 +177,53 @@ TEST_F(ReportingServerTest, BrokenAnswersAreToldAndForgotten) {
          while (connection.write(std::string(65536, 'x'))) {
          }
          return false;
-       },
-       failed},
+       }},
   });
   run(server);
+  instance.waitForLog("HTTPSPostBackend(postJsonMessage): post error: ");
+}
+
+// The status decides as soon as it is there, whatever becomes of the body.
+TEST_F(ReportingServerTest, AServerErrorWhoseBodyNeverComesSwitchesABackendOffAtOnce) {
+  instance.setConfiguration("[locale]\ncountry = \"DE\"\n[http]\nno_progress_seconds = 600\n");
+  const std::string head = "HTTP/1.1 503 X\r\nContent-Length: 1000\r\n\r\nxxx";
+  const auto disabled = [](Answer answer) {
+    return Case{"503", std::move(answer), Outcome::disabled,
+                "backend httppost disabled by server 503 return code"};
+  };
+  const CasesServer server({
+      disabled(saying(head)),
+      disabled([head](RawConnection& connection) {
+        connection.write(head);
+        connection.waitForClose();
+        return false;
+      }),
+      disabled([](RawConnection& connection) {
+        if (!connection.write("HTTP/1.1 503 X\r\n\r\n")) return false;
+        while (connection.write(std::string(65536, 'x'))) {
+        }
+        return false;
+      }),
+  });
+  run(server);
+}
+
+TEST_F(ReportingServerTest, ACollectorThatEndsAKeptConnectionGetsEachPostOnce) {
+  const auto answered = std::make_shared<std::atomic<int>>(0);
+  const CasesServer server({{"the third ends the connection", [answered](RawConnection& connection) {
+                               if (++*answered == 3) return false;
+                               return connection.write(httpAnswer("200 OK"));
+                             }}});
+  start(server);
+  TestSession session(instance, {.batch = true, .client = "Case0"});
+  EXPECT_FALSE(post(session).error);
+  EXPECT_FALSE(post(session).error);
+  const auto third = post(session);
+  ASSERT_TRUE(third.error);
+  EXPECT_THAT(third.error->description, HasSubstr("may have arrived and is not sent again"));
+  EXPECT_EQ(server.posts(0), 3);
+  EXPECT_FALSE(post(session).error) << "the next has another connection";
+  EXPECT_EQ(server.posts(0), 4);
   instance.waitForLog("HTTPSPostBackend(postJsonMessage): post error: ");
 }
 

@@ -8,6 +8,7 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <csignal>
 #include <cstring>
@@ -159,6 +160,12 @@ std::string RawHttpServer::url(std::string_view path) const {
 size_t RawHttpServer::connectionCount() const {
   const std::lock_guard lock(mutex_);
   return connections_.size();
+}
+
+size_t RawHttpServer::openConnectionCount() const {
+  const std::lock_guard lock(mutex_);
+  return static_cast<size_t>(std::count_if(connections_.begin(), connections_.end(),
+                                           [](const Connection& connection) { return !connection.ended; }));
 }
 
 void RawHttpServer::acceptAll() {

@@ -59,6 +59,8 @@ class RawHttpServer {
   uint16_t port() const { return port_; }
   std::string url(std::string_view path = "/") const;
   size_t connectionCount() const;
+  // Those that are not closed by this side.
+  size_t openConnectionCount() const;
 
   // A handler that answers every request of a connection with what `answer` gives for it.
   static Handler answering(std::function<std::string(const std::string& request)> answer);

@@ -5,6 +5,10 @@ tells the connection and the path of a request. The program ends with its standa
 
   /together/N  no answer until N requests wait on one connection; the last one that came is answered first
   /reset       the stream is ended with an error instead of an answer
+  /refused     the same, with the error which says that nothing was done with it
+  /http11      the same, with the error which asks for HTTP/1.1
+  /goaway      the connection is ended with a frame which says that nothing was done with this request
+  /gone        the connection is ended without a word
   any other    an answer at once, with the status that follows "?status=", else 202
 
 An answer says which connection it came on and repeats the request's body.
@@ -18,6 +22,13 @@ import h2.config
 import h2.connection
 import h2.errors
 import h2.events
+
+
+RESETS = {
+    "/reset": h2.errors.ErrorCodes.INTERNAL_ERROR,
+    "/refused": h2.errors.ErrorCodes.REFUSED_STREAM,
+    "/http11": h2.errors.ErrorCodes.HTTP_1_1_REQUIRED,
+}
 
 
 class Connection:
@@ -52,8 +63,14 @@ class Connection:
     def request_ended(self, stream):
         path, _, _ = self.requests[stream][0].partition("?")
         print(self.number, path, flush=True)
-        if path == "/reset":
-            self.h2.reset_stream(stream, h2.errors.ErrorCodes.INTERNAL_ERROR)
+        if path in RESETS:
+            self.h2.reset_stream(stream, RESETS[path])
+        elif path == "/goaway":
+            self.h2.close_connection(last_stream_id=stream - 2)
+            self.flush()
+            raise ConnectionAbortedError
+        elif path == "/gone":
+            raise ConnectionAbortedError
         elif path.startswith("/together/"):
             self.waiting.append(stream)
             if len(self.waiting) == int(path.rsplit("/", 1)[1]):

@@ -75,6 +75,11 @@ class Http2Test : public ::testing::Test {
     EXPECT_EQ(*result.response->header("X-Connection"), "1");
     EXPECT_TRUE(result.data == "answer to " + body);
   }
+  void expectNewConnectionWorks() {
+    const auto result = perform({post("/", "after")})[0];
+    ASSERT_FALSE(result.error) << result.error->description();
+    EXPECT_EQ(result.data, "answer to after");
+  }
 
   const TestAuthority authority_{"Test authority"};
   const TestFolder folder_;
@@ -112,6 +117,20 @@ TEST_F(Http2Test, AStreamThatFailsCostsNoOther) {
   expectAnswer(results[0], "one");
   EXPECT_TRUE(results[1].error);
   expectAnswer(results[2], "two");
+}
+
+// Also where the protocol promises that nothing was done with it: not every server keeps that promise.
+TEST_F(Http2Test, APostWithoutAnAnswerIsNotSentAgain) {
+  for (const std::string path : {"/refused", "/http11", "/goaway", "/gone"}) {
+    ASSERT_FALSE(perform({post("/", "first")})[0].error);
+    for (const std::string& body : {std::string("body"), std::string(300000, 'x')}) {
+      const auto result = perform({post(path, body)})[0];
+      ASSERT_TRUE(result.error) << path;
+      EXPECT_TRUE(wasCarriedOut(result));
+    }
+    EXPECT_EQ(countOf(" " + path + "\n", server_->output()), 2U) << server_->output();
+    expectNewConnectionWorks();
+  }
 }
 
 TEST_F(Http2Test, TheDaemonsPostsShareOneConnectionAndItReadsTheirAnswers) {

@@ -124,12 +124,17 @@ TEST_F(LabRoadsTest, AFileThatTheLabRefusesStaysAndMayBeSentAgain) {
 }
 
 TEST_F(LabRoadsTest, AFileSurvivesALabThatEndsTheConnection) {
-  // However often: on a connection that was used before, the daemon tries once more.
-  lab.misbehave("for=uploads&reset=1&count=0");
   const auto path = write("x.log", "text");
   TestSession session(instance, {});
-  EXPECT_TRUE(session.session.uploadFileAndWait(path, kDeadline).ok());
-  EXPECT_TRUE(exists(path));
+  // On a new connection, then on one that was kept for it: it is sent once.
+  EXPECT_TRUE(session.session.uploadFileAndWait(write("before.log", "text"), kDeadline).success);
+  for (size_t times = 1; times <= 2; ++times) {
+    lab.misbehave("for=uploads&reset=1");
+    EXPECT_TRUE(session.session.uploadFileAndWait(path, kDeadline).success);
+    EXPECT_TRUE(exists(path));
+    EXPECT_THAT(lab.uploads(), SizeIs(2 * times));
+    EXPECT_TRUE(session.session.uploadFileAndWait(write("between.log", "text"), kDeadline).success);
+  }
 }
 
 TEST_F(LabRoadsTest, LogDataArrivesDecodedAndItsLocationIsTold) {

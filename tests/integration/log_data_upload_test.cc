@@ -27,7 +27,7 @@ class LogDataUploadTest : public ::testing::Test {
     instance.setConsent(true);
   }
   // The storebag of client type 8: records go to the address, messages to the lab.
-  void serve(const std::string& postURL) const {
+  void serve(const Value& postURL) const {
     lab.serve(
         "brevan",
         storebag("1", {{"httppost", profile({clientEntry(lab.eventsURL(), lab.realtimeURL())})},
@@ -63,6 +63,30 @@ TEST_F(LogDataUploadTest, RecordsArriveAsAnArchive) {
   EXPECT_EQ(*value, Value(Array{Dictionary{{"text", "no route"}}}));
   EXPECT_TRUE(
       instance.waitForLog("DashboardBackend(uploadLogData): Log data uploaded to https://logs.example/1"));
+}
+
+TEST_F(LogDataUploadTest, AnAddressThatLeadsNowhereFailsAndHarmsNothing) {
+  const std::vector<std::pair<Value, std::string>> wrong{
+      {5, "Post URL for log data array is nil"},
+      {Array{"http://127.0.0.1/"}, "Post URL for log data array is nil"},
+      {"", "Error uploading log data array (TarnelHTTPErrorDomain (-3): \"\" is no http or https URL"},
+      {"no url",
+       "Error uploading log data array (TarnelHTTPErrorDomain (-3): \"no url\" is no http or https"},
+      {"ftp://127.0.0.1/logs", "only http and https are supported, not \"ftp\""}};
+  for (const auto& [postURL, line] : wrong) {
+    PrivateInstance daemon;
+    lab.connect(daemon);
+    daemon.setConsent(true);
+    serve(postURL);
+    ASSERT_TRUE(daemon.start());
+    TestSession session(daemon, {});
+    const auto reply = session.session.uploadLogDataAndWait(oneRecord(), kDeadline);
+    EXPECT_TRUE(reply.ok());
+    EXPECT_FALSE(reply.success) << line;
+    EXPECT_TRUE(daemon.waitForLog(line)) << daemon.log();
+    EXPECT_TRUE(session.send(9, 11).ok());
+    daemon.expectAlive();
+  }
 }
 
 TEST_F(LogDataUploadTest, OneThatHangsDelaysNobodyElseNorTheEndOfTheDaemon) {

@@ -50,6 +50,8 @@ bool isOfKind(const Value& value, Kind kind) {
   switch (kind) {
     case Kind::any:
       return !value.isNull();
+    case Kind::anything:
+      return true;
     case Kind::text:
       return value.string() != nullptr;
     case Kind::number:
@@ -69,6 +71,7 @@ bool isOfKind(const Value& value, Kind kind) {
 std::string kindName(Kind kind) {
   switch (kind) {
     case Kind::any:
+    case Kind::anything:
       return "a value";
     case Kind::text:
       return "a text";

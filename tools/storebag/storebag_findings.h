@@ -14,7 +14,15 @@
 
 namespace tarnel::storebag_check {
 
-enum class Kind { any, text, number, texts, list, dictionary };
+enum class Kind {
+  any,
+  anything,  // null too
+  text,
+  number,
+  texts,
+  list,
+  dictionary
+};
 
 struct KeyRule {
   std::string_view key;

@@ -25,9 +25,9 @@ constexpr std::array kBackendRules = {
 
 constexpr std::array kHTTPPostRules = {KeyRule{"clients", Kind::list}, KeyRule{"display_url", Kind::text},
                                        KeyRule{"active", Kind::number}};
-constexpr std::array kDashboardRules = {KeyRule{"ip", Kind::text},         KeyRule{"port", Kind::number},
-                                        KeyRule{"reliable", Kind::number}, KeyRule{"display_url", Kind::text},
-                                        KeyRule{"post_url", Kind::text},   KeyRule{"active", Kind::number}};
+constexpr std::array kDashboardRules = {
+    KeyRule{"ip", Kind::text},          KeyRule{"port", Kind::anything}, KeyRule{"reliable", Kind::anything},
+    KeyRule{"display_url", Kind::text}, KeyRule{"post_url", Kind::text}, KeyRule{"active", Kind::number}};
 constexpr std::array kUploadRules = {KeyRule{"post_url", Kind::text}, KeyRule{"display_url", Kind::text},
                                      KeyRule{"active", Kind::number}};
 constexpr std::array kForwardingRules = {KeyRule{"active", Kind::number}};
@@ -53,18 +53,35 @@ void checkHTTPPost(const Dictionary& profile, const std::string& path, Findings&
   }
 }
 
+// A number that the daemon reads whatever the kind of the value.
+void checkLooseNumber(const Dictionary& profile, const char* key, const std::string& path,
+                      Findings& findings) {
+  const Value* value = profile.find(key);
+  if (value->isNumber()) {
+    checkInteger(profile, key, path, findings);
+  } else {
+    findings.warning(joined(path, key), "is " + typeName(*value) + " and counts as " +
+                                            std::to_string(value->int64Value()) + ": write it as a number");
+  }
+}
+
 void checkReliable(const Dictionary& profile, const std::string& path, Findings& findings) {
   constexpr double kLongest = 3600000;
-  const Value* reliable = valueOf(profile, "reliable", Kind::number);
+  const Value* reliable = profile.find("reliable");
   if (reliable == nullptr) return;
-  if (!(reliable->doubleValue() >= 1)) {
+  if (!reliable->hasInteger()) {
     findings.warning(joined(path, "reliable"),
-                     "any number turns reliable delivery on, also 0 and false; it is the period in "
+                     "any value turns reliable delivery on, also " + typeName(*reliable) +
+                         " without a number, which gets a period of 500 milliseconds: leave the key out to "
+                         "turn it off");
+  } else if (!(reliable->doubleValue() >= 1)) {
+    findings.warning(joined(path, "reliable"),
+                     "any value turns reliable delivery on, also 0 and false; it is the period in "
                      "milliseconds: leave the key out to turn it off");
   } else if (reliable->doubleValue() > kLongest) {
     findings.warning(joined(path, "reliable"), "counts as 3600000: an hour is the longest period");
   } else {
-    checkInteger(profile, "reliable", path, findings);
+    checkLooseNumber(profile, "reliable", path, findings);
   }
 }
 
@@ -82,13 +99,13 @@ void checkDashboard(const Dictionary& profile, const std::string& path, Findings
       findings.error(joined(path, "ip"), "the daemon makes no backend for the broadcast address");
     }
   }
-  const Value* port = valueOf(profile, "port", Kind::number);
-  if (!profile.contains("port")) {
+  const Value* port = profile.find("port");
+  if (port == nullptr) {
     findings.error(joined(path, "port"), "missing: the daemon makes no backend without the server's port");
-  } else if (port != nullptr && !(port->doubleValue() >= 1 && port->doubleValue() < 65536)) {
+  } else if (!(port->doubleValue() >= 1 && port->doubleValue() < 65536)) {
     findings.error(joined(path, "port"), "must be a number from 1 to 65535");
   } else {
-    checkInteger(profile, "port", path, findings);
+    checkLooseNumber(profile, "port", path, findings);
   }
   checkReliable(profile, path, findings);
 }

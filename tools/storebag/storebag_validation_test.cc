@@ -156,7 +156,7 @@ TEST(StorebagValidation, DashboardNeedsAddressAndPort) {
                   {{"dashboard", Dictionary{{"ip", "localhost"}, {"port", 70000}, {"reliable", false}}}}),
               ElementsAre(HasSubstr("ip: must be an IPv4 address in dotted form, but is \"localhost\""),
                           HasSubstr("port: must be a number from 1 to 65535"),
-                          HasSubstr("warning release.dashboard.reliable: any number turns")));
+                          HasSubstr("warning release.dashboard.reliable: any value turns")));
   EXPECT_THAT(
       findingsOfSection({{"dashboard", Dictionary{{"ip", "255.255.255.255"}, {"port", 9}}}}),
       ElementsAre("error release.dashboard.ip: the daemon makes no backend for the broadcast address"));
@@ -170,11 +170,15 @@ TEST(StorebagValidation, DashboardNumbersAreThoseTheDaemonReads) {
   EXPECT_THAT(with(1, 1), IsEmpty());
   EXPECT_THAT(with(65535, 3600000), IsEmpty());
   EXPECT_THAT(
-      with("9", "500"),
-      ElementsAre("error release.dashboard.port: must be a number, but is a text: the daemon takes it for "
-                  "absent",
-                  "error release.dashboard.reliable: must be a number, but is a text: the daemon takes it "
-                  "for absent"));
+      with("9", "500 ms"),
+      ElementsAre("warning release.dashboard.port: is a text and counts as 9: write it as a number",
+                  "warning release.dashboard.reliable: is a text and counts as 500: write it as a number"));
+  for (const Value& none : {Value("nine"), Value(), Value(Array{9}), Value(Dictionary{{"9", 9}})}) {
+    EXPECT_THAT(with(none, none),
+                ElementsAre("error release.dashboard.port: must be a number from 1 to 65535",
+                            AllOf(HasSubstr("warning release.dashboard.reliable: any value turns"),
+                                  HasSubstr("without a number, which gets a period of 500 milliseconds"))));
+  }
   EXPECT_THAT(
       with(9.5, 20.5),
       ElementsAre("warning release.dashboard.port: counts as 9: what stands behind the point is cut off",
