@@ -19,6 +19,7 @@ enum class Kind { any, text, number, texts, list, dictionary };
 struct KeyRule {
   std::string_view key;
   Kind kind;
+  bool wrongMatchesNobody = false;  // instead of counting as absent when it is of another kind
 };
 
 class Findings {
