@@ -49,14 +49,18 @@ void EventFilters::createFiltersFromArray(const std::vector<ProfileSection>& des
 
 const EventFilters::Record* EventFilters::firstMatch(std::string_view name, int32_t method,
                                                      int32_t status) const {
-  // Nearly all names are ASCII, which folds in place; another one may fold to a name of another length.
-  std::string folded;
-  std::string_view wanted = name;
-  if (!isAscii(name)) wanted = folded = foldCase(name);
-  const auto bucket = _buckets[bucketOf(wanted)];
+  // Nearly all names are ASCII. Another one may fold to a name of another length.
+  if (!isAscii(name)) return firstInBucket(foldCase(name), method, status);
+  return firstInBucket(name, method, status);
+}
+
+// The name has the length that it has when folded.
+const EventFilters::Record* EventFilters::firstInBucket(std::string_view name, int32_t method,
+                                                        int32_t status) const {
+  const auto bucket = _buckets[bucketOf(name)];
   for (uint32_t i = bucket.begin; i < bucket.end; ++i) {
     const auto& record = _filters[i];
-    if (!equalsFolded(record.key, wanted)) continue;
+    if (!equalsFolded(record.key, name)) continue;
     if (record.method >= 0 && record.method != method) continue;
     if (record.status >= 0 && record.status != status) continue;
     return &record;

@@ -59,13 +59,11 @@ class EventFilters {
   static constexpr size_t kLongName = 63;
 
   static Record recordFrom(const ProfileSection& description);
-  // `folded`: as all names are looked up, since folding may change a name's length.
-  static size_t bucketOf(std::string_view folded) { 
-    return folded.size() < kLongName ? folded.size() : kLongName;
-  }
+  static size_t bucketOf(std::string_view name) { return name.size() < kLongName ? name.size() : kLongName; }
   template <class MayDigest>
   void apply(Dictionary& event, int32_t method, int32_t status, MayDigest mayDigest) const;
   const Record* firstMatch(std::string_view name, int32_t method, int32_t status) const;
+  const Record* firstInBucket(std::string_view name, int32_t method, int32_t status) const;
 
   // Ordered by bucket, then as described; most fields have a length that no record has and cost one look.
   std::vector<Record> _filters;

@@ -38,6 +38,15 @@ TEST(ListMatchingTest, ExactMatchTakesWholeStringsIgnoringCase) {
   EXPECT_FALSE(matchExactStringWithList(TextList{""}, "a", true));
 }
 
+TEST(ListMatchingTest, LettersOfEveryScriptMatchIgnoringCase) {
+  EXPECT_TRUE(matchExactStringWithList(TextList{"ΟΔΟΣ"}, "οδος", true));
+  EXPECT_TRUE(matchExactStringWithList(TextList{"Ȁրև", "ԱԲ"}, "աբ", true));
+  EXPECT_TRUE(matchExactStringWithList(TextList{"\u212Aey"}, "KEY", true));
+  EXPECT_TRUE(matchStringWithList(TextList{"ＶＩＤＥＯ"}, "my-ｖｉｄｅｏ-call", true));
+  EXPECT_TRUE(matchStringWithList(TextList{"ΟΣ"}, "δρομος 7", true));
+  EXPECT_FALSE(matchExactStringWithList(TextList{"ΟΔΟΣ"}, "οδοσσ", true));
+}
+
 TEST(ListMatchingTest, PartialMatchFindsItemsAnywhereButNeverTheEmptyOne) {
   const MaybeTextList list = TextList{"Video", "x"};
   for (const bool whitelist : {true, false}) {
