@@ -192,9 +192,10 @@ void LinuxWorld::prepareForConfinement() {
     TARNEL_LOG(*log_, warning, "main: this C library keeps large blocks of memory that were freed");
   }
   if (!foldsBeyondAscii()) {
-    TARNEL_LOG(*log_, warning,
-               "main: this system has no locale C.UTF-8: beyond ASCII, capital and small letters of names are "
-               "not taken for the same");
+    TARNEL_LOG(
+        *log_, warning,
+        "main: this system has no locale C.UTF-8: beyond ASCII, capital and small letters of names are "
+        "not taken for the same");
   }
   raiseDescriptorLimit();
   preloadLazyFacilities();

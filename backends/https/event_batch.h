@@ -19,9 +19,9 @@ class EventBatch {
 
   // What is done to every event that is taken.
   struct Finish {
-    Dictionary fields;                      // every entry is set in the event
+    Dictionary fields;                            // every entry is set in the event
     std::set<std::string, std::less<>> digested;  // those of them that are digests
-    const EventFilters* filters = nullptr;  // the event then passes them again; null: it does not
+    const EventFilters* filters = nullptr;        // the event then passes them again; null: it does not
   };
 
   // Memory that the event holds, roughly, in bytes.

@@ -141,8 +141,7 @@ TEST(EventBatchTest, DroppingGivesBackWhatWasTaken) {
 TEST(EventBatchTest, ReplacesWhatOnlyLooksEqual) {
   EventBatch batch;
   batch.append({{"flag", 1}, {"zero", 0.0}, {"text", "same"}}, 10);
-  const Array events =
-      batch.takeEvents({.fields = {{"flag", true}, {"zero", -0.0}, {"text", "same"}}});
+  const Array events = batch.takeEvents({.fields = {{"flag", true}, {"zero", -0.0}, {"text", "same"}}});
   const Dictionary& event = *events[0].dictionary();
   EXPECT_EQ(*event.find("flag"), Value(true));
   EXPECT_TRUE(std::signbit(*event.find("zero")->real()));

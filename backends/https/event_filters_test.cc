@@ -166,7 +166,8 @@ TEST_F(EventFiltersTest, ALaterTableRemovesDigestsAndTakesWhatTheEarlierLeft) {
   Dictionary event{{"a", "v"}, {"b", "v"}, {"c", "v"}, {"d", "v"}};
   auto trace = EventFilters::traceOf(event);
   filters.filterAgain(event, trace);
-  create({describe("a", "remove"), describe("b", "sha256"), describe("c", "sha256"), describe("d", "remove")});
+  create(
+      {describe("a", "remove"), describe("b", "sha256"), describe("c", "sha256"), describe("d", "remove")});
   filters.filterAgain(event, trace);
   EXPECT_EQ(event, (Dictionary{{"b", digestOfV}, {"c", digestOfV}}));
 }

@@ -39,8 +39,8 @@ Dictionary HTTPSPostBackend::newEventDictfromPayload(const MaybeDictionary& payl
                                                      const TimeValue& timestamp, Method method,
                                                      RespCode respCode, EventID /*eventID*/) {
   const int64_t startTS = wholeMinute(startTimeStamp());
-  // Only the offset into the session is sent, so that its exact start stays on the device. Times are integers,
-  // so that no clock makes it infinite; -1 stands for what a message may not hold all the same.
+  // Only the offset into the session is sent, so that its exact start stays on the device. Times are
+  // integers, so that no clock makes it infinite; -1 stands for what a message may not hold all the same.
   const double clientTS =
       finiteOrMinusOne(static_cast<double>(startTS) + (secondsFromTimeValue(timestamp) - startTimeStamp()));
   const size_t more = kStandardFields + (userInfoDict() ? userInfoDict()->size() : 0);

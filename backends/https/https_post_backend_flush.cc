@@ -85,10 +85,9 @@ MaybeString HTTPSPostBackend::postBatch(FlushCompletion completion) {
       continue;
     }
     texts.take();
-    postJSONMessage(std::move(*body), Flag::normal, std::nullopt, std::nullopt,
-                    [join](const MaybeString& /*text*/, MaybeError error) {
-                      join->completeOne(std::move(error));
-                    });
+    postJSONMessage(
+        std::move(*body), Flag::normal, std::nullopt, std::nullopt,
+        [join](const MaybeString& /*text*/, MaybeError error) { join->completeOne(std::move(error)); });
   } while (batch.size() > 0);
   auto text = texts.result();
   join->allExpected(text);

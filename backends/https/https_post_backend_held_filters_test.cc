@@ -65,7 +65,8 @@ TEST_F(HTTPSPostBackendHeldFiltersTest, EventsFromBeforeTheDecisionAreFiltered) 
 }
 
 TEST_F(HTTPSPostBackendHeldFiltersTest, EachEventIsFilteredByItsOwnMethodAndStatus) {
-  filterBy({describe(3, "three", "remove"), Dictionary{{"status", 9}, {"key", "nine"}, {"action", "remove"}}});
+  filterBy(
+      {describe(3, "three", "remove"), Dictionary{{"status", 9}, {"key", "nine"}, {"action", "remove"}}});
   const auto backend = makeUndecided();
   const Dictionary both{{"three", 1}, {"nine", 1}};
   send(*backend, 3, Flag::normal, both, 8);
@@ -131,7 +132,8 @@ TEST_F(HTTPSPostBackendHeldFiltersTest, AnotherTableFiltersWhatTheFirstLeft) {
   filterBy({describe("hashed", "sha256"), describe("b", "sha256"), describe("c", "remove")});
   auto second = entry;
   second.set("client", "Second");
-  second.set("filters", Array{describe("hashed", "sha256"), describe("b", "remove"), describe("d", "sha256")});
+  second.set("filters",
+             Array{describe("hashed", "sha256"), describe("b", "remove"), describe("d", "sha256")});
   clients = Array{entry, second};
   const auto backend = makeUpdated();
   send(*backend, 3, Flag::normal, Dictionary{{"hashed", "h"}, {"b", "b"}, {"c", "c"}, {"d", "d"}});
@@ -184,7 +186,8 @@ TEST_F(HTTPSPostBackendHeldFiltersTest, WhatIsRememberedOfDigestsIsBounded) {
   const auto backend = makeUpdated();
   backend->setState(ReportingState::sampledOut);
   const size_t kMost = EventBatch::kMaxBytes / (2 * name.size());
-  for (size_t i = 0; i < kMost; ++i) send(*backend, static_cast<int>(i), Flag::normal, Dictionary{{name, "v"}});
+  for (size_t i = 0; i < kMost; ++i)
+    send(*backend, static_cast<int>(i), Flag::normal, Dictionary{{name, "v"}});
   EXPECT_FALSE(world.log.startingWith("HTTPSPostBackend(batchEvent)").empty());
 }
 

@@ -233,8 +233,8 @@ TEST_F(HTTPSPostBackendStateTest, NumbersOfAnEntryAreHeldToTheirBounds) {
   expectLog(LogLevel::debug, "resetBackendStateWithClient: event_threshold set to -2147483648");
   expectLog(LogLevel::debug, "setBackendStateWithClient: extras on internal is set to 2147483647");
   world.consent.allowed = false;
-  for (const Value& notOne :
-       {Value(kOneTooHigh), Value(1 - (int64_t{1} << 32)), Value(uint64_t{1} << 63 | 1U), Value(4294967297.0)}) {
+  for (const Value& notOne : {Value(kOneTooHigh), Value(1 - (int64_t{1} << 32)),
+                              Value(uint64_t{1} << 63 | 1U), Value(4294967297.0)}) {
     entry.set("override_dnu", notOne);
     EXPECT_EQ(updated(), ReportingState::disabled) << notOne.description();
   }

@@ -14,8 +14,8 @@ ProfileSection ProfileReader::section(const Dictionary& profile) {
 void ProfileReader::warn(const std::string& shape, const std::string& place, const char* expected,
                          const char* consequence) {
   if (!warned_.insert(shape).second) return;
-  TARNEL_LOG(log_, warning, "%s(%s): %s: %s is not %s and %s", className_, operation_,
-             backendName_.c_str(), place.c_str(), expected, consequence);
+  TARNEL_LOG(log_, warning, "%s(%s): %s: %s is not %s and %s", className_, operation_, backendName_.c_str(),
+             place.c_str(), expected, consequence);
 }
 
 ProfileSection::ProfileSection(ProfileReader& reader, const Dictionary& values, std::string shape,
