@@ -183,6 +183,25 @@ TEST_F(HTTPSPostBackendBatchTest, CorrelatedIdentifierCostsNoEvent) {
   }
 }
 
+TEST_F(HTTPSPostBackendBatchTest, NoCorrelatedIdentifierLeavesTheEventsTheirs) {
+  const auto backend = makeUpdated();
+  backend->setCombinedSessionIDString("own");
+  send(*backend);
+  backend->setCorrelatedSessionID(std::nullopt);
+  flush(*backend);
+  EXPECT_EQ(*postedEvents().at(0).find("_sessionID"), Value("own"));
+}
+
+TEST_F(HTTPSPostBackendBatchTest, EachBatchThatOverflowsSaysSoOnce) {
+  const auto backend = makeUpdated();
+  for (size_t batches = 1; batches <= 2; ++batches) {
+    backend->setState(ReportingState::sampledOut);
+    for (int i = 0; i < 70; ++i) send(*backend, i, Flag::normal, sixtyFourth());
+    EXPECT_EQ(world.log.startingWith("HTTPSPostBackend(batchEvent): httppost").size(), batches);
+    flush(*backend);
+  }
+}
+
 TEST_F(HTTPSPostBackendBatchTest, UserInfoGoesBeforeTheCorrelatedIdentifier) {
   const auto backend = makeUpdated();
   send(*backend);

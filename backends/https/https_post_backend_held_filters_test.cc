@@ -179,6 +179,18 @@ TEST_F(HTTPSPostBackendHeldFiltersTest, EventsOfSeveralMessagesAreDigestedOnce) 
   }
 }
 
+// What the filters take away takes no room in a message.
+TEST_F(HTTPSPostBackendHeldFiltersTest, AMessageIsFilledWithWhatIsLeft) {
+  const auto backend = makeUndecided();
+  constexpr size_t kQuarter = EventBatch::kMaxBytes / 4 - 8192;
+  for (int i = 0; i < 3; ++i) send(*backend, i, Flag::normal, Dictionary{{"secret", std::string(kQuarter, 's')}});
+  userInfo->set("large", std::string(kQuarter, 'x'));
+  decide(*backend);
+  flush(*backend);
+  EXPECT_EQ(messages().size(), 1U);
+  EXPECT_EQ(postedEvents().size(), 3U);
+}
+
 // The names of many digested fields are counted in what a batch may hold.
 TEST_F(HTTPSPostBackendHeldFiltersTest, WhatIsRememberedOfDigestsIsBounded) {
   const std::string name(10000, 'n');
