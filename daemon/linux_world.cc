@@ -13,6 +13,7 @@
 #include "client/shared/tarnel_logging.h"
 #include "daemon/counted_http_client.h"
 #include "daemon/event_loop.h"
+#include "platform/base/text_case.h"
 #include "platform/linux/asio_work_queues.h"
 #include "platform/linux/configuration.h"
 #include "platform/linux/curl_http_client.h"
@@ -166,7 +167,8 @@ struct LinuxWorld::Prepared {
                                   .uploads = uploads,
                                   .workQueues = workQueues,
                                   .datagramSockets = datagramSockets,
-                                  .messageLogDirectory = directories.messageLogDirectory()};
+                                  .messageLogDirectory = directories.messageLogDirectory(),
+                                  .filterHeldEvents = configuration.filterHeldEvents};
 };
 
 LinuxWorld::LinuxWorld() = default;
@@ -189,6 +191,12 @@ void LinuxWorld::prepareForConfinement() {
   ::signal(SIGPIPE, SIG_IGN);
   if (!returnLargeBlocks()) {
     TARNEL_LOG(*log_, warning, "main: this C library keeps large blocks of memory that were freed");
+  }
+  if (!foldsBeyondAscii()) {
+    TARNEL_LOG(
+        *log_, warning,
+        "main: this system has no locale C.UTF-8: beyond ASCII, capital and small letters of names are "
+        "not taken for the same");
   }
   raiseDescriptorLimit();
   preloadLazyFacilities();

@@ -45,6 +45,7 @@ struct Dependencies {
   WorkQueues& workQueues;
   DatagramSockets& datagramSockets;
   std::string messageLogDirectory;
+  bool filterHeldEvents = false;  // held events pass the filters once more before they are posted
 };
 
 }  // namespace tarnel

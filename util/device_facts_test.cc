@@ -111,6 +111,12 @@ TEST(UserInfoKeyTest, LettersBeyondAscii) {
   EXPECT_EQ(userInfoKey(userInfo("\U00010400\U0001F600", "X")), "\U00010428\U0001F600:x");
 }
 
+// As names compare everywhere else.
+TEST(UserInfoKeyTest, NamesThatAreTheSameIgnoringCaseGiveTheSameKey) {
+  EXPECT_EQ(userInfoKey(userInfo("\u039f\u03a3", "\u212aey")), userInfoKey(userInfo("\u03bf\u03c2", "key")));
+  EXPECT_EQ(userInfoKey(userInfo("\u0531", "\uff21")), "\u0561:\uff41");
+}
+
 TEST(UserInfoKeyTest, TextThatIsNotUtf8KeepsItsBytes) {
   EXPECT_EQ(userInfoKey(userInfo("A\xff\xc3", "B\xe2\x82")), "a\xff\xc3:b\xe2\x82");
 }

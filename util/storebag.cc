@@ -1,7 +1,6 @@
 #include "util/storebag.h"
 
 #include <algorithm>
-#include <limits>
 
 #include "util/storebag_internal.h"
 
@@ -88,21 +87,13 @@ std::string requiredVersion(Log& log, const Dictionary& storebag) {
   throw InvalidArgument("fetchStorebagForEnvironmentAndClientType: the storebag has no version");
 }
 
-// Numbers beyond 32 bits are cut to the bounds, never wrapped.
-int32_t boundedRefreshCycle(const Value& value) {
-  if (value.unsignedInteger() != nullptr) return kStorebagMaxAgeSeconds;
-  const int64_t seconds = value.int64Value();
-  if (seconds >= kStorebagMaxAgeSeconds) return kStorebagMaxAgeSeconds;
-  return static_cast<int32_t>(std::max<int64_t>(seconds, std::numeric_limits<int32_t>::min()));
-}
-
 void applyRefreshCycle(Log& log, const Dictionary& storebag, int32_t& maxAge) {
   const auto* value = findNumber(storebag, "refresh_cycle");
   if (value == nullptr) {
     logIgnored(log, storebag, "refresh_cycle", "number");
     return;
   }
-  maxAge = boundedRefreshCycle(*value);
+  maxAge = std::min(value->boundedInt32Value(), kStorebagMaxAgeSeconds);
   TARNEL_LOG(log, information, "fetchStorebagForEnvironmentAndClientType: Store bag override MaxAge=%d",
              maxAge);
 }

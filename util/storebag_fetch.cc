@@ -2,7 +2,6 @@
 
 #include <algorithm>
 #include <chrono>
-#include <limits>
 #include <memory>
 #include <utility>
 
@@ -146,9 +145,7 @@ int32_t maxAgeOfResponse(const HttpResponse* response) {
     const size_t end = std::min(value->find_first_of("= ", start), value->size());
     const std::string element = value->substr(start, end - start);
     if (found) {
-      return static_cast<int32_t>(std::clamp<int64_t>(Value(element).int64Value(),
-                                                      std::numeric_limits<int32_t>::min(),
-                                                      std::numeric_limits<int32_t>::max()));
+      return Value(element).boundedInt32Value();
     }
     found = element == "max-age";
     start = end + 1;

@@ -23,14 +23,23 @@ size_t heapSize(const Value& value) {
   return bytes;
 }
 
-struct SizedField {
+// Equal in every respect, which is quickly seen; of others this is not asked.
+bool isSame(const Value& a, const Value& b) {
+  const bool isPlain = a.type() == Value::Type::string || a.type() == Value::Type::boolean ||
+                       a.type() == Value::Type::integer || a.type() == Value::Type::unsignedInteger;
+  return isPlain && a == b;
+}
+
+}  // namespace
+
+struct EventBatch::SizedField {
   const std::string& key;
   const Value& value;
   size_t entryBytes;
   size_t valueBytes;
 };
 
-std::vector<SizedField> withSizes(const Dictionary& fields) {
+std::vector<EventBatch::SizedField> EventBatch::withSizes(const Dictionary& fields) {
   std::vector<SizedField> sized;
   sized.reserve(fields.size());
   for (const auto& [key, value] : fields) {
@@ -40,32 +49,26 @@ std::vector<SizedField> withSizes(const Dictionary& fields) {
   return sized;
 }
 
-// Equal in every respect, which is quickly seen; of others this is not asked.
-bool isSame(const Value& a, const Value& b) {
-  const bool isPlain = a.type() == Value::Type::string || a.type() == Value::Type::boolean ||
-                       a.type() == Value::Type::integer || a.type() == Value::Type::unsignedInteger;
-  return isPlain && a == b;
+// Costs little where the event has the entries already.
+void EventBatch::setFields(Held& held, const std::vector<SizedField>& fields) {
+  for (const auto& field : fields) {
+    held.trace.digested.erase(field.key);
+    const Value* old = held.event.find(field.key);
+    if (old != nullptr && isSame(*old, field.value)) continue;
+    if (old == nullptr) {
+      held.bytes += field.entryBytes;
+    } else {
+      held.bytes = held.bytes + field.valueBytes - heapSize(*old);
+    }
+    held.event.set(field.key, field.value);
+  }
 }
 
-struct SizeChange {
-  size_t more = 0;
-  size_t less = 0;
-};
-
-SizeChange setField(Dictionary& event, const SizedField& field) {
-  const Value* old = event.find(field.key);
-  if (old != nullptr && isSame(*old, field.value)) return {};
-  const SizeChange change =
-      old == nullptr ? SizeChange{field.entryBytes, 0} : SizeChange{field.valueBytes, heapSize(*old)};
-  event.set(field.key, field.value);
-  return change;
-}
-
-}  // namespace
-
-size_t EventBatch::estimateSize(const Dictionary& event) {
+size_t EventBatch::estimateSize(const Dictionary& event, const FilterTrace& trace) {
+  constexpr size_t kNode = 4 * sizeof(void*);  // of a set, beside the text
   size_t bytes = sizeof(Held);
   for (const auto& [key, value] : event) bytes += sizeof(Dictionary::Entry) + heapSize(key) + heapSize(value);
+  for (const auto& name : trace.digested) bytes += kNode + sizeof(std::string) + heapSize(name);
   return bytes;
 }
 
@@ -73,46 +76,55 @@ bool EventBatch::hasRoomFor(size_t bytes) const noexcept {
   return events_.empty() || (events_.size() < kMaxEvents && bytes_ + bytes <= kMaxBytes);
 }
 
+void EventBatch::removeOldest() {
+  events_.pop_front();
+  if (labelled_ > 0) --labelled_;
+}
+
 size_t EventBatch::makeRoomFor(size_t bytes) {
   size_t dropped = 0;
   for (; !hasRoomFor(bytes); ++dropped) {
     bytes_ -= events_.front().bytes;
-    events_.pop_front();
+    removeOldest();
   }
   return dropped;
 }
 
-void EventBatch::append(Dictionary event, size_t bytes) {
-  events_.push_back({std::move(event), bytes});
+void EventBatch::append(Dictionary event, size_t bytes, FilterTrace trace) {
+  events_.push_back({std::move(event), std::move(trace), bytes});
   bytes_ += bytes;
 }
 
-size_t EventBatch::mergeIntoAll(const Dictionary& fields) {
-  const std::vector<SizedField> sized = withSizes(fields);
-  size_t bytes = 0;
-  for (size_t left = events_.size(); left > 0; --left) {
-    Held& held = events_[left - 1];
-    for (const auto& field : sized) {
-      const SizeChange change = setField(held.event, field);
-      held.bytes = held.bytes + change.more - change.less;
-    }
-    if (left < events_.size() && bytes + held.bytes > kMaxBytes) {
-      events_.erase(events_.begin(), events_.begin() + static_cast<std::ptrdiff_t>(left));
-      bytes_ = bytes;
-      return left;
-    }
-    bytes += held.bytes;
-  }
-  bytes_ = bytes;
-  return 0;
+void EventBatch::labelAll(const Dictionary& label) {
+  label_.merge(label);
+  labelled_ = events_.size();
 }
 
-Array EventBatch::takeEvents() {
+Array EventBatch::takeEvents(const Finish& finish) {
+  const std::vector<SizedField> label = withSizes(label_);
+  const std::vector<SizedField> fields = withSizes(finish.fields);
   Array events;
   events.reserve(events_.size());
-  for (auto& held : events_) events.append(Value(std::move(held.event)));
-  events_.clear();
-  bytes_ = 0;
+  size_t bytes = 0;
+  while (!events_.empty()) {
+    Held& held = events_.front();
+    bytes_ -= held.bytes;
+    if (labelled_ > 0) setFields(held, label);
+    setFields(held, fields);
+    if (finish.filters != nullptr) {
+      held.trace.digested.insert(finish.digested.begin(), finish.digested.end());
+      finish.filters->filterAgain(held.event, held.trace);
+      held.bytes = estimateSize(held.event, held.trace);
+    }
+    bytes += held.bytes;
+    // Finished once more with the next, it becomes what it is now.
+    if (!events.empty() && bytes > kMaxBytes) {
+      bytes_ += held.bytes;
+      return events;
+    }
+    events.append(Value(std::move(held.event)));
+    removeOldest();
+  }
   return events;
 }
 

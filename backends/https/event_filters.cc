@@ -2,15 +2,16 @@
 
 #include <algorithm>
 
-#include "backends/https/case_folding.h"
 #include "backends/tarnel_backend.h"
+#include "platform/base/text_case.h"
 
 namespace tarnel {
 namespace {
 
+// Held to the bounds like the numbers of the filters, so that none fits an event by what it is modulo 2^32.
 int32_t integerField(const Dictionary& event, std::string_view key) {
   const auto* value = event.find(key);
-  return value == nullptr ? 0 : value->int32Value();
+  return value == nullptr ? 0 : value->boundedInt32Value();
 }
 
 }  // namespace
@@ -21,8 +22,8 @@ EventFilters::Record EventFilters::recordFrom(const ProfileSection& description)
   const auto* key = description.findString("key");
   const auto* action = description.findString("action");
   Record record{-1, -1, Action::keep, {}};
-  if (method != nullptr) record.method = method->int32Value();
-  if (status != nullptr) record.status = status->int32Value();
+  if (method != nullptr) record.method = method->boundedInt32Value();
+  if (status != nullptr) record.status = status->boundedInt32Value();
   if (key != nullptr) record.key = foldCase(*key);
   if (action != nullptr && *action == "remove") record.action = Action::remove;
   if (action != nullptr && *action == "sha256") record.action = Action::digest;
@@ -48,6 +49,14 @@ void EventFilters::createFiltersFromArray(const std::vector<ProfileSection>& des
 
 const EventFilters::Record* EventFilters::firstMatch(std::string_view name, int32_t method,
                                                      int32_t status) const {
+  // Nearly all names are ASCII. Another one may fold to a name of another length.
+  if (!isAscii(name)) return firstInBucket(foldCase(name), method, status);
+  return firstInBucket(name, method, status);
+}
+
+// The name has the length that it has when folded.
+const EventFilters::Record* EventFilters::firstInBucket(std::string_view name, int32_t method,
+                                                        int32_t status) const {
   const auto bucket = _buckets[bucketOf(name)];
   for (uint32_t i = bucket.begin; i < bucket.end; ++i) {
     const auto& record = _filters[i];
@@ -59,22 +68,37 @@ const EventFilters::Record* EventFilters::firstMatch(std::string_view name, int3
   return nullptr;
 }
 
-void EventFilters::filterEvent(Dictionary& event) const {
+// Asks `mayDigest` with a field's name before it puts a digest there.
+template <class MayDigest>
+void EventFilters::apply(Dictionary& event, int32_t method, int32_t status, MayDigest mayDigest) const {
   if (_filters.empty()) return;
-  const int32_t method = integerField(event, "_method");
-  const int32_t status = integerField(event, "_status");
   const auto matchesNothing = [this, method, status](const Dictionary::Entry& entry) {
     return firstMatch(entry.first, method, status) == nullptr;
   };
   if (std::all_of(event.begin(), event.end(), matchesNothing)) return;
-  event.editEntries([this, method, status](const std::string& name, Value& value) {
+  event.editEntries([this, method, status, &mayDigest](const std::string& name, Value& value) {
     const auto* record = firstMatch(name, method, status);
     if (record == nullptr || record->action == Action::keep) return true;
     if (record->action == Action::remove) return false;
+    if (!mayDigest(name)) return true;
     const auto* text = value.string();
     value = Value(TarnelBackend::convertIntoSHA256(text != nullptr ? *text : value.description()));
     return true;
   });
+}
+
+void EventFilters::filterEvent(Dictionary& event) const {
+  apply(event, integerField(event, "_method"), integerField(event, "_status"),
+        [](const std::string& /*name*/) { return true; });
+}
+
+FilterTrace EventFilters::traceOf(const Dictionary& event) {
+  return {integerField(event, "_method"), integerField(event, "_status"), {}};
+}
+
+void EventFilters::filterAgain(Dictionary& event, FilterTrace& trace) const {
+  apply(event, trace.method, trace.status,
+        [&trace](const std::string& name) { return trace.digested.insert(name).second; });
 }
 
 }  // namespace tarnel

@@ -2,6 +2,8 @@
 
 #include <array>
 #include <cstdint>
+#include <functional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -10,6 +12,13 @@
 #include "platform/base/value.h"
 
 namespace tarnel {
+
+// What is kept of an event's way through the filters, for an event that passes them again.
+struct FilterTrace {
+  int32_t method = 0;  // by which filters are chosen: the event's own, whatever became of its field
+  int32_t status = 0;
+  std::set<std::string, std::less<>> digested;  // fields whose values are digests already
+};
 
 // The filters of a client entry: which fields of which events are removed, or replaced by their SHA-256
 // digest, before they leave the device.
@@ -28,6 +37,12 @@ class EventFilters {
   // (0 when absent) decides. A value that is not text is digested by its readable text.
   void filterEvent(Dictionary& event) const;
 
+  // Of an event that no filter has seen yet: its numbers, held to 32 bits, and no digests.
+  static FilterTrace traceOf(const Dictionary& event);
+  // filterEvent for an event that may have passed filters before, by this table or another. What is a digest
+  // stays as it is unless it is to be removed; what is digested now is added to the trace.
+  void filterAgain(Dictionary& event, FilterTrace& trace) const;
+
  private:
   enum class Action : int32_t { keep = 0, remove = 1, digest = 2 };
   struct Record {
@@ -45,7 +60,10 @@ class EventFilters {
 
   static Record recordFrom(const ProfileSection& description);
   static size_t bucketOf(std::string_view name) { return name.size() < kLongName ? name.size() : kLongName; }
+  template <class MayDigest>
+  void apply(Dictionary& event, int32_t method, int32_t status, MayDigest mayDigest) const;
   const Record* firstMatch(std::string_view name, int32_t method, int32_t status) const;
+  const Record* firstInBucket(std::string_view name, int32_t method, int32_t status) const;
 
   // Ordered by bucket, then as described; most fields have a length that no record has and cost one look.
   std::vector<Record> _filters;

@@ -46,6 +46,12 @@ TEST_F(EventFiltersTest, OtherActionsLeaveTheField) {
   EXPECT_EQ(filtered(event), event);
 }
 
+TEST_F(EventFiltersTest, NamesOfDifferentLengthMayBeTheSameIgnoringCase) {
+  create({describe("kelvin", "remove"), describe("Ⱥ", "remove"), describe("ΣΟΦΟΣ", "remove")});
+  EXPECT_EQ(filtered({{"\u212Aelvin", 1}, {"ⱥ", 2}, {"Ⱥ", 3}, {"σοφος", 4}, {"σοφοs", 5}}),
+            (Dictionary{{"σοφοs", 5}}));
+}
+
 TEST_F(EventFiltersTest, NamesCompareIgnoringCase) {
   create({describe("UserName", "remove"), describe("STRASSE-Ä", "remove")});
   EXPECT_EQ(filtered({{"username", 1}, {"USERNAME", 2}, {"strasse-ä", 3}, {"usernam", 4}}),
@@ -84,6 +90,30 @@ TEST_F(EventFiltersTest, AbsentMethodAndStatusOfAnEventCountAsZero) {
   EXPECT_EQ(filtered({{"a", "v"}, {"b", "v"}}), (Dictionary{{"b", "v"}}));
 }
 
+// A number that is too large is the largest, and fits no event by its low bits.
+TEST_F(EventFiltersTest, NumbersAreHeldToTheirBounds) {
+  const int64_t tooLarge = (int64_t{1} << 32) + 5;
+  create({Dictionary{{"method", tooLarge}, {"key", "a"}, {"action", "remove"}},
+          Dictionary{{"status", tooLarge}, {"key", "b"}, {"action", "remove"}},
+          Dictionary{{"method", 65536 + 5}, {"key", "c"}, {"action", "remove"}},
+          Dictionary{{"method", UINT64_MAX}, {"status", 1e300}, {"key", "d"}, {"action", "remove"}},
+          Dictionary{{"method", 5.9}, {"key", "e"}, {"action", "remove"}}});
+  const Dictionary event{{"a", 1}, {"b", 1}, {"c", 1}, {"d", 1}, {"_method", 5}, {"_status", 5}};
+  EXPECT_EQ(filtered(event), event);
+  EXPECT_FALSE(filtered({{"e", 1}, {"_method", 5}}).contains("e"));
+  // The same number still fits itself.
+  EXPECT_FALSE(filtered({{"a", 1}, {"_method", tooLarge}}).contains("a"));
+  EXPECT_TRUE(filtered({{"c", 1}, {"_method", tooLarge}}).contains("c"));
+}
+
+// Below 0 means every event, however far below.
+TEST_F(EventFiltersTest, NegativeNumbersStayNegative) {
+  create({Dictionary{{"method", -4294967291}, {"status", -1e300}, {"key", "a"}, {"action", "remove"}}});
+  for (const int number : {0, 5, 6}) {
+    EXPECT_FALSE(filtered({{"a", 1}, {"_method", number}, {"_status", number}}).contains("a")) << number;
+  }
+}
+
 TEST_F(EventFiltersTest, ZeroIsANumberLikeAnyOther) {
   create({Dictionary{{"method", 0}, {"key", "a"}, {"action", "remove"}},
           Dictionary{{"status", 0}, {"key", "b"}, {"action", "remove"}}});
@@ -115,6 +145,42 @@ TEST_F(EventFiltersTest, NewListReplacesTheTable) {
   create({describe("a", "remove")});
   create({describe("b", "remove")});
   EXPECT_EQ(filtered({{"a", "v"}, {"b", "v"}}), (Dictionary{{"a", "v"}}));
+}
+
+TEST_F(EventFiltersTest, WhatIsADigestIsNotDigestedAgain) {
+  create({describe("hashed", "sha256"), describe("gone", "remove")});
+  Dictionary event{{"Hashed", "v"}, {"gone", "v"}, {"stays", "v"}};
+  auto trace = EventFilters::traceOf(event);
+  EXPECT_TRUE(trace.digested.empty());
+  filters.filterAgain(event, trace);
+  const Dictionary once{{"Hashed", digestOfV}, {"stays", "v"}};
+  EXPECT_EQ(event, once);
+  EXPECT_EQ(trace.digested.count("Hashed"), 1U);
+  EXPECT_EQ(trace.digested.size(), 1U);
+  filters.filterAgain(event, trace);
+  EXPECT_EQ(event, once);
+}
+
+TEST_F(EventFiltersTest, ALaterTableRemovesDigestsAndTakesWhatTheEarlierLeft) {
+  create({describe("a", "sha256"), describe("b", "sha256")});
+  Dictionary event{{"a", "v"}, {"b", "v"}, {"c", "v"}, {"d", "v"}};
+  auto trace = EventFilters::traceOf(event);
+  filters.filterAgain(event, trace);
+  create(
+      {describe("a", "remove"), describe("b", "sha256"), describe("c", "sha256"), describe("d", "remove")});
+  filters.filterAgain(event, trace);
+  EXPECT_EQ(event, (Dictionary{{"b", digestOfV}, {"c", digestOfV}}));
+}
+
+TEST_F(EventFiltersTest, ATraceKeepsTheNumbersThatAFilterTook) {
+  create({describe("_method", "remove"), describe("_status", "sha256")});
+  Dictionary event{{"a", "v"}, {"_method", 5}, {"_status", 7}};
+  auto trace = EventFilters::traceOf(event);
+  filters.filterAgain(event, trace);
+  EXPECT_FALSE(event.contains("_method"));
+  create({Dictionary{{"method", 5}, {"status", 7}, {"key", "a"}, {"action", "remove"}}});
+  filters.filterAgain(event, trace);
+  EXPECT_FALSE(event.contains("a"));
 }
 
 TEST_F(EventFiltersTest, RecordsWithoutAKeyFitNothing) {

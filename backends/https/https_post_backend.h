@@ -38,7 +38,8 @@ class HTTPSPostBackend final : public TarnelBackend {
   // Drops the message, posts it or batches it. Returns the text of what was posted.
   MaybeSentObject sendMessage(const MaybeDictionary& payload, const TimeValue& timestamp, Method method,
                               RespCode respCode, EventID eventID, Flag flag) override;
-  // Posts the batch. The completion gets the text of what was posted and the post's error.
+  // Posts the batch: as one message, or as several when, with the user information, it is larger than a batch
+  // may be. The completion gets the text of what was posted and the first error of a post, after the last.
   MaybeString flushMessagesWithCompletion(FlushCompletion completion) override;
   // Also relabels the events of the batch.
   void setCorrelatedSessionID(const MaybeString& correlatedSessionID) override;
@@ -54,9 +55,10 @@ class HTTPSPostBackend final : public TarnelBackend {
   Dictionary newEventDictfromPayload(const MaybeDictionary& payload, const TimeValue& timestamp,
                                      Method method, RespCode respCode, EventID eventID);
   // prepareEventForMessage: sets the user information over the event, then filters it.
-  void prepareEventForMessage(Dictionary& event) const;
-  // batchEvent: returns the text of a flush that it had to start.
-  MaybeString batchEvent(Dictionary event);
+  // The trace is empty unless held events pass the filters again.
+  FilterTrace prepareEventForMessage(Dictionary& event) const;
+  // batchEvent: returns the text of a flush that it had to start. The trace is what preparing the event gave.
+  MaybeString batchEvent(Dictionary event, FilterTrace trace = {});
 
   // createMessageForPostAndLogging:prettyJsonString:
   // The JSON body of a message; nothing when it cannot be written. The events are changed: dates become
@@ -108,8 +110,13 @@ class HTTPSPostBackend final : public TarnelBackend {
   Dictionary stopPayload(const Dictionary& payload) const;
   bool postsAtOnce(bool realtime) const;
   MaybeString postEvent(Dictionary event, Method method, RespCode respCode, Flag flag);
+
+  // https_post_backend_flush.cc
+  bool lacksUserInfo() const;
   bool canFlush() const;
-  void mergeIntoBatch(const Dictionary& fields, const char* operation, const char* what);
+  void discardBatch();
+  EventBatch::Finish finishOfFlush() const;
+  MaybeString postBatch(FlushCompletion completion);
 
   MaybeString _postURL;
   bool _useDefaultPostURL = false;

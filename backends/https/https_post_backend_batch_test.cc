@@ -1,5 +1,4 @@
 #include "backends/https/https_post_backend_fixture.h"
-#include "backends/https/text_format.h"
 
 // What is set in events that are batched already: user information at the flush, identifiers at any time.
 
@@ -14,22 +13,121 @@ class HTTPSPostBackendBatchTest : public HTTPSPostBackendFixture {
   }
 };
 
-// A client may keep back a large user information until many events are held.
-TEST_F(HTTPSPostBackendBatchTest, UserInfoThatComesLateDoesNotOutgrowTheBound) {
+// The largest user information that a session keeps. The events grow by it to much more than a batch may
+// hold; all are posted, in messages that are each within that bound.
+TEST_F(HTTPSPostBackendBatchTest, UserInfoThatComesLateCostsNoEvent) {
   const auto late = userInfo;
   userInfo.reset();
   const auto backend = makeUpdated();
-  for (int i = 0; i < 40; ++i) send(*backend);
+  constexpr int kEvents = 2000;
+  for (int i = 0; i < kEvents; ++i) send(*backend, i);
   userInfo = late;
-  userInfo->set("large", std::string(1U << 20U, 'x'));
+  userInfo->set("large", std::string((64U << 10U) - 200, 'x'));
+  backend->setUserInfoDict(userInfo);
+  backend->updateState();
+  EXPECT_EQ(flush(*backend).second, std::nullopt);
+  int next = 0;
+  const auto requests = world.http.requests();
+  EXPECT_GT(requests.size(), 30U);
+  for (const auto& request : requests) {
+    const std::string body = bodyText(request);
+    EXPECT_LE(body.size(), EventBatch::kMaxBytes);
+    constexpr std::string_view kMethod = "\"_method\":";
+    for (size_t at = body.find(kMethod); at != std::string::npos; at = body.find(kMethod, at + 1)) {
+      EXPECT_EQ(Value(body.substr(at + kMethod.size(), 8)).int64Value(), next++);
+    }
+  }
+  EXPECT_EQ(next, kEvents);
+  EXPECT_TRUE(world.log.startingWith("HTTPSPostBackend(batchEvent)").empty());
+  EXPECT_EQ(flush(*backend).second, Error(kTarnelErrorDomain, -1, "Nothing to flush"));
+}
+
+TEST_F(HTTPSPostBackendBatchTest, HeldEventsThatFitAreOneMessage) {
+  const auto late = userInfo;
+  userInfo.reset();
+  const auto backend = makeUpdated();
+  for (int i = 0; i < 200; ++i) send(*backend, i);
+  userInfo = late;
   backend->setUserInfoDict(userInfo);
   backend->updateState();
   flush(*backend);
-  EXPECT_EQ(postedEvents().size(), 3U);
-  expectLog(
-      LogLevel::warning,
-      "HTTPSPostBackend(flushMessagesWithCompletion): httppost: the oldest 37 events are dropped, since "
-      "with the user information all would exceed 4194304 bytes");
+  EXPECT_EQ(messages().size(), 1U);
+  EXPECT_EQ(postedEvents().size(), 200U);
+}
+
+// Three messages of one event each.
+class HTTPSPostBackendPiecesTest : public HTTPSPostBackendBatchTest {
+ protected:
+  std::shared_ptr<HTTPSPostBackend> makeWithPieces(int pieces = 3) {
+    const auto late = userInfo;
+    userInfo.reset();
+    auto backend = makeUpdated();
+    for (int i = 0; i < pieces; ++i) send(*backend, i);
+    userInfo = late;
+    userInfo->set("large", std::string(EventBatch::kMaxBytes, 'x'));
+    backend->setUserInfoDict(userInfo);
+    backend->updateState();
+    return backend;
+  }
+};
+
+TEST_F(HTTPSPostBackendPiecesTest, TheFlushCompletesAfterTheLastMessageWithTheFirstError) {
+  world.http.holdAnswers(true);
+  const auto backend = makeWithPieces();
+  std::vector<MaybeError> told;
+  backend->flushMessagesWithCompletion(
+      [&told](MaybeString /*text*/, MaybeError error) { told.push_back(std::move(error)); });
+  ASSERT_EQ(world.http.requests().size(), 3U);
+  world.http.answerOldest(fake::FakeHttpClient::status(200));
+  world.http.answerOldest(fake::FakeHttpClient::status(503));
+  EXPECT_TRUE(told.empty());
+  world.http.answerOldest(fake::FakeHttpClient::status(500));
+  ASSERT_EQ(told.size(), 1U);
+  ASSERT_TRUE(told[0]);
+  EXPECT_EQ(told[0]->code(), 503);
+}
+
+TEST_F(HTTPSPostBackendPiecesTest, AnswersBeforeTheLastPostDoNotCompleteTheFlush) {
+  const auto backend = makeWithPieces();
+  EXPECT_EQ(flush(*backend).second, std::nullopt);
+  EXPECT_EQ(world.http.requests().size(), 3U);
+}
+
+TEST_F(HTTPSPostBackendPiecesTest, WithoutAnAddressOneErrorIsTold) {
+  entry.remove("post_url");
+  entry.remove("realtime_post_url");
+  const auto backend = makeWithPieces();
+  EXPECT_EQ(flush(*backend).second, Error(kTarnelErrorDomain, -1, "postURL is nil"));
+}
+
+// The texts are for the log, which need not hold everything.
+TEST_F(HTTPSPostBackendPiecesTest, TheTextTellsTheFirstMessagesAndHowManyMoreThereWere) {
+  const auto backend = makeWithPieces();
+  const auto [text, error] = flush(*backend);
+  ASSERT_TRUE(text);
+  EXPECT_LT(text->size(), EventBatch::kMaxBytes * 3 / 2);
+  EXPECT_TRUE(text->ends_with("}\n(and 2 more messages)")) << text->substr(text->size() - 40);
+}
+
+TEST_F(HTTPSPostBackendPiecesTest, ShorterTextsAreToldOneAfterTheOther) {
+  const auto backend = makeUpdated();
+  for (int i = 0; i < 3; ++i) send(*backend, i);
+  backend->setUserInfoDict(Dictionary{{"large", std::string(EventBatch::kMaxBytes / 5 * 2, 'x')}});
+  const auto [text, error] = flush(*backend);
+  const auto all = messages();
+  ASSERT_EQ(all.size(), 2U);
+  ASSERT_TRUE(text);
+  const auto second = text->find("}\n{");
+  ASSERT_NE(second, std::string::npos);
+  EXPECT_EQ(parsed(text->substr(0, second + 1)), all[0]);
+  EXPECT_EQ(parsed(text->substr(second + 2)), all[1]);
+}
+
+TEST_F(HTTPSPostBackendPiecesTest, WithoutConsentThereIsNoText) {
+  entry.set("override_dnu", 1);
+  const auto backend = makeWithPieces();
+  EXPECT_EQ(flush(*backend).first, std::nullopt);
+  EXPECT_EQ(world.http.requests().size(), 3U);
 }
 
 TEST_F(HTTPSPostBackendBatchTest, CorrelatedIdentifierRelabelsTheBatch) {
@@ -66,41 +164,51 @@ TEST_F(HTTPSPostBackendBatchTest, CorrelatedIdentifierWithoutABatchMakesNone) {
   EXPECT_EQ(backend->combinedSessionIDString(), std::nullopt);
 }
 
-constexpr char kRelabelled[] =
-    "HTTPSPostBackend(setCorrelatedSessionID): httppost: the oldest %zu events are dropped, since with the "
-    "identifier of the session all would exceed 4194304 bytes";
-
-// What cannot be flushed yet is labelled again and goes on growing.
-TEST_F(HTTPSPostBackendBatchTest, CorrelatedIdentifierCountsInTheBoundFromThenOn) {
-  const auto backend = makeUpdated();
-  backend->setState(ReportingState::undecided);
-  for (int i = 0; i < 31; ++i) send(*backend, i, Flag::normal, sixtyFourth());
-  // Now they take twice the room.
-  backend->setCorrelatedSessionID(std::string(EventBatch::kMaxBytes / 64, 'i'));
-  EXPECT_TRUE(world.log.startingWith("HTTPSPostBackend(setCorrelatedSessionID)").empty());
-  EXPECT_TRUE(world.log.startingWith("HTTPSPostBackend(batchEvent)").empty());
-  for (int i = 31; i < 40; ++i) send(*backend, i, Flag::normal, sixtyFourth());
-  EXPECT_FALSE(world.log.startingWith("HTTPSPostBackend(batchEvent)").empty());
-  backend->setState(ReportingState::enabled);
-  flush(*backend);
-  const auto events = postedEvents();
-  ASSERT_EQ(events.size(), 31U);
-  EXPECT_EQ(*events.front().find("_method"), Value(9));
-  EXPECT_EQ(*events.back().find("_method"), Value(39));
-}
-
-TEST_F(HTTPSPostBackendBatchTest, CorrelatedIdentifierOnANearlyFullBatchDropsTheOldestAndSaysSo) {
+// However long it is: nearly full, the batch keeps its events, and room for no fewer.
+TEST_F(HTTPSPostBackendBatchTest, CorrelatedIdentifierCostsNoEvent) {
   const auto backend = makeUpdated();
   backend->setState(ReportingState::undecided);
   for (int i = 0; i < 60; ++i) send(*backend, i, Flag::normal, sixtyFourth());
+  const std::string label(EventBatch::kMaxBytes / 64, 'i');
+  backend->setCorrelatedSessionID(label);
   EXPECT_TRUE(world.log.startingWith("HTTPSPostBackend(batchEvent)").empty());
-  backend->setCorrelatedSessionID(std::string(EventBatch::kMaxBytes / 64, 'i'));
-  expectLog(LogLevel::warning, formatText(kRelabelled, size_t{29}));
   backend->setState(ReportingState::enabled);
   flush(*backend);
+  EXPECT_EQ(messages().size(), 2U);
   const auto events = postedEvents();
-  ASSERT_EQ(events.size(), 31U);
-  EXPECT_EQ(*events.front().find("_method"), Value(29));
+  ASSERT_EQ(events.size(), 60U);
+  for (size_t i = 0; i < 60; ++i) {
+    EXPECT_EQ(*events[i].find("_method"), Value(i));
+    EXPECT_EQ(*events[i].find("_sessionID"), Value(label));
+  }
+}
+
+TEST_F(HTTPSPostBackendBatchTest, NoCorrelatedIdentifierLeavesTheEventsTheirs) {
+  const auto backend = makeUpdated();
+  backend->setCombinedSessionIDString("own");
+  send(*backend);
+  backend->setCorrelatedSessionID(std::nullopt);
+  flush(*backend);
+  EXPECT_EQ(*postedEvents().at(0).find("_sessionID"), Value("own"));
+}
+
+TEST_F(HTTPSPostBackendBatchTest, EachBatchThatOverflowsSaysSoOnce) {
+  const auto backend = makeUpdated();
+  for (size_t batches = 1; batches <= 2; ++batches) {
+    backend->setState(ReportingState::sampledOut);
+    for (int i = 0; i < 70; ++i) send(*backend, i, Flag::normal, sixtyFourth());
+    EXPECT_EQ(world.log.startingWith("HTTPSPostBackend(batchEvent): httppost").size(), batches);
+    flush(*backend);
+  }
+}
+
+TEST_F(HTTPSPostBackendBatchTest, UserInfoGoesBeforeTheCorrelatedIdentifier) {
+  const auto backend = makeUpdated();
+  send(*backend);
+  backend->setCorrelatedSessionID("top.own");
+  backend->setUserInfoDict(Dictionary{{"_sessionID", "mine"}});
+  flush(*backend);
+  EXPECT_EQ(*postedEvents().at(0).find("_sessionID"), Value("mine"));
 }
 
 // The events hold the user information since they were made: the flush has nothing to add, however full the
@@ -110,8 +218,8 @@ TEST_F(HTTPSPostBackendBatchTest, FlushOfAFullBatchLosesNothingToTheSameUserInfo
   const auto backend = makeUpdated();
   for (int i = 0; i < 60; ++i) send(*backend, i);
   flush(*backend);
+  EXPECT_EQ(messages().size(), 1U);
   EXPECT_EQ(postedEvents().size(), 60U);
-  EXPECT_TRUE(world.log.startingWith("HTTPSPostBackend(flushMessagesWithCompletion): httppost").empty());
 }
 
 }  // namespace

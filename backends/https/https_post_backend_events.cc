@@ -39,7 +39,8 @@ Dictionary HTTPSPostBackend::newEventDictfromPayload(const MaybeDictionary& payl
                                                      const TimeValue& timestamp, Method method,
                                                      RespCode respCode, EventID /*eventID*/) {
   const int64_t startTS = wholeMinute(startTimeStamp());
-  // Only the offset into the session is sent, so that its exact start stays on the device.
+  // Only the offset into the session is sent, so that its exact start stays on the device. Times are
+  // integers, so that no clock makes it infinite; -1 stands for what a message may not hold all the same.
   const double clientTS =
       finiteOrMinusOne(static_cast<double>(startTS) + (secondsFromTimeValue(timestamp) - startTimeStamp()));
   const size_t more = kStandardFields + (userInfoDict() ? userInfoDict()->size() : 0);
@@ -67,12 +68,18 @@ Dictionary HTTPSPostBackend::newEventDictfromPayload(const MaybeDictionary& payl
   return event;
 }
 
-void HTTPSPostBackend::prepareEventForMessage(Dictionary& event) const {
+FilterTrace HTTPSPostBackend::prepareEventForMessage(Dictionary& event) const {
   if (userInfoDict()) event.merge(*userInfoDict());
-  _filters.filterEvent(event);
+  if (!dependencies().filterHeldEvents) {
+    _filters.filterEvent(event);
+    return {};
+  }
+  auto trace = EventFilters::traceOf(event);
+  _filters.filterAgain(event, trace);
+  return trace;
 }
 
-MaybeString HTTPSPostBackend::batchEvent(Dictionary event) {
+MaybeString HTTPSPostBackend::batchEvent(Dictionary event, FilterTrace trace) {
   if (!_batchedEvents) _batchedEvents.emplace();
   // User information or a filter may have replaced the number; the key stays within its 16 bits, so that the
   // counts are bounded.
@@ -80,7 +87,7 @@ MaybeString HTTPSPostBackend::batchEvent(Dictionary event) {
   const uint16_t method = methodValue == nullptr ? uint16_t{0} : methodValue->uint16Value();
   const auto found = _eventMethodCounts.find(method);
   int64_t count = found == _eventMethodCounts.end() ? 0 : found->second;
-  const size_t bytes = EventBatch::estimateSize(event);
+  const size_t bytes = EventBatch::estimateSize(event, trace);
 
   MaybeString flushed;
   if (count > _eventThreshold) {
@@ -103,7 +110,7 @@ MaybeString HTTPSPostBackend::batchEvent(Dictionary event) {
         "events and %zu bytes",
         name().c_str(), _batchedEvents->size(), EventBatch::kMaxEvents, EventBatch::kMaxBytes);
   }
-  _batchedEvents->append(std::move(event), bytes);
+  _batchedEvents->append(std::move(event), bytes, std::move(trace));
   _eventMethodCounts[method] = count + 1;
   return flushed;
 }

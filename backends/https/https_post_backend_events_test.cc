@@ -88,13 +88,24 @@ TEST_F(HTTPSPostBackendEventsTest, TimesBeforeTheEpochAreCutTowardZero) {
   EXPECT_EQ(*event.find("_clientTS"), Value(-115.0));
 }
 
-TEST_F(HTTPSPostBackendEventsTest, ExtremeTimesStayFinite) {
+// Times come as integers: the most extreme are finite, however far apart, and keep their offset.
+TEST_F(HTTPSPostBackendEventsTest, ExtremeTimesKeepTheirOffset) {
   const auto backend = make();
   const auto max = std::numeric_limits<int64_t>::max();
   const auto min = std::numeric_limits<int64_t>::min();
   backend->setStartTimestamp({min, 0});
-  const auto event = newEvent(*backend, std::nullopt, {max, 999999});
-  EXPECT_TRUE(std::isfinite(event.find("_clientTS")->doubleValue()));
+  auto event = newEvent(*backend, std::nullopt, {max, 999999});
+  EXPECT_EQ(*event.find("_startTS"), Value(min / 60 * 60));
+  EXPECT_EQ(*event.find("_clientTS"), Value(9223372036854775808.0));
+  EXPECT_EQ(*event.find("eventTime"), Value(9223372036854775808.0));
+  backend->setStartTimestamp({max, 999999});
+  event = newEvent(*backend, std::nullopt, {min, 0});
+  EXPECT_EQ(*event.find("_startTS"), Value(max / 60 * 60));
+  EXPECT_EQ(*event.find("_clientTS"), Value(-9223372036854775808.0));
+  world.clock.set({max, 999999});
+  Array events{Value(event)};
+  EXPECT_EQ(*parsed(*backend->createMessageForPostAndLogging(events, nullptr)).find("postTime"),
+            Value(9223372036854775808.0));
 }
 
 TEST_F(HTTPSPostBackendEventsTest, PayloadEntriesOfTheSameNameAreReplacedInTheirPlace) {

@@ -54,6 +54,7 @@ void HTTPSPostBackend::keepWritableValues(Dictionary& event) const {
   if (allMayStand) return;
   event.editEntries([this](const std::string& key, Value& value) {
     if (const auto* date = value.date()) {
+      // Here alone an infinite time can come in: clients give dates as they like.
       value = Value(finiteOrMinusOne(date->seconds));
       return true;
     }
@@ -78,6 +79,7 @@ bool HTTPSPostBackend::prettyCopyAllowed() const {
 
 std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Array& events,
                                                                             MaybeString* prettyJsonString) {
+  // Finite, since the clock gives integers; what is not finite would be a message that cannot be written.
   const double postTime = finiteOrMinusOne(secondsFromTimeValue(dependencies().clock.timeOfDay()));
   for (auto& event : events.mutableValues()) {
     if (auto* fields = event.mutableDictionary()) keepWritableValues(*fields);

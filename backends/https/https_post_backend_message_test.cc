@@ -380,15 +380,28 @@ TEST_F(HTTPSPostBackendAnswerTest, TransportErrorIsLoggedAndPassedOn) {
             "HTTPSPostBackend(postJsonMessage): post error: TarnelHTTPErrorDomain (7): connection refused");
 }
 
-TEST_F(HTTPSPostBackendAnswerTest, TransportErrorWithAServerStatusStillDisables) {
+// The answer's status came, then it was cut off or stood still: the status decides, and both are logged.
+TEST_F(HTTPSPostBackendAnswerTest, AServerErrorWhoseBodyIsCutOffStillDisables) {
   const auto backend = makeUpdated();
   auto result = fake::FakeHttpClient::status(502);
   result.error = Error(kHttpErrorDomain, 18, "cut short");
   const auto [text, error] = answerWith(*backend, result);
   expectLog(LogLevel::error,
             "HTTPSPostBackend(postJsonMessage): post error: TarnelHTTPErrorDomain (18): cut short");
+  expectLog(LogLevel::information, "postJSONMessage: backend httppost disabled by server 502 return code");
   EXPECT_EQ(backend->state(), ReportingState::disabled);
-  EXPECT_EQ(error->code(), 502);
+  EXPECT_EQ(text, std::nullopt);
+  EXPECT_EQ(error, Error(kTarnelErrorDomain, 502, "backend httppost disabled by server 502 return code"));
+}
+
+TEST_F(HTTPSPostBackendAnswerTest, AnyOtherAnswerWhoseBodyIsCutOffTellsTheTransportsError) {
+  for (const int status : {200, 404, 499, 600}) {
+    const auto backend = makeUpdated();
+    auto result = fake::FakeHttpClient::status(status);
+    result.error = Error(kHttpErrorDomain, 18, "cut short");
+    EXPECT_EQ(answerWith(*backend, result).second, result.error) << status;
+    EXPECT_EQ(backend->state(), ReportingState::enabled) << status;
+  }
 }
 
 TEST_F(HTTPSPostBackendAnswerTest, AnswerToAGoneBackendStillCompletes) {

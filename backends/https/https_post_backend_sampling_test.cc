@@ -165,8 +165,14 @@ TEST_F(HTTPSPostBackendSamplingTest, OverrideSamplingGoesWithAnEntryThatHasNone)
 }
 
 TEST_F(HTTPSPostBackendSamplingTest, ExpediteIsReadAsAnInteger) {
-  for (const auto& [expedite, batches] :
-       {std::pair{Value(0.5), true}, {Value(-1), false}, {Value(true), false}, {Value(false), true}}) {
+  for (const auto& [expedite, batches] : {std::pair{Value(0.5), true},
+                                          {Value(-1), false},
+                                          {Value(true), false},
+                                          {Value(false), true},
+                                          {Value(int64_t{1} << 32), false},
+                                          {Value(INT64_MIN), false},
+                                          {Value(uint64_t{1} << 63), false},
+                                          {Value(-0.9), true}}) {
     entry.set("expedite", expedite);
     EXPECT_EQ(makeUpdated()->batchEvents(), batches) << expedite.description();
   }

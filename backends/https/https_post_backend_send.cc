@@ -2,7 +2,7 @@
 #include "backends/https/text_format.h"
 #include "client/include/tarnel/keys.h"
 
-// When events are posted, batched, flushed and relabelled.
+// When events are posted at once, and when they are batched.
 
 namespace tarnel {
 namespace {
@@ -12,10 +12,6 @@ constexpr RespCode kSessionTypeStop{1};
 
 MaybeSentObject asSent(MaybeString text) {
   return text ? MaybeSentObject(std::move(*text)) : std::nullopt;
-}
-
-Error flushError(const char* text) {
-  return {kTarnelErrorDomain, -1, text};
 }
 
 }  // namespace
@@ -45,7 +41,7 @@ MaybeSentObject HTTPSPostBackend::sendMessage(const MaybeDictionary& payload, co
     }
   }
   auto event = newEventDictfromPayload(extended ? extended : payload, timestamp, method, respCode, eventID);
-  prepareEventForMessage(event);
+  auto trace = prepareEventForMessage(event);
 
   if (isImportant(flag) && state() == ReportingState::sampledOut) setState(ReportingState::enabled);
   const bool realtime = isRealtime(flag);
@@ -53,7 +49,7 @@ MaybeSentObject HTTPSPostBackend::sendMessage(const MaybeDictionary& payload, co
   if (postsAtOnce(realtime)) return asSent(postEvent(std::move(event), method, respCode, flag));
   TARNEL_LOG(log, debug, "HTTPSPostBackend(sendMessage): Batching %d, %d, %d", static_cast<int>(state()),
              batchEvents(), requireUserInfo());
-  return asSent(batchEvent(std::move(event)));
+  return asSent(batchEvent(std::move(event), std::move(trace)));
 }
 
 bool HTTPSPostBackend::postsAtOnce(bool realtime) const {
@@ -86,66 +82,6 @@ MaybeString HTTPSPostBackend::postEvent(Dictionary event, Method method, RespCod
   }
   postJSONMessage(std::move(*body), flag, method, respCode, {});
   return pretty;
-}
-
-bool HTTPSPostBackend::canFlush() const {
-  return state() == ReportingState::enabled && (!requireUserInfo() || userInfoDict());
-}
-
-void HTTPSPostBackend::mergeIntoBatch(const Dictionary& fields, const char* operation, const char* what) {
-  const size_t dropped = _batchedEvents->mergeIntoAll(fields);
-  if (dropped == 0) return;
-  TARNEL_LOG(
-      dependencies().log, warning,
-      "HTTPSPostBackend(%s): %s: the oldest %zu events are dropped, since with the %s all would exceed "
-      "%zu bytes",
-      operation, name().c_str(), dropped, what, EventBatch::kMaxBytes);
-}
-
-MaybeString HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
-  if (_batchedEvents && state() != ReportingState::enabled) {
-    // The counts per method stay: they are of what came since the last post.
-    _batchedEvents.reset();
-    _batchOverflowed = false;
-  }
-  if (!_batchedEvents) {
-    completion(std::nullopt, flushError("Nothing to flush"));
-    return std::nullopt;
-  }
-  if (requireUserInfo() && !userInfoDict()) {
-    completion(std::nullopt, flushError("Can not flush: userInfo is required"));
-    return std::nullopt;
-  }
-  TARNEL_LOG(dependencies().log, debug, "HTTPSPostBackend(flushMessagesWithCompletion): called");
-  if (userInfoDict()) {
-    auto userInfo = *userInfoDict();
-    _filters.filterEvent(userInfo);
-    mergeIntoBatch(userInfo, "flushMessagesWithCompletion", "user information");
-  }
-  auto events = _batchedEvents->takeEvents();
-  MaybeString pretty;
-  auto body = createMessageForPostAndLogging(events, &pretty);
-  _batchedEvents.reset();
-  _batchOverflowed = false;
-  _eventMethodCounts.clear();
-  if (!body) {
-    completion(std::nullopt, flushError("Can not flush: the events can not be written as JSON"));
-    return std::nullopt;
-  }
-  postJSONMessage(
-      std::move(*body), Flag::normal, std::nullopt, std::nullopt,
-      [pretty, completion = std::move(completion)](const MaybeString& /*text*/, MaybeError error) mutable {
-        completion(std::move(pretty), std::move(error));
-      });
-  return pretty;
-}
-
-void HTTPSPostBackend::setCorrelatedSessionID(const MaybeString& correlatedSessionID) {
-  setCombinedSessionIDString(correlatedSessionID);
-  if (!_batchedEvents || !correlatedSessionID) return;
-  Dictionary label;
-  label.set("_sessionID", *correlatedSessionID);
-  mergeIntoBatch(label, "setCorrelatedSessionID", "identifier of the session");
 }
 
 }  // namespace tarnel

@@ -311,22 +311,73 @@ TEST_F(HTTPSPostBackendSendTest, FlushWithoutABatchHasNothingToFlush) {
 
 TEST_F(HTTPSPostBackendSendTest, FlushInAnyStateButEnabledDiscardsTheBatch) {
   for (const auto state : {ReportingState::undecided, ReportingState::disabled, ReportingState::sampledOut}) {
-    const auto backend = makeUpdated();
-    send(*backend);
-    backend->setState(state);
-    expectNothingToFlush(*backend);
-    backend->setState(ReportingState::enabled);
-    expectNothingToFlush(*backend);
+    for (const bool required : {true, false}) {
+      requireUserInfo = required;
+      const auto backend = makeUpdated();
+      send(*backend);
+      backend->setState(state);
+      expectNothingToFlush(*backend);
+      backend->setState(ReportingState::enabled);
+      expectNothingToFlush(*backend);
+    }
   }
   EXPECT_EQ(posts(), 0U);
 }
 
 TEST_F(HTTPSPostBackendSendTest, DiscardComesBeforeTheQuestionForUserInfo) {
+  for (const auto state : {ReportingState::disabled, ReportingState::sampledOut}) {
+    userInfo.reset();
+    const auto backend = makeUpdated();
+    send(*backend);
+    backend->setState(state);
+    expectNothingToFlush(*backend);
+    backend->setState(ReportingState::undecided);
+    expectNothingToFlush(*backend);
+  }
+}
+
+TEST_F(HTTPSPostBackendSendTest, UndecidedWithUserInfoThatIsNotRequiredDiscards) {
+  requireUserInfo = false;
+  userInfo.reset();
+  const auto backend = makeUpdated();
+  backend->setState(ReportingState::undecided);
+  send(*backend);
+  expectNothingToFlush(*backend);
+}
+
+// The events are wanted when the user information comes.
+TEST_F(HTTPSPostBackendSendTest, UndecidedForWantOfUserInfoKeepsTheBatch) {
+  const auto late = userInfo;
   userInfo.reset();
   const auto backend = makeUpdated();
   ASSERT_EQ(backend->state(), ReportingState::undecided);
-  send(*backend);
   expectNothingToFlush(*backend);
+  send(*backend, 3);
+  const auto [text, error] = flush(*backend);
+  EXPECT_EQ(text, std::nullopt);
+  EXPECT_EQ(error, Error(kTarnelErrorDomain, -1, "Can not flush: userInfo is required"));
+  EXPECT_EQ(backend->flushMessagesWithCompletion({}), std::nullopt);
+  EXPECT_TRUE(world.log.startingWith("HTTPSPostBackend(flushMessages").empty());
+  send(*backend, 4);
+  backend->setUserInfoDict(late);
+  backend->updateState();
+  EXPECT_EQ(flush(*backend).second, std::nullopt);
+  const auto events = postedEvents();
+  ASSERT_EQ(events.size(), 2U);
+  EXPECT_EQ(*events[0].find("_method"), Value(3));
+  EXPECT_EQ(*events[1].find("_method"), Value(4));
+}
+
+// The threshold of a method asks for a flush, too.
+TEST_F(HTTPSPostBackendSendTest, ManyHeldEventsOfOneMethodAreKeptForTheUserInfo) {
+  const auto late = userInfo;
+  userInfo.reset();
+  const auto backend = makeUpdated();
+  for (int i = 0; i < 120; ++i) send(*backend, 3);
+  backend->setUserInfoDict(late);
+  backend->updateState();
+  flush(*backend);
+  EXPECT_EQ(postedEvents().size(), 120U);
 }
 
 TEST_F(HTTPSPostBackendSendTest, FlushMergesTheCurrentUserInfoFiltered) {

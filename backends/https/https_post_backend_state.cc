@@ -9,10 +9,6 @@
 namespace tarnel {
 namespace {
 
-MaybeTextList splitText(const std::string* text) {
-  return text == nullptr ? std::nullopt : MaybeTextList(splitAtCommas(*text));
-}
-
 std::string listDescription(const ProfileSection& client, std::string_view key) {
   const auto* list = client.findArray(key);
   return list == nullptr ? "(null)" : description(*list);
@@ -70,8 +66,10 @@ void HTTPSPostBackend::updateRealtimePostLink(const ProfileSection& client) {
 bool HTTPSPostBackend::matchClientNameAndServiceID(const ProfileSection& client,
                                                    const MaybeString& clientName,
                                                    const MaybeString& serviceID) {
-  return matchExactStringWithList(splitText(client.findString("client")), clientName, true) &&
-         matchStringWithList(splitText(client.findString("service")), serviceID, true);
+  MaybeTextList clients;
+  MaybeTextList services;
+  return client.readNames("client", clients) && matchExactStringWithList(clients, clientName, true) &&
+         client.readNames("service", services) && matchStringWithList(services, serviceID, true);
 }
 
 void HTTPSPostBackend::resetBackendStateWithClient(const ProfileSection* client) {
@@ -102,7 +100,7 @@ ReportingState HTTPSPostBackend::updateBackendState() {
 void HTTPSPostBackend::overrideBatching(const ProfileSection& client) {
   const auto* expedite = client.findNumber("expedite");
   if (expedite == nullptr) return;
-  setBatchEvents(expedite->int32Value() == 0);
+  setBatchEvents(expedite->boundedInt32Value() == 0);
   TARNEL_LOG(dependencies().log, debug,
              "HTTPSPostBackend(updateBackendState): Store bag override  _batchEvent=%d", batchEvents());
 }

@@ -222,6 +222,24 @@ TEST_F(HTTPSPostBackendStateTest, OverrideOfOneReportsWithoutConsent) {
   }
 }
 
+// 1 overrides consent, and no number that is 1 modulo 2^32.
+TEST_F(HTTPSPostBackendStateTest, NumbersOfAnEntryAreHeldToTheirBounds) {
+  constexpr int64_t kOneTooHigh = (int64_t{1} << 32) + 1;
+  entry.set("hierarchy", kOneTooHigh);
+  entry.set("event_threshold", -kOneTooHigh);
+  entry.set("extras_on_internal", int64_t{1} << 32);
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  EXPECT_EQ(backend->hierarchy(), INT32_MAX);
+  expectLog(LogLevel::debug, "resetBackendStateWithClient: event_threshold set to -2147483648");
+  expectLog(LogLevel::debug, "setBackendStateWithClient: extras on internal is set to 2147483647");
+  world.consent.allowed = false;
+  for (const Value& notOne : {Value(kOneTooHigh), Value(1 - (int64_t{1} << 32)),
+                              Value(uint64_t{1} << 63 | 1U), Value(4294967297.0)}) {
+    entry.set("override_dnu", notOne);
+    EXPECT_EQ(updated(), ReportingState::disabled) << notOne.description();
+  }
+}
+
 TEST_F(HTTPSPostBackendStateTest, RefusalLeavesWhatEarlierStepsSet) {
   // The first update takes filters, threshold and consent type; the second is refused at the country.
   entry.set("override_dnu", 1);

@@ -46,5 +46,37 @@ TEST_F(HTTPSPostBackendThreadsTest, AnswersMeetASendingAndAReleasedBackend) {
   EXPECT_EQ(world.http.pendingCount(), 0U);
 }
 
+// The first messages of a flush are answered while its last ones are still being made.
+TEST_F(HTTPSPostBackendThreadsTest, AFlushOfSeveralMessagesCompletesOnce) {
+  world.log.setActiveLevel(LogLevel::error);
+  world.http.holdAnswers(true);
+  constexpr size_t kMessages = 8;
+  const auto backend = makeUpdated();
+  for (size_t i = 0; i < kMessages; ++i) send(*backend, static_cast<int>(i));
+  backend->setUserInfoDict(Dictionary{{"large", std::string(EventBatch::kMaxBytes, 'x')}});
+  std::thread answering([this] {
+    for (size_t answered = 0; answered < kMessages;) {
+      if (world.http.pendingCount() == 0) {
+        std::this_thread::yield();
+        continue;
+      }
+      const bool fails = ++answered > 2;
+      world.http.answerOldest(fails ? fake::FakeHttpClient::failure("number " + std::to_string(answered))
+                                    : fake::FakeHttpClient::status(200));
+    }
+  });
+  std::atomic<int> completions{0};
+  MaybeError told;
+  backend->flushMessagesWithCompletion([&completions, &told](MaybeString /*text*/, MaybeError error) {
+    told = std::move(error);
+    ++completions;
+  });
+  answering.join();
+  EXPECT_EQ(completions, 1);
+  ASSERT_TRUE(told);
+  EXPECT_EQ(told->description(), fake::FakeHttpClient::failure("number 3").error->description());
+  EXPECT_EQ(world.http.requests().size(), kMessages);
+}
+
 }  // namespace
 }  // namespace tarnel

@@ -38,9 +38,7 @@ TEST_P(HTTPSPostBackendWrongTypeTest, CountsAsAbsentWithOneWarning) {
 
 INSTANTIATE_TEST_SUITE_P(
     Keys, HTTPSPostBackendWrongTypeTest,
-    ::testing::Values(WrongType{"client", 1, "a text", ReportingState::enabled},
-                      WrongType{"service", Array{"video"}, "a text", ReportingState::enabled},
-                      WrongType{"expedite", "yes", "a number", ReportingState::enabled},
+    ::testing::Values(WrongType{"expedite", "yes", "a number", ReportingState::enabled},
                       WrongType{"hierarchy", "1", "a number", ReportingState::enabled},
                       WrongType{"override_dnu", Value(), "a number", ReportingState::enabled},
                       WrongType{"locale_whitelist", "DE", "an array", ReportingState::disabled},
@@ -56,6 +54,54 @@ INSTANTIATE_TEST_SUITE_P(
                       WrongType{"post_url", 5, "a text", ReportingState::enabled},
                       WrongType{"realtime_post_url", Array(), "a text", ReportingState::enabled}),
     [](const auto& parameter) { return std::string(parameter.param.key); });
+
+// Nobody can tell for whom such an entry is meant, so it is for nobody, rather than for everybody.
+TEST_F(HTTPSPostBackendWrongTypesTest, NamesOfAnotherKindMatchNobody) {
+  const auto right = entry;
+  for (const char* key : {"client", "service"}) {
+    for (const auto& value : {Value(1), Value(), Value(Array{"Meetwell", "video"}), Value(Dictionary()),
+                              Value(Data{77}), Value(Date{1}), Value(true), Value(0.5)}) {
+      world.log.clear();
+      entry = right;
+      entry.set(key, value);
+      EXPECT_EQ(updated(), ReportingState::disabled) << key << " " << value.description();
+      expectLog(LogLevel::warning,
+                kWarning + std::string("clients[0].") + key + " is not a text and matches nobody");
+      EXPECT_EQ(world.log.startingWith(kWarning).size(), 1U);
+    }
+  }
+}
+
+TEST_F(HTTPSPostBackendWrongTypesTest, AnEntryForNobodyLeavesItsPlaceToTheNext) {
+  auto wrong = entry;
+  wrong.set("client", 1);
+  wrong.set("expedite", 1);
+  wrong.set("override_dnu", 1);
+  clients = Array{wrong, entry};
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  EXPECT_TRUE(backend->batchEvents());
+  send(*backend, 0, Flag::realtime, Dictionary(), 1);
+  EXPECT_EQ(*postedEvents().at(0).find("Opt"), Value(0)) << "consent was not overridden";
+}
+
+TEST_F(HTTPSPostBackendWrongTypesTest, WithoutNamesAnEntryForNobodyStillMatchesNobody) {
+  userInfo = Dictionary{{"u", 1}};
+  entry.remove("client");
+  entry.remove("service");
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  entry.set("service", 1);
+  EXPECT_EQ(updated(), ReportingState::disabled);
+}
+
+// Where no user information is required nobody is asked for a name: the first address counts, whosever it is.
+TEST_F(HTTPSPostBackendWrongTypesTest, AddressesOfAnEntryForNobodyCountWithoutRequiredUserInfo) {
+  requireUserInfo = false;
+  entry.set("client", 1);
+  entry.set("expedite", 1);
+  EXPECT_EQ(updated(), ReportingState::enabled);
+  EXPECT_EQ(backend->postURL(), "https://events.example/post");
+  EXPECT_TRUE(backend->batchEvents()) << "but batching is for those whom the entry names";
+}
 
 TEST_F(HTTPSPostBackendWrongTypesTest, WrongTypesInsideListsCountAsAbsent) {
   entry.set("locale_whitelist", Array{1, "DE", 2});
@@ -86,7 +132,7 @@ TEST_F(HTTPSPostBackendWrongTypesTest, EveryUpdateWarnsAnew) {
 }
 
 TEST_F(HTTPSPostBackendWrongTypesTest, ManyWrongEntriesAreOneWarning) {
-  for (int i = 0; i < 100; ++i) clients.append(Dictionary{{"client", 1}, {"service", "none"}});
+  for (int i = 0; i < 100; ++i) clients.append(Dictionary{{"client", 1}, {"service", 1}});
   EXPECT_EQ(updated(), ReportingState::disabled);
   EXPECT_EQ(world.log.startingWith(kWarning).size(), 1U);
 }

@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <string>
 
-#include "backends/https/case_folding.h"
+#include "platform/base/text_case.h"
 
 namespace tarnel {
 namespace {

@@ -11,10 +11,11 @@ ProfileSection ProfileReader::section(const Dictionary& profile) {
   return {*this, profile, {}, {}};
 }
 
-void ProfileReader::warn(const std::string& shape, const std::string& place, const char* expected) {
+void ProfileReader::warn(const std::string& shape, const std::string& place, const char* expected,
+                         const char* consequence) {
   if (!warned_.insert(shape).second) return;
-  TARNEL_LOG(log_, warning, "%s(%s): %s: %s is not %s and counts as absent", className_, operation_,
-             backendName_.c_str(), place.c_str(), expected);
+  TARNEL_LOG(log_, warning, "%s(%s): %s: %s is not %s and %s", className_, operation_, backendName_.c_str(),
+             place.c_str(), expected, consequence);
 }
 
 ProfileSection::ProfileSection(ProfileReader& reader, const Dictionary& values, std::string shape,
@@ -84,9 +85,20 @@ MaybeTextList ProfileSection::findTexts(std::string_view key) const {
   return texts;
 }
 
+bool ProfileSection::readNames(std::string_view key, MaybeTextList& names) const {
+  const auto* value = values_->find(key);
+  if (value == nullptr) return true;
+  if (value->string() == nullptr) {
+    reader_->warn(shapeOf(key), placeOf(key), "a text", "matches nobody");
+    return false;
+  }
+  names = splitAtCommas(*value->string());
+  return true;
+}
+
 int32_t ProfileSection::integerOrZero(std::string_view key) const {
   const auto* number = findNumber(key);
-  return number == nullptr ? 0 : number->int32Value();
+  return number == nullptr ? 0 : number->boundedInt32Value();
 }
 
 }  // namespace tarnel

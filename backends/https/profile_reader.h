@@ -14,8 +14,8 @@ namespace tarnel {
 class ProfileSection;
 
 // Reads a backend's section of the storebag for one operation. A signed document may still hold values of
-// the wrong kind: each counts as absent, and each key that holds such a value is named in one warning, with
-// the first place where it does.
+// the wrong kind: each counts as absent (names excepted, see readNames), and each key that holds such a value
+// is named in one warning, with the first place where it does.
 //
 // Threads: one at a time.
 class ProfileReader {
@@ -29,7 +29,8 @@ class ProfileReader {
 
  private:
   friend class ProfileSection;
-  void warn(const std::string& shape, const std::string& place, const char* expected);
+  void warn(const std::string& shape, const std::string& place, const char* expected,
+            const char* consequence = "counts as absent");
 
   Log& log_;
   std::string backendName_;
@@ -53,7 +54,11 @@ class ProfileSection {
   // The array's items that are texts; nothing without the array.
   MaybeTextList findTexts(std::string_view key) const;
 
-  // As numbers are read where a missing one is 0.
+  // The names of a text, separated by commas; nothing without the key. False, after a warning, for a value of
+  // another kind: nobody can tell for whom the section is meant, and it must not be for everybody.
+  bool readNames(std::string_view key, MaybeTextList& names) const;
+
+  // As numbers are read where a missing one is 0. Held to 32 bits.
   int32_t integerOrZero(std::string_view key) const;
 
  private:

@@ -1,5 +1,6 @@
 #include "platform/base/value.h"
 
+#include <algorithm>
 #include <array>
 #include <cctype>
 #include <charconv>
@@ -145,6 +146,12 @@ bool Value::hasInteger() const noexcept {
 
 uint64_t Value::uint64Value() const noexcept {
   return static_cast<uint64_t>(int64Value());
+}
+
+int32_t Value::boundedInt32Value() const noexcept {
+  using Limits = std::numeric_limits<int32_t>;
+  if (unsignedInteger() != nullptr) return Limits::max();
+  return static_cast<int32_t>(std::clamp<int64_t>(int64Value(), Limits::min(), Limits::max()));
 }
 
 double Value::doubleValue() const noexcept {

@@ -190,6 +190,9 @@ class Value {
   int32_t int32Value() const noexcept { return static_cast<int32_t>(int64Value()); }
   uint32_t uint32Value() const noexcept { return static_cast<uint32_t>(uint64Value()); }
   uint16_t uint16Value() const noexcept { return static_cast<uint16_t>(uint64Value()); }
+  // The number held to the bounds of 32 bits instead of cut to its low ones: how a configuration is read,
+  // where a number that is too large must not come to mean a small one.
+  int32_t boundedInt32Value() const noexcept;
   double doubleValue() const noexcept;
   // Numbers: other than zero. Text: begins (after blanks, a sign and zeros) with Y, y, T, t or 1 to 9.
   bool boolValue() const noexcept;

@@ -69,6 +69,28 @@ TEST(ValueTest, cutsRealsTowardZeroAndHoldsThemToTheRange) {
   EXPECT_EQ(Value(std::nan("")).int64Value(), 0);
 }
 
+TEST(ValueTest, holdsNumbersToThirtyTwoBits) {
+  constexpr int32_t kMost = std::numeric_limits<int32_t>::max();
+  constexpr int32_t kLeast = std::numeric_limits<int32_t>::min();
+  EXPECT_EQ(Value(5).boundedInt32Value(), 5);
+  EXPECT_EQ(Value(-5).boundedInt32Value(), -5);
+  EXPECT_EQ(Value(true).boundedInt32Value(), 1);
+  EXPECT_EQ(Value(int64_t{kMost}).boundedInt32Value(), kMost);
+  EXPECT_EQ(Value(int64_t{kMost} + 1).boundedInt32Value(), kMost);
+  EXPECT_EQ(Value(int64_t{kLeast}).boundedInt32Value(), kLeast);
+  EXPECT_EQ(Value(int64_t{kLeast} - 1).boundedInt32Value(), kLeast);
+  EXPECT_EQ(Value((int64_t{1} << 32) + 1).boundedInt32Value(), kMost);
+  EXPECT_EQ(Value(kMin64).boundedInt32Value(), kLeast);
+  EXPECT_EQ(Value(~uint64_t{0}).boundedInt32Value(), kMost);
+  EXPECT_EQ(Value(1.9).boundedInt32Value(), 1);
+  EXPECT_EQ(Value(-1.9).boundedInt32Value(), -1);
+  EXPECT_EQ(Value(1e300).boundedInt32Value(), kMost);
+  EXPECT_EQ(Value(-kInfinity).boundedInt32Value(), kLeast);
+  EXPECT_EQ(Value(std::nan("")).boundedInt32Value(), 0);
+  EXPECT_EQ(Value("4294967297").boundedInt32Value(), kMost);
+  EXPECT_EQ(Value(Array{1}).boundedInt32Value(), 0);
+}
+
 TEST(ValueTest, readsTheLeadingIntegerOfText) {
   const struct {
     const char* text;

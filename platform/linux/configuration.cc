@@ -101,10 +101,18 @@ const char* takeBundleRoot(const TomlNode& node, Configuration& configuration) {
   return nullptr;
 }
 
+const char* takeFilterHeldEvents(const TomlNode& node, Configuration& configuration) {
+  const bool* on = node.scalar.boolean();
+  if (on == nullptr) return "true or false";
+  configuration.filterHeldEvents = *on;
+  return nullptr;
+}
+
 using C = Configuration;
 constexpr std::array kRules{
     KeyRule{"log", "level", takeLogLevel},
     KeyRule{"locale", "country", takeCountry},
+    KeyRule{"privacy", "filter_held_events", takeFilterHeldEvents},
     KeyRule{"bundles", "root", takeBundleRoot},
     KeyRule{"limits", "idle_exit_seconds", takeIdleExit},
     KeyRule{"limits", "connections",

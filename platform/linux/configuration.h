@@ -42,6 +42,7 @@ struct Configuration {
   };
 
   std::optional<LogLevel> logLevel;    // nothing: the default
+  bool filterHeldEvents = false;       // once more before they are posted
   std::optional<std::string> country;  // ISO 3166, upper case; nothing: from the locale
   Limits limits;
   Http http;

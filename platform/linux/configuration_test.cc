@@ -28,6 +28,7 @@ TEST(Configuration, WithoutFilesTheDefaultsHold) {
   EXPECT_THAT(texts(configuration), IsEmpty());
   EXPECT_FALSE(configuration.logLevel);
   EXPECT_FALSE(configuration.country);
+  EXPECT_FALSE(configuration.filterHeldEvents);
   EXPECT_EQ(configuration.limits.connections, 1024U);
   EXPECT_EQ(configuration.limits.connectionsPerUser, 64U);
   EXPECT_EQ(configuration.limits.idleExit.count(), 0);
@@ -47,6 +48,8 @@ TEST(Configuration, EveryKeyIsTaken) {
 level = "debug"
 [locale]
 country = "DE"
+[privacy]
+filter_held_events = true
 [bundles]
 root = "/srv/tarnel"
 [limits]
@@ -66,6 +69,7 @@ connections = 8
   EXPECT_THAT(texts(configuration), IsEmpty());
   EXPECT_EQ(configuration.logLevel, LogLevel::debug);
   EXPECT_EQ(configuration.country, "DE");
+  EXPECT_TRUE(configuration.filterHeldEvents);
   EXPECT_EQ(configuration.limits.connections, 10U);
   EXPECT_EQ(configuration.limits.connectionsPerUser, 5U);
   EXPECT_EQ(configuration.limits.idleExit.count(), 60);
@@ -175,6 +179,8 @@ TEST(Configuration, BadValuesAreNamedWithWhatWasExpectedAndTheDefaultStays) {
        "log.level must be \"error\", \"warning\", \"information\" or \"debug\" (or 3, 4, 6, 7)"},
       {"locale.country = \"de\"",
        "locale.country must be an ISO 3166 country code of two capital letters, such as \"DE\""},
+      {"privacy.filter_held_events = 1", "privacy.filter_held_events must be true or false"},
+      {"privacy.filter_held_events = \"true\"", "privacy.filter_held_events must be true or false"},
       {"locale.country = 1",
        "locale.country must be an ISO 3166 country code of two capital letters, such as \"DE\""},
       {"log = 1", "log must be a section with this name in brackets"},
@@ -233,6 +239,7 @@ TEST(Configuration, TheShippedFileShowsEveryKeyWithItsDefault) {
   EXPECT_THAT(texts(shown), IsEmpty());
   EXPECT_EQ(shown.logLevel, LogLevel::information);
   EXPECT_EQ(shown.country, "DE");
+  EXPECT_EQ(shown.filterHeldEvents, defaults.filterHeldEvents);
   EXPECT_EQ(shown.limits, defaults.limits);
   EXPECT_EQ(shown.http, defaults.http);
 }
@@ -249,7 +256,7 @@ TEST(Configuration, TheManualNamesEveryKeyOfTheShippedFile) {
       ++keys;
     }
   }
-  EXPECT_EQ(keys, 13U);
+  EXPECT_EQ(keys, 14U);
 }
 
 TEST(Configuration, TrustedCertificatesAreListedByName) {

@@ -7,8 +7,8 @@
 namespace tarnel::storebag_check {
 namespace {
 
-constexpr std::array kEntryRules = {KeyRule{"client", Kind::text},
-                                    KeyRule{"service", Kind::text},
+constexpr std::array kEntryRules = {KeyRule{"client", Kind::text, true},
+                                    KeyRule{"service", Kind::text, true},
                                     KeyRule{"expedite", Kind::number},
                                     KeyRule{"hierarchy", Kind::number},
                                     KeyRule{"override_dnu", Kind::number},

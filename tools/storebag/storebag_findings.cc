@@ -148,7 +148,8 @@ void checkKeys(const Dictionary& dictionary, std::span<const KeyRule> rules, std
       findings.error(joined(path, key),
                      "must be " + kindName(rule->kind) + ", but is " +
                          (mixedList ? "a list that holds other things: the daemon leaves those out"
-                                    : typeName(value) + ": the daemon takes it for absent"));
+                                    : typeName(value) + ": the daemon takes it for " +
+                                          (rule->wrongMatchesNobody ? "matching nobody" : "absent")));
     }
   }
 }
@@ -163,7 +164,7 @@ std::optional<int32_t> checkInteger(const Dictionary& dictionary, std::string_vi
   const Value* number = valueOf(dictionary, key, Kind::number);
   if (number == nullptr) return std::nullopt;
   const double written = number->doubleValue();
-  const int32_t read = number->int32Value();
+  const int32_t read = number->boundedInt32Value();
   if (written != read) {
     const bool isFraction = std::trunc(written) == read;
     findings.warning(joined(path, key),

@@ -27,6 +27,7 @@ enum class Kind {
 struct KeyRule {
   std::string_view key;
   Kind kind;
+  bool wrongMatchesNobody = false;  // instead of counting as absent when it is of another kind
 };
 
 class Findings {

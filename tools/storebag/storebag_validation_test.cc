@@ -213,6 +213,16 @@ TEST(StorebagValidation, WhatKeepsAClientEntryDisabled) {
   EXPECT_THAT(findingsWithout("client"), IsEmpty());
 }
 
+TEST(StorebagValidation, NamesThatAreNoTextMatchNobody) {
+  for (const std::string key : {"client", "service"}) {
+    EXPECT_THAT(findingsWith(key, 5), ElementsAre("error " + std::string(kEntry) + key +
+                                                  ": must be a text, but is a number: the daemon takes it "
+                                                  "for matching nobody"));
+  }
+  EXPECT_THAT(findingsWith("post_url", 5),
+              Contains(HasSubstr("must be a text, but is a number: the daemon takes it for absent")));
+}
+
 TEST(StorebagValidation, EveryEntryKeyHasItsType) {
   for (const char* key : {"client", "service", "post_url", "realtime_post_url"}) {
     EXPECT_THAT(findingsWith(key, 5), Contains(HasSubstr(std::string(key) + ": must be a text, but is")))
@@ -259,7 +269,7 @@ TEST(StorebagValidation, NumbersThatTheDaemonReadsOtherwise) {
   for (const char* key : {"expedite", "hierarchy", "extras_on_internal", "event_threshold", "override_dnu"}) {
     const std::string warning = "warning " + std::string(kEntry) + key + ": counts as ";
     EXPECT_THAT(findingsWith(key, 1), IsEmpty()) << key;
-    EXPECT_THAT(findingsWith(key, (int64_t{1} << 32) + 1), ElementsAre(warning + "1" + range)) << key;
+    EXPECT_THAT(findingsWith(key, (int64_t{1} << 32) + 1), Contains(warning + "2147483647" + range)) << key;
     EXPECT_THAT(findingsWith(key, 1.5), ElementsAre(warning + "1: what stands behind the point is cut off"))
         << key;
     EXPECT_THAT(findingsWith(key, 0.5), ElementsAre(warning + "0: what stands behind the point is cut off"))
@@ -268,17 +278,19 @@ TEST(StorebagValidation, NumbersThatTheDaemonReadsOtherwise) {
   }
   const std::string entry = std::string("warning ") + kEntry;
   EXPECT_THAT(findingsWith("event_threshold", int64_t{1} << 31),
-              ElementsAre(entry + "event_threshold: counts as -2147483648" + range,
-                          HasSubstr("event_threshold: below 0")));
+              ElementsAre(entry + "event_threshold: counts as 2147483647" + range));
   EXPECT_THAT(findingsWith("event_threshold", UINT64_MAX),
-              ElementsAre(entry + "event_threshold: counts as -1" + range, HasSubstr("below 0")));
+              ElementsAre(entry + "event_threshold: counts as 2147483647" + range));
+  EXPECT_THAT(findingsWith("event_threshold", INT64_MIN),
+              ElementsAre(entry + "event_threshold: counts as -2147483648" + range, HasSubstr("below 0")));
   EXPECT_THAT(findingsWith("hierarchy", -1), ElementsAre(HasSubstr("hierarchy: levels begin at 0")));
   EXPECT_THAT(findingsWith("sampling_threshold", std::nan("")),
               ElementsAre(entry + "sampling_threshold: is not a number: no session comes to lie below it"));
   const Dictionary filter{
       {"key", "a"}, {"action", "keep"}, {"method", (int64_t{1} << 32) + 7}, {"status", 1.5}};
   EXPECT_THAT(findingsWith("filters", Array{filter}),
-              ElementsAre(entry + "filters[0].method: counts as 7" + range,
+              ElementsAre(entry + "filters[0].method: counts as 2147483647" + range,
+                          entry + "filters[0].method: no event has one above 65535: the filter never acts",
                           entry + "filters[0].status: counts as 1: what stands behind the point is cut off"));
 }
 

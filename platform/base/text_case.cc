@@ -1,0 +1,84 @@
+#include "platform/base/text_case.h"
+
+#include <locale.h>
+#include <wctype.h>
+
+#include <algorithm>
+#include <array>
+
+#include "platform/base/value.h"
+
+namespace tarnel {
+namespace {
+
+// Made before main, because its data lies in files that the sandbox closes, and never freed, because threads
+// may still use it while the process ends. Null where the system has no such locale.
+const locale_t kCaseLocale = newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr);
+
+constexpr char foldAscii(char c) {
+  return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
+}
+
+// Length in bytes of the character that begins with this byte of well-formed UTF-8.
+constexpr size_t characterLength(char first) {
+  const auto byte = static_cast<unsigned char>(first);
+  if (byte < 0x80) return 1;
+  if (byte < 0xE0) return 2;
+  return byte < 0xF0 ? 3 : 4;
+}
+
+char32_t decodeCharacter(std::string_view bytes) {
+  constexpr std::array<uint32_t, 5> kLeadBits = {0, 0x7F, 0x1F, 0x0F, 0x07};
+  auto code = static_cast<unsigned char>(bytes.front()) & kLeadBits[bytes.size()];
+  for (const char c : bytes.substr(1)) code = (code << 6U) | (static_cast<unsigned char>(c) & 0x3FU);
+  return static_cast<char32_t>(code);
+}
+
+void appendCharacter(std::string& out, char32_t code) {
+  if (code < 0x80) {
+    out += static_cast<char>(code);
+    return;
+  }
+  const int continuations = code < 0x800 ? 1 : code < 0x10000 ? 2 : 3;
+  constexpr std::array<uint32_t, 4> kLeads = {0, 0xC0, 0xE0, 0xF0};
+  out += static_cast<char>(kLeads[static_cast<size_t>(continuations)] | (code >> (6 * continuations)));
+  for (int i = continuations - 1; i >= 0; --i) out += static_cast<char>(0x80U | ((code >> (6 * i)) & 0x3FU));
+}
+
+char32_t foldCharacter(char32_t code) {
+  const wint_t capital = towupper_l(static_cast<wint_t>(code), kCaseLocale);
+  return static_cast<char32_t>(towlower_l(capital, kCaseLocale));
+}
+
+}  // namespace
+
+std::string foldCase(std::string_view text) {
+  std::string folded;
+  if (isAscii(text) || !foldsBeyondAscii() || !isValidUtf8(text)) {
+    folded.resize(text.size());
+    std::transform(text.begin(), text.end(), folded.begin(), foldAscii);
+    return folded;
+  }
+  folded.reserve(text.size());
+  while (!text.empty()) {
+    const auto character = text.substr(0, characterLength(text.front()));
+    text.remove_prefix(character.size());
+    appendCharacter(folded, foldCharacter(decodeCharacter(character)));
+  }
+  return folded;
+}
+
+bool equalsFolded(std::string_view folded, std::string_view text) {
+  const size_t common = std::min(folded.size(), text.size());
+  for (size_t i = 0; i < common; ++i) {
+    if (static_cast<unsigned char>(text[i]) >= 0x80) return folded.substr(i) == foldCase(text.substr(i));
+    if (folded[i] != foldAscii(text[i])) return false;
+  }
+  return folded.size() == text.size();
+}
+
+bool foldsBeyondAscii() noexcept {
+  return kCaseLocale != nullptr;
+}
+
+}  // namespace tarnel
