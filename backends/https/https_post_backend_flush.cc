@@ -46,7 +46,7 @@ bool HTTPSPostBackend::canFlush() const {
   return state() == ReportingState::enabled && !lacksUserInfo();
 }
 
-// The counts per method stay.
+// The counts per method stay: they are of what came since the last post.
 void HTTPSPostBackend::discardBatch() {
   _batchedEvents.reset();
   _batchOverflowed = false;
