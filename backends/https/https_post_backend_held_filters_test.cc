@@ -183,7 +183,8 @@ TEST_F(HTTPSPostBackendHeldFiltersTest, EventsOfSeveralMessagesAreDigestedOnce) 
 TEST_F(HTTPSPostBackendHeldFiltersTest, AMessageIsFilledWithWhatIsLeft) {
   const auto backend = makeUndecided();
   constexpr size_t kQuarter = EventBatch::kMaxBytes / 4 - 8192;
-  for (int i = 0; i < 3; ++i) send(*backend, i, Flag::normal, Dictionary{{"secret", std::string(kQuarter, 's')}});
+  for (int i = 0; i < 3; ++i)
+    send(*backend, i, Flag::normal, Dictionary{{"secret", std::string(kQuarter, 's')}});
   userInfo->set("large", std::string(kQuarter, 'x'));
   decide(*backend);
   flush(*backend);

@@ -7,7 +7,8 @@
 
 // Text ignoring case, for the whole system. Every letter becomes the small letter of its capital, by the
 // tables of the C library, one character to one: so "σ" and the final "ς" agree, "s" and the long "ſ", "k"
-// and the Kelvin sign. The user's locale plays no part. A letter and its folded form may differ in length.
+// and the Kelvin sign, and "i" with or without its dot. The user's locale plays no part. A letter and its
+// folded form may differ in length.
 //
 // Where the system has no locale "C.UTF-8", and in text that is not UTF-8, only the letters of ASCII are
 // folded.

@@ -45,6 +45,7 @@ TEST(TextCaseTest, LettersWithTheSameCapitalAgree) {
   EXPECT_EQ(foldCase("µ"), "μ") << "micro sign and mu";
   EXPECT_EQ(foldCase("ϐϑϕ"), "βθφ");
   EXPECT_EQ(foldCase("ǅ"), "ǆ");
+  EXPECT_EQ(foldCase("ıİ"), "ii") << "with and without its dot";
 }
 
 TEST(TextCaseTest, FormsOfDifferentLengthAgree) {
