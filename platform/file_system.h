@@ -11,7 +11,6 @@
 
 namespace tarnel {
 
-inline constexpr char kFileErrorDomain[] = "TarnelFileErrorDomain";
 // Code of the listing error that means: there is no such directory. Every other code is an errno.
 inline constexpr int64_t kFileReadNoSuchFileError = 260;
 

@@ -1,12 +1,8 @@
 #pragma once
 
-#include <array>
-#include <cstdint>
-#include <string>
+#include "platform/base/uuid.h"
 
 namespace tarnel {
-
-using UuidBytes = std::array<uint8_t, 16>;
 
 // Threads: any.
 class Random {
@@ -21,8 +17,5 @@ class Random {
   // A random UUID (RFC 4122 version 4).
   virtual UuidBytes uuid() = 0;
 };
-
-// Canonical 36-character text, upper case: "8-4-4-4-12" hexadecimal digits (RFC 4122 section 3).
-std::string uuidText(const UuidBytes& uuid);
 
 }  // namespace tarnel

@@ -4,7 +4,7 @@
 #include <utility>
 
 #include "client/include/tarnel/keys.h"
-#include "client/shared/tarnel_logging.h"
+#include "platform/base/log_text.h"
 #include "session/separately.h"
 #include "session/tarneld_session.h"
 #include "util/device_facts.h"

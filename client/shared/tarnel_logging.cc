@@ -10,17 +10,15 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <cstdio>
 #include <cstdlib>
 #include <utility>
 
-#include "platform/base/value.h"
+#include "platform/base/log_text.h"
 
 namespace tarnel {
 
 namespace {
 
-constexpr size_t kMaxText = 16384;
 // As much as fits into any pipe or socket that says it can take something.
 constexpr size_t kMaxWrite = 4096;
 constexpr int kWaitMilliseconds = 1000;
@@ -50,60 +48,7 @@ const char* variable(const char* name) {
   return text == nullptr ? "" : text;
 }
 
-// Length of the well-formed UTF-8 sequence at the front; 0 when there is none.
-size_t sequenceLength(std::string_view text) {
-  for (size_t length = 1; length <= 4 && length <= text.size(); ++length) {
-    if (isValidUtf8(text.substr(0, length))) return length;
-  }
-  return 0;
-}
-
-void appendEscape(std::string& out, char character) {
-  switch (character) {
-    case '\n':
-      out += "\\n";
-      return;
-    case '\r':
-      out += "\\r";
-      return;
-    case '\t':
-      out += "\\t";
-      return;
-    default:
-      std::array<char, 8> escape{};
-      std::snprintf(escape.data(), escape.size(), "\\x%02x", static_cast<unsigned char>(character));
-      out += escape.data();
-  }
-}
-
-// Terminals obey the control characters U+0080 to U+009F as well.
-bool isControl(std::string_view sequence) {
-  const auto first = static_cast<unsigned char>(sequence[0]);
-  if (sequence.size() == 1) return first < 0x20 || first == 0x7F;
-  return sequence.size() == 2 && first == 0xC2 && static_cast<unsigned char>(sequence[1]) < 0xA0;
-}
-
 }  // namespace
-
-std::string escapedForLog(std::string_view text) {
-  if (text.ends_with('\n')) text.remove_suffix(1);
-  const size_t cut = text.size() > kMaxText ? text.size() - kMaxText : 0;
-  text = text.substr(0, kMaxText);
-  std::string out;
-  out.reserve(text.size());
-  while (!text.empty()) {
-    const size_t length = sequenceLength(text);
-    const std::string_view sequence = text.substr(0, length == 0 ? 1 : length);
-    if (length == 0 || isControl(sequence)) {
-      for (const char character : sequence) appendEscape(out, character);
-    } else {
-      out += sequence;
-    }
-    text.remove_prefix(sequence.size());
-  }
-  if (cut != 0) out += " [" + std::to_string(cut) + " bytes more]";
-  return out;
-}
 
 TarnelLogging::Environment TarnelLogging::Environment::ofProcess() {
   return {.standardError = STDERR_FILENO,

@@ -16,8 +16,7 @@ namespace tarnel {
 // The log of a process: the journal when the service manager connected standard error to it, else standard
 // error itself with "<N>" before each line, which a service manager reads as the line's priority.
 //
-// A text takes one line, whatever it holds: line ends, control characters and bytes that are no UTF-8 are
-// written as escapes, so that a client's text cannot pass for a line of ours. Texts beyond 16 KiB are cut.
+// A text takes one line, whatever it holds (see escapedForLog).
 // A reader that does not read delays a line by at most a second; then it is lost, and the next line that can
 // be written is preceded by the count of lost ones.
 //
@@ -68,8 +67,5 @@ class TarnelLogging final : public Log {
   uint64_t lost_ = 0;     // guarded by mutex_; lines since the last one that was written
   bool midLine_ = false;  // guarded by mutex_; the last line was written in part
 };
-
-// The text on one line, as described above.
-std::string escapedForLog(std::string_view text);
 
 }  // namespace tarnel

@@ -94,15 +94,6 @@ TEST_F(TarnelLoggingTest, ATextCannotForgeALine) {
   EXPECT_EQ(written(), line(6, "client says x\\n<3>tarneld[1]: forged\\r\\x1b[2J\\x7f\\t"));
 }
 
-TEST_F(TarnelLoggingTest, TextIsKeptAndWhatIsNoneIsEscaped) {
-  EXPECT_EQ(escapedForLog("Grüße € 𝄞"), "Grüße € 𝄞");
-  EXPECT_EQ(escapedForLog("a\xFF\xC3"), "a\\xff\\xc3");
-  EXPECT_EQ(escapedForLog("csi \xC2\x9B end"), "csi \\xc2\\x9b end");
-  EXPECT_EQ(escapedForLog("end\n"), "end");
-  EXPECT_EQ(escapedForLog("end\n\n"), "end\\n");
-  EXPECT_EQ(escapedForLog(std::string(16384 + 7, 'x')), std::string(16384, 'x') + " [7 bytes more]");
-}
-
 TEST_F(TarnelLoggingTest, AfterTheStopNothingIsWritten) {
   const auto log = start();
   log->stopLogging();

@@ -32,6 +32,9 @@ class Error {
 
 using MaybeError = std::optional<Error>;
 
+// Errors of files and folders; the code is the system's errno.
+inline constexpr char kFileErrorDomain[] = "TarnelFileErrorDomain";
+
 // What a backend's send hands back for the message log and the client: the text of what it sent, or an error.
 using SentObject = std::variant<std::string, Error>;
 using MaybeSentObject = std::optional<SentObject>;

@@ -13,8 +13,6 @@
 #include <memory>
 #include <system_error>
 
-#include "platform/file_system.h"
-
 namespace tarnel {
 
 namespace {

@@ -12,7 +12,7 @@
 #include "platform/linux/unique_fd.h"
 
 // Reading and replacing small files whole, and the rule by which a file is trusted. Errors carry
-// kFileErrorDomain (platform/file_system.h), the errno as code, and a text with the file's name.
+// kFileErrorDomain, the errno as code, and a text with the file's name.
 //
 // Threads: any.
 
