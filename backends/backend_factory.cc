@@ -7,7 +7,7 @@
 #include "backends/tarnel_backend.h"
 #include "backends/upload/upload_backend.h"
 #include "backends/vesmer/vesmer_backend.h"
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 #include "util/device_facts.h"
 
 namespace tarnel {

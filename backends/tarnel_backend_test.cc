@@ -6,8 +6,8 @@
 #include "backends/dravik/dravik_backend.h"
 #include "backends/https/https_post_backend.h"
 #include "backends/vesmer/vesmer_backend.h"
-#include "client/include/tarnel/keys.h"
 #include "platform/fake/fake_world.h"
+#include "tarnel/keys.h"
 
 namespace tarnel {
 namespace {

@@ -7,8 +7,8 @@
 #include <stdexcept>
 
 #include "bench/sample_payload.h"
-#include "client/include/tarnel/keys.h"
 #include "platform/ipc/wire.h"
+#include "tarnel/keys.h"
 
 namespace tarnel::bench {
 namespace {

@@ -4,7 +4,7 @@
 #include <cstdint>
 #include <string>
 
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 
 namespace tarnel::bench {
 namespace {

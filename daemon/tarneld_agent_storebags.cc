@@ -4,8 +4,8 @@
 #include <cstdlib>
 #include <utility>
 
-#include "client/include/tarnel/keys.h"
 #include "daemon/tarneld_agent.h"
+#include "tarnel/keys.h"
 #include "util/storebag.h"
 
 namespace tarnel {

@@ -7,12 +7,12 @@
 #include <string>
 #include <vector>
 
-#include "client/include/tarnel/keys.h"
 #include "daemon/tarneld_agent.h"
 #include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
 #include "platform/fake/lock_probe.h"
 #include "session/fake_backends.h"
+#include "tarnel/keys.h"
 
 namespace tarnel::fake {
 

@@ -1,6 +1,6 @@
 #include "session/backend_set.h"
 
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 #include "util/device_facts.h"
 
 namespace tarnel {

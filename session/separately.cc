@@ -3,7 +3,7 @@
 #include <exception>
 #include <string>
 
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 
 namespace tarnel {
 namespace {

@@ -5,8 +5,8 @@
 
 #include <stdexcept>
 
-#include "client/include/tarnel/keys.h"
 #include "platform/fake/fake_log.h"
+#include "tarnel/keys.h"
 
 namespace tarnel::fake {
 namespace {

@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <utility>
 
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 
 namespace tarnel {
 

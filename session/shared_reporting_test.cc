@@ -2,8 +2,8 @@
 
 #include <gtest/gtest.h>
 
-#include "client/include/tarnel/keys.h"
 #include "platform/fake/fake_world.h"
+#include "tarnel/keys.h"
 
 namespace tarnel::fake {
 namespace {

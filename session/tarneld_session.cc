@@ -2,9 +2,9 @@
 
 #include <utility>
 
-#include "client/include/tarnel/keys.h"
 #include "platform/cryptography.h"
 #include "session/separately.h"
+#include "tarnel/keys.h"
 #include "util/device_facts.h"
 
 namespace tarnel {

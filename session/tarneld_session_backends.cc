@@ -3,8 +3,8 @@
 #include <algorithm>
 #include <utility>
 
-#include "client/include/tarnel/keys.h"
 #include "session/tarneld_session.h"
+#include "tarnel/keys.h"
 
 namespace tarnel {
 namespace {

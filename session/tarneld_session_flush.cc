@@ -4,9 +4,9 @@
 #include <memory>
 #include <utility>
 
-#include "client/include/tarnel/keys.h"
 #include "session/separately.h"
 #include "session/tarneld_session.h"
+#include "tarnel/keys.h"
 #include "util/message_log.h"
 
 namespace tarnel {

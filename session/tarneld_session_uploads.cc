@@ -3,10 +3,10 @@
 #include <array>
 #include <utility>
 
-#include "client/include/tarnel/keys.h"
 #include "platform/base/log_text.h"
 #include "session/separately.h"
 #include "session/tarneld_session.h"
+#include "tarnel/keys.h"
 #include "util/device_facts.h"
 #include "util/message_log.h"
 

@@ -4,8 +4,8 @@
 #include <cstring>
 #include <string_view>
 
-#include "client/include/tarnel/keys.h"
 #include "platform/base/text_case.h"
+#include "tarnel/keys.h"
 
 namespace tarnel {
 namespace {

@@ -6,8 +6,8 @@
 #include <utility>
 #include <vector>
 
-#include "client/include/tarnel/keys.h"
 #include "platform/fake/fake_device.h"
+#include "tarnel/keys.h"
 
 namespace tarnel {
 namespace {

@@ -1,5 +1,5 @@
 #include "backends/dashboard/dashboard_backend_fixture.h"
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 
 // Making a dashboard backend, and what is left when that fails.
 

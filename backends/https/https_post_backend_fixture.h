@@ -11,9 +11,9 @@
 #include <vector>
 
 #include "backends/https/https_post_backend.h"
-#include "client/include/tarnel/keys.h"
 #include "platform/document.h"
 #include "platform/fake/fake_world.h"
+#include "tarnel/keys.h"
 
 namespace tarnel {
 

@@ -1,6 +1,6 @@
 #include "backends/https/flush_join.h"
 #include "backends/https/https_post_backend.h"
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 
 // When a batch is posted, kept or discarded, and how its events are relabelled.
 

@@ -1,7 +1,7 @@
 #include "backends/https/https_post_backend.h"
 #include "backends/https/sender_names.h"
 #include "backends/https/text_format.h"
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 #include "util/compression.h"
 
 // Posting a message, and what its answer does.

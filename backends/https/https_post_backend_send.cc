@@ -1,6 +1,6 @@
 #include "backends/https/https_post_backend.h"
 #include "backends/https/text_format.h"
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 
 // When events are posted at once, and when they are batched.
 

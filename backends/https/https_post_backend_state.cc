@@ -1,7 +1,7 @@
 #include <algorithm>
 
 #include "backends/https/https_post_backend.h"
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 #include "util/identifiers.h"
 
 // Which reporting state follows from the profile.

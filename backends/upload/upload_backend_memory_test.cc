@@ -5,7 +5,7 @@
 
 #include "backends/https/https_post_backend_fixture.h"
 #include "backends/upload/upload_backend.h"
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 
 // A program of its own: it stands between the whole program and zlib.
 

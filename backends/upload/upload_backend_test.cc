@@ -7,7 +7,7 @@
 #include <thread>
 
 #include "backends/https/https_post_backend_fixture.h"
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 
 namespace tarnel {
 namespace {

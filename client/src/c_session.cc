@@ -1,4 +1,4 @@
-#include "client/include/tarnel/tarnel_c_session.h"
+#include "tarnel/tarnel_c_session.h"
 
 #include <algorithm>
 #include <chrono>

@@ -3,7 +3,7 @@
 #include <cstdio>
 #include <utility>
 
-#include "client/include/tarnel/tarnel_c_types.h"
+#include "tarnel/tarnel_c_types.h"
 
 namespace tarnel::core {
 namespace {

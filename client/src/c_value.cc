@@ -1,4 +1,4 @@
-#include "client/include/tarnel/tarnel_c_value.h"
+#include "tarnel/tarnel_c_value.h"
 
 #include <cstring>
 #include <memory>

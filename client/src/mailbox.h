@@ -7,10 +7,10 @@
 #include <mutex>
 #include <vector>
 
-#include "client/include/tarnel/tarnel_c_session.h"
 #include "client/src/descriptor.h"
 #include "client/src/options.h"
 #include "client/src/request.h"
+#include "tarnel/tarnel_c_session.h"
 
 namespace tarnel::core {
 

@@ -5,10 +5,10 @@
 #include <utility>
 #include <vector>
 
-#include "client/include/tarnel/tarnel_c_types.h"
 #include "platform/base/error.h"
 #include "platform/base/one_shot.h"
 #include "platform/base/value.h"
+#include "tarnel/tarnel_c_types.h"
 
 // What calls of the library come to.
 

@@ -9,7 +9,7 @@
 
 namespace tarnel {
 
-// What went wrong: a domain (see client/include/tarnel/keys.h for the system's own), a code of that domain
+// What went wrong: a domain (see include/tarnel/keys.h for the system's own), a code of that domain
 // and a sentence for people. Immutable; absent where an std::optional<Error> is empty.
 class Error {
  public:

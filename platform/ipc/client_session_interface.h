@@ -12,7 +12,7 @@
 #include "platform/base/value.h"
 
 // The two protocols between a client process and the daemon. Each side implements one and calls the other
-// through a proxy; dictionaries use the keys of client/include/tarnel/keys.h.
+// through a proxy; dictionaries use the keys of include/tarnel/keys.h.
 
 namespace tarnel {
 

@@ -1,6 +1,6 @@
 #include "platform/linux/adaptor_values.h"
 
-#include "client/include/tarnel/tarnel_adaptor.h"
+#include "tarnel/tarnel_adaptor.h"
 
 namespace tarnel {
 

@@ -4,7 +4,7 @@
 
 #include <string>
 
-#include "client/include/tarnel/tarnel_adaptor.h"
+#include "tarnel/tarnel_adaptor.h"
 
 // The table of functions with which an adaptor reads what it is handed.
 

@@ -10,9 +10,9 @@
 #include <utility>
 #include <vector>
 
-#include "client/include/tarnel/tarnel_adaptor.h"
 #include "platform/linux/adaptor_values.h"
 #include "platform/linux/trusted_path.h"
+#include "tarnel/tarnel_adaptor.h"
 
 namespace tarnel {
 

@@ -11,7 +11,7 @@
 
 namespace tarnel {
 
-// Bundles whose code is a shared library, as client/include/tarnel/tarnel_adaptor.h describes them: the
+// Bundles whose code is a shared library, as include/tarnel/tarnel_adaptor.h describes them: the
 // library lies in the bundle's folder under the folder's name without its ending, and exports one C function.
 //
 // A library is loaded only when nobody but root and this process's user could have written to it (see

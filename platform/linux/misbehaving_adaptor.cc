@@ -5,7 +5,7 @@
 #include <string>
 #include <string_view>
 
-#include "client/include/tarnel/tarnel_adaptor.h"
+#include "tarnel/tarnel_adaptor.h"
 
 #define FAULT_NONE 0
 #define FAULT_NO_EXPORT 1

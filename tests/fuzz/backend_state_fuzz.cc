@@ -5,9 +5,9 @@
 #include <string>
 #include <vector>
 
-#include "client/include/tarnel/keys.h"
 #include "platform/fake/fake_world.h"
 #include "session/backend_set.h"
+#include "tarnel/keys.h"
 #include "tests/fuzz/posted_message.h"
 #include "tests/fuzz/value_input.h"
 

@@ -4,7 +4,7 @@
 #include <array>
 #include <stdexcept>
 
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 #include "tests/fuzz/session_bytes.h"
 #include "tests/fuzz/session_world.h"
 #include "tests/fuzz/socket_peer.h"

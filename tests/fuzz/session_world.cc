@@ -2,7 +2,7 @@
 
 #include <algorithm>
 
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 #include "tests/fuzz/posted_message.h"
 #include "tests/fuzz/value_input.h"
 

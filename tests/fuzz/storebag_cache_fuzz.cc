@@ -11,11 +11,11 @@
 #include <optional>
 #include <string>
 
-#include "client/include/tarnel/keys.h"
 #include "daemon/tarneld_agent.h"
 #include "platform/document.h"
 #include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
+#include "tarnel/keys.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/storebag_expectation.h"
 #include "tests/fuzz/values.h"

@@ -6,8 +6,8 @@
 #include <utility>
 #include <vector>
 
-#include "client/include/tarnel/keys.h"
-#include "client/include/tarnel/tarnel.h"
+#include "tarnel/keys.h"
+#include "tarnel/tarnel.h"
 #include "tests/helpers/private_instance.h"
 #include "tests/helpers/waiting.h"
 

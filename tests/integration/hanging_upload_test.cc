@@ -9,9 +9,9 @@
 #include <vector>
 
 #include "backends/upload/upload_backend.h"
-#include "client/include/tarnel/tarnel.h"
 #include "platform/fake/fake_world.h"
 #include "platform/linux/ipc/ipc_test_support.h"
+#include "tarnel/tarnel.h"
 #include "tests/helpers/waiting.h"
 
 // Uploads from the client library through the IPC service to the upload backend, while the server that should

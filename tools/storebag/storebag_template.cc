@@ -1,6 +1,6 @@
 #include "tools/storebag/storebag_template.h"
 
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 
 namespace tarnel {
 

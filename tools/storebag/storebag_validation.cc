@@ -4,7 +4,7 @@
 
 #include <array>
 
-#include "client/include/tarnel/keys.h"
+#include "tarnel/keys.h"
 #include "tools/storebag/storebag_findings.h"
 
 namespace tarnel {

@@ -1,7 +1,7 @@
 #pragma once
 
-#include "client/include/tarnel/tarnel.h"
 #include "platform/base/value.h"
+#include "tarnel/tarnel.h"
 #include "tools/tarnelctl/terminal.h"
 
 // From the values that documents are read into to those of the client library.

@@ -6,8 +6,8 @@
 #include <ostream>
 #include <utility>
 
-#include "client/include/tarnel/keys.h"
 #include "platform/document.h"
+#include "tarnel/keys.h"
 #include "tools/tarnelctl/client_values.h"
 #include "tools/tarnelctl/typed_value.h"
 

@@ -5,8 +5,8 @@
 #include <string>
 #include <vector>
 
-#include "client/include/tarnel/tarnel.h"
 #include "platform/base/value.h"
+#include "tarnel/tarnel.h"
 #include "tools/tarnelctl/terminal.h"
 
 // `tarnelctl send` and `tarnelctl single`: one message to the daemon.

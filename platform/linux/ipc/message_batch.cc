@@ -8,10 +8,10 @@
 #include <utility>
 #include <variant>
 
-#include "client/include/tarnel/keys.h"
 #include "platform/ipc/dbus_codec.h"
 #include "platform/ipc/wire.h"
 #include "platform/linux/ipc/connection_loop.h"
+#include "tarnel/keys.h"
 
 namespace tarnel {
 namespace {
