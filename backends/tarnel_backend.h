@@ -7,10 +7,10 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/error.h"
-#include "platform/base/one_shot.h"
-#include "platform/base/types.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/one_shot.h"
+#include "base/types.h"
+#include "base/value.h"
 #include "util/dependencies.h"
 
 namespace tarnel {

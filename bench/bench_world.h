@@ -9,10 +9,10 @@
 #include <vector>
 
 #include "backends/https/https_post_backend.h"
+#include "base/unique_fd.h"
 #include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
 #include "platform/ipc/dbus_codec.h"
-#include "platform/linux/unique_fd.h"
 #include "session/tarneld_session.h"
 
 namespace tarnel::bench {

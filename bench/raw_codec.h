@@ -3,7 +3,7 @@
 #include <optional>
 #include <span>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel::bench {
 

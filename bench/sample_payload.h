@@ -2,7 +2,7 @@
 
 #include <cstddef>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel::bench {
 

@@ -10,10 +10,10 @@
 #include <cstdlib>
 #include <utility>
 
+#include "base/text_case.h"
 #include "client/shared/tarnel_logging.h"
 #include "daemon/counted_http_client.h"
 #include "daemon/event_loop.h"
-#include "platform/base/text_case.h"
 #include "platform/linux/asio_work_queues.h"
 #include "platform/linux/configuration.h"
 #include "platform/linux/curl_http_client.h"

@@ -4,7 +4,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 #include "platform/ipc/ipc.h"
 #include "util/dependencies.h"
 

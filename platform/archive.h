@@ -5,8 +5,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 
 // Keyed object archives: a value and all that is in it as a table of objects, in which equal objects stand
 // once and are referred to by their place. docs/keyed-archive.md describes the format.

@@ -5,7 +5,7 @@
 #include <memory>
 #include <string>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 
 namespace tarnel {
 

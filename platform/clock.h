@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/base/types.h"
+#include "base/types.h"
 
 namespace tarnel {
 

@@ -3,8 +3,8 @@
 #include <memory>
 #include <string>
 
-#include "platform/base/types.h"
-#include "platform/base/value.h"
+#include "base/types.h"
+#include "base/value.h"
 
 // Code that is delivered apart from the daemon: a bundle is found by its path, loaded, and asked for a class
 // by name; an instance of that class has its methods called by name.

@@ -8,7 +8,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 // Digests, signatures and base-64. Threads: all functions may be called from any thread.
 

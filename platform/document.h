@@ -6,8 +6,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 
 // Structured documents in two forms, told apart by their first byte:
 // text form: JSON (RFC 8259); a date is {"$date": "<RFC 3339>"}, data is {"$data": "<base-64>"}; a dictionary

@@ -6,8 +6,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 
 namespace tarnel {
 

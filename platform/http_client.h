@@ -9,8 +9,8 @@
 #include <utility>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/base/one_shot.h"
+#include "base/error.h"
+#include "base/one_shot.h"
 
 namespace tarnel {
 

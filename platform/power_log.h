@@ -3,7 +3,7 @@
 #include <cstdint>
 #include <string>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel {
 

@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/base/uuid.h"
+#include "base/uuid.h"
 
 namespace tarnel {
 

@@ -5,7 +5,7 @@
 #include <memory>
 #include <string>
 
-#include "platform/base/one_shot.h"
+#include "base/one_shot.h"
 
 namespace tarnel {
 

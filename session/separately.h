@@ -2,8 +2,8 @@
 
 #include <utility>
 
-#include "platform/base/error.h"
-#include "platform/base/log.h"
+#include "base/error.h"
+#include "base/log.h"
 
 namespace tarnel {
 

@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "backends/tarnel_backend.h"
-#include "platform/base/thread_annotations.h"
+#include "base/thread_annotations.h"
 #include "session/backend_set.h"
 
 namespace tarnel {

@@ -4,8 +4,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/base/thread_annotations.h"
-#include "platform/base/value.h"
+#include "base/thread_annotations.h"
+#include "base/value.h"
 
 namespace tarnel {
 

@@ -3,7 +3,7 @@
 #include <array>
 #include <utility>
 
-#include "platform/base/log_text.h"
+#include "base/log_text.h"
 #include "session/separately.h"
 #include "session/tarneld_session.h"
 #include "tarnel/keys.h"

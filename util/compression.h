@@ -4,7 +4,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 
 namespace tarnel {
 

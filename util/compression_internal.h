@@ -13,7 +13,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 #include "util/compression.h"
 
 // Parts of the compression that its tests reach.

@@ -2,8 +2,8 @@
 
 #include <string>
 
+#include "base/log.h"
 #include "client/shared/consent_identifiers.h"
-#include "platform/base/log.h"
 #include "platform/client_bundle.h"
 #include "platform/clock.h"
 #include "platform/code_bundle.h"

@@ -4,7 +4,7 @@
 #include <cstring>
 #include <string_view>
 
-#include "platform/base/text_case.h"
+#include "base/text_case.h"
 #include "tarnel/keys.h"
 
 namespace tarnel {

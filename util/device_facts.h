@@ -2,7 +2,7 @@
 
 #include <cstddef>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "platform/device_information.h"
 
 // What the rest of the daemon asks about the device. Nothing means that the device has no answer.

@@ -5,8 +5,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/log.h"
-#include "platform/base/value.h"
+#include "base/log.h"
+#include "base/value.h"
 #include "platform/cryptography.h"
 #include "platform/device_information.h"
 #include "platform/random.h"

@@ -5,7 +5,7 @@
 #include <span>
 #include <string>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "platform/cryptography.h"
 #include "util/dependencies.h"
 

@@ -3,7 +3,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 // For tests: a storebag server's side of the signature.
 

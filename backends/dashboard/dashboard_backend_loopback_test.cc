@@ -9,9 +9,9 @@
 #include <set>
 
 #include "backends/dashboard/dashboard_backend_fixture.h"
+#include "base/unique_fd.h"
 #include "platform/linux/asio_work_queues.h"
 #include "platform/linux/udp_sockets.h"
-#include "platform/linux/unique_fd.h"
 #include "tests/helpers/waiting.h"
 
 // Delivery over real UDP, through a network that loses, repeats, delays and reorders.

@@ -8,8 +8,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/types.h"
-#include "platform/base/value.h"
+#include "base/types.h"
+#include "base/value.h"
 
 // What goes over the wire to a dashboard server; docs/dashboard-datagrams.md describes it for servers.
 //

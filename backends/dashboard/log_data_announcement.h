@@ -1,7 +1,7 @@
 #pragma once
 
-#include "platform/base/types.h"
-#include "platform/base/value.h"
+#include "base/types.h"
+#include "base/value.h"
 
 namespace tarnel {
 

@@ -7,7 +7,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/base/types.h"
+#include "base/types.h"
 
 namespace tarnel {
 

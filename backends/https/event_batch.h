@@ -4,7 +4,7 @@
 #include <deque>
 
 #include "backends/https/event_filters.h"
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel {
 

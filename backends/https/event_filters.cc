@@ -3,7 +3,7 @@
 #include <algorithm>
 
 #include "backends/tarnel_backend.h"
-#include "platform/base/text_case.h"
+#include "base/text_case.h"
 
 namespace tarnel {
 namespace {

@@ -9,7 +9,7 @@
 #include <vector>
 
 #include "backends/https/profile_reader.h"
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel {
 

@@ -2,7 +2,7 @@
 
 #include "backends/https/list_matching.h"
 #include "backends/https/sender_names.h"
-#include "backends/https/text_format.h"
+#include "base/text_format.h"
 
 namespace tarnel {
 namespace {

@@ -1,6 +1,6 @@
 #include "backends/https/https_post_backend.h"
 #include "backends/https/sender_names.h"
-#include "backends/https/text_format.h"
+#include "base/text_format.h"
 
 // How a message becomes an event, and how events are batched.
 

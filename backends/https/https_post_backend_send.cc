@@ -1,5 +1,5 @@
 #include "backends/https/https_post_backend.h"
-#include "backends/https/text_format.h"
+#include "base/text_format.h"
 #include "tarnel/keys.h"
 
 // When events are posted at once, and when they are batched.

@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <string>
 
-#include "platform/base/text_case.h"
+#include "base/text_case.h"
 
 namespace tarnel {
 namespace {

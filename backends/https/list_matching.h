@@ -4,7 +4,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 // Matching a name against a list of a client entry, ignoring case.
 //

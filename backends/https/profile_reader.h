@@ -6,8 +6,8 @@
 #include <vector>
 
 #include "backends/https/list_matching.h"
-#include "platform/base/log.h"
-#include "platform/base/value.h"
+#include "base/log.h"
+#include "base/value.h"
 
 namespace tarnel {
 

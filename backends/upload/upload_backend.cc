@@ -3,9 +3,9 @@
 #include <cinttypes>
 #include <utility>
 
-#include "backends/https/text_format.h"
+#include "base/percent_encoding.h"
+#include "base/text_format.h"
 #include "util/compression.h"
-#include "util/percent_encoding.h"
 #include "util/uploads.h"
 
 namespace tarnel {

@@ -3,7 +3,7 @@
 #include <mutex>
 #include <string>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "platform/consent.h"
 #include "platform/random.h"
 #include "platform/settings_store.h"

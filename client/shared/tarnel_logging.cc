@@ -13,7 +13,7 @@
 #include <cstdlib>
 #include <utility>
 
-#include "platform/base/log_text.h"
+#include "base/log_text.h"
 
 namespace tarnel {
 

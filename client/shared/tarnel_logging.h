@@ -9,7 +9,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 
 namespace tarnel {
 

@@ -6,9 +6,9 @@
 #include <type_traits>
 #include <vector>
 
+#include "base/value.h"
 #include "client/src/outcome.h"
 #include "client/src/session_core.h"
-#include "platform/base/value.h"
 #include "tarnel/tarnel_c_session.h"
 
 // What the C interface is made with: handles, replies, and a wall against exceptions.

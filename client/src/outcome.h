@@ -5,9 +5,9 @@
 #include <utility>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/base/one_shot.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/one_shot.h"
+#include "base/value.h"
 #include "tarnel/tarnel_c_types.h"
 
 // What calls of the library come to.

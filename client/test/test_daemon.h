@@ -11,8 +11,8 @@
 #include <thread>
 #include <vector>
 
+#include "base/value.h"
 #include "client/src/descriptor.h"
-#include "platform/base/value.h"
 
 struct sd_bus;
 struct sd_bus_message;

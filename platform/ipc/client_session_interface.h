@@ -7,9 +7,9 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/base/one_shot.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/one_shot.h"
+#include "base/value.h"
 
 // The two protocols between a client process and the daemon. Each side implements one and calls the other
 // through a proxy; dictionaries use the keys of include/tarnel/keys.h.

@@ -4,8 +4,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 
 struct sd_bus_message;
 

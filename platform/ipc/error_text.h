@@ -3,7 +3,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 // Pieces of error texts that quote what a peer sent: such a text goes back over the wire and into logs, so
 // it must be UTF-8 itself and short.

@@ -5,7 +5,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 #include "platform/ipc/client_session_interface.h"
 
 // The IPC service as the daemon sees it.

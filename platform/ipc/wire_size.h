@@ -2,7 +2,7 @@
 
 #include <cstddef>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 // About how many bytes values take on the wire; for bounding what waits to be sent and what is kept.
 

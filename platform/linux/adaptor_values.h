@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 struct tarnel_adaptor_values;
 struct tarnel_dictionary;

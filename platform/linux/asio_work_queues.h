@@ -5,7 +5,7 @@
 #include <mutex>
 #include <string>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 #include "platform/work_queue.h"
 
 namespace tarnel {

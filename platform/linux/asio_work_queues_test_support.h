@@ -8,9 +8,9 @@
 #include <optional>
 #include <utility>
 
+#include "base/unique_fd.h"
 #include "platform/fake/fake_log.h"
 #include "platform/linux/asio_work_queues.h"
-#include "platform/linux/unique_fd.h"
 #include "tests/helpers/waiting.h"
 
 namespace tarnel {

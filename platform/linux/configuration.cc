@@ -4,7 +4,7 @@
 #include <array>
 #include <cerrno>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 #include "platform/linux/toml_file.h"
 
 namespace tarnel {

@@ -7,7 +7,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 
 // What the administrator decides: the TOML files of the configuration directory, described in
 // tarneld.conf(5). Every file counts only when it is trusted (see FileTrust). Loading never fails: what

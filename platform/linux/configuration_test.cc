@@ -5,7 +5,7 @@
 
 #include <sstream>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 #include "platform/linux/linux_test_support.h"
 #include "platform/linux/toml.h"
 

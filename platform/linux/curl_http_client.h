@@ -6,7 +6,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 #include "platform/http_client.h"
 
 namespace tarnel {

@@ -12,7 +12,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 #include "platform/linux/curl_http_client.h"
 #include "tests/helpers/raw_http_server.h"
 

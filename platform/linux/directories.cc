@@ -8,9 +8,9 @@
 #include <cstdlib>
 #include <string_view>
 
+#include "base/file_access.h"
+#include "base/unique_fd.h"
 #include "platform/file_system.h"
-#include "platform/linux/file_access.h"
-#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 

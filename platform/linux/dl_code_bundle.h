@@ -5,7 +5,7 @@
 #include <mutex>
 #include <string>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 #include "platform/code_bundle.h"
 #include "platform/linux/once_log.h"
 

@@ -6,9 +6,9 @@
 #include <string_view>
 #include <vector>
 
+#include "base/rfc3339.h"
 #include "platform/document.h"
 #include "platform/linux/document_builder.h"
-#include "platform/linux/rfc3339.h"
 
 namespace tarnel {
 namespace {

@@ -6,8 +6,8 @@
 #include <utility>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 #include "platform/document.h"
 
 namespace tarnel::detail {

@@ -8,11 +8,11 @@
 #include <string_view>
 #include <system_error>
 
+#include "base/rfc3339.h"
 #include "platform/cryptography.h"
 #include "platform/document.h"
 #include "platform/linux/document_builder.h"
 #include "platform/linux/json_emitter.h"
-#include "platform/linux/rfc3339.h"
 
 #include <rapidjson/error/en.h>
 #include <rapidjson/memorystream.h>

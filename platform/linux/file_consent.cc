@@ -2,7 +2,7 @@
 
 #include <vector>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 #include "platform/linux/toml_file.h"
 
 namespace tarnel {

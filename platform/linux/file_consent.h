@@ -2,8 +2,8 @@
 
 #include <string>
 
-#include "platform/base/error.h"
-#include "platform/base/log.h"
+#include "base/error.h"
+#include "base/log.h"
 #include "platform/consent.h"
 #include "platform/linux/once_log.h"
 

@@ -2,8 +2,8 @@
 
 #include <utility>
 
+#include "base/file_access.h"
 #include "platform/cryptography.h"
-#include "platform/linux/file_access.h"
 
 namespace tarnel {
 

@@ -15,7 +15,7 @@
 #include <rapidjson/stringbuffer.h>
 #include <rapidjson/writer.h>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 #if defined(__SSE2__)
 #if defined(RAPIDJSON_SIMD)

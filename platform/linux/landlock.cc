@@ -10,8 +10,8 @@
 #include <cstddef>
 #include <utility>
 
-#include "platform/linux/file_access.h"
-#include "platform/linux/kernel_constants.h"
+#include "base/file_access.h"
+#include "base/kernel_constants.h"
 
 namespace tarnel {
 

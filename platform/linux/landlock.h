@@ -3,8 +3,8 @@
 #include <optional>
 #include <string>
 
+#include "base/unique_fd.h"
 #include "platform/linux/sandbox_profile.h"
-#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 

@@ -11,7 +11,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 #include "platform/linux/toml_file.h"
 
 namespace tarnel {

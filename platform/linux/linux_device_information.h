@@ -5,7 +5,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 #include "platform/device_information.h"
 #include "platform/linux/once_log.h"
 

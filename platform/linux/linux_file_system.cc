@@ -8,8 +8,8 @@
 #include <cerrno>
 #include <memory>
 
+#include "base/file_access.h"
 #include "platform/linux/directories.h"
-#include "platform/linux/file_access.h"
 
 namespace tarnel {
 

@@ -7,8 +7,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/log.h"
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
+#include "base/log.h"
 #include "platform/locale_information.h"
 
 namespace tarnel {

@@ -11,9 +11,9 @@
 #include <utility>
 #include <vector>
 
+#include "base/file_access.h"
+#include "base/unique_fd.h"
 #include "platform/file_system.h"
-#include "platform/linux/file_access.h"
-#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 

@@ -7,8 +7,8 @@
 #include <mutex>
 #include <string>
 
-#include "platform/base/error.h"
-#include "platform/base/log.h"
+#include "base/error.h"
+#include "base/log.h"
 #include "platform/clock.h"
 #include "platform/linux/once_log.h"
 #include "platform/linux/power_log_record.h"

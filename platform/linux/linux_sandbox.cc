@@ -16,7 +16,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 #include "platform/linux/landlock.h"
 #include "platform/linux/system_call_filter.h"
 

@@ -20,7 +20,7 @@
 #include <functional>
 #include <thread>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 #include "platform/linux/linux_sandbox_test_fixture.h"
 
 namespace tarnel {

@@ -5,7 +5,7 @@
 #include <functional>
 #include <string>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 #include "platform/linux/linux_sandbox.h"
 #include "platform/linux/linux_test_support.h"
 

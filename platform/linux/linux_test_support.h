@@ -14,7 +14,7 @@
 #include <iterator>
 #include <string>
 
-#include "platform/linux/unique_fd.h"
+#include "base/unique_fd.h"
 
 // What the tests of this folder share.
 

@@ -4,7 +4,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 #include "platform/linux/configuration.h"
 
 namespace tarnel {

@@ -11,9 +11,9 @@
 #include <string>
 #include <utility>
 
-#include "platform/linux/kernel_constants.h"
+#include "base/kernel_constants.h"
+#include "base/unique_fd.h"
 #include "platform/linux/peer_process.h"
-#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 

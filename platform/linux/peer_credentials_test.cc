@@ -8,8 +8,8 @@
 #include <array>
 #include <filesystem>
 
+#include "base/unique_fd.h"
 #include "platform/linux/peer_process.h"
-#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 namespace {

@@ -6,7 +6,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "platform/linux/directories.h"
 
 // The records of the power log, and where they are kept; shared by the daemon, which writes them, and

@@ -12,7 +12,7 @@
 #include <cerrno>
 #include <utility>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 #include "platform/linux/peer_process.h"
 #include "platform/linux/system_call_filter.h"
 

@@ -6,8 +6,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/base/error.h"
-#include "platform/linux/unique_fd.h"
+#include "base/error.h"
+#include "base/unique_fd.h"
 
 namespace tarnel {
 

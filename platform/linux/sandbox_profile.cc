@@ -7,7 +7,7 @@
 #include <cerrno>
 #include <utility>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 #include "platform/linux/toml_file.h"
 
 namespace tarnel {

@@ -7,7 +7,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 
 namespace tarnel {
 

@@ -4,7 +4,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 #include "platform/linux/sandbox_profile.h"
 
 namespace tarnel {

@@ -2,7 +2,7 @@
 
 #include <cerrno>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 
 namespace tarnel {
 

@@ -9,8 +9,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/log.h"
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
+#include "base/log.h"
 #include "platform/settings_store.h"
 
 namespace tarnel {

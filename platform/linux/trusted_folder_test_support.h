@@ -9,7 +9,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 
 namespace tarnel {
 

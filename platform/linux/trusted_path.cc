@@ -8,8 +8,8 @@
 #include <string_view>
 #include <utility>
 
+#include "base/file_access.h"
 #include "platform/file_system.h"
-#include "platform/linux/file_access.h"
 
 namespace tarnel {
 

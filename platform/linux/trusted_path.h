@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 
 namespace tarnel {
 

@@ -7,7 +7,7 @@
 #include <cstring>
 #include <utility>
 
-#include "platform/linux/unique_fd.h"
+#include "base/unique_fd.h"
 
 namespace tarnel {
 namespace {

@@ -13,7 +13,7 @@
 #include <iterator>
 #include <string>
 
-#include "platform/linux/unique_fd.h"
+#include "base/unique_fd.h"
 #include "tests/helpers/waiting.h"
 
 namespace tarnel {

@@ -1,7 +1,7 @@
 // The query of an upload's URL: any bytes become text that a URL may hold and that reads back as it was.
 
+#include "base/percent_encoding.h"
 #include "tests/fuzz/fuzz_target.h"
-#include "util/percent_encoding.h"
 
 namespace tarnel::fuzz {
 

@@ -4,7 +4,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "platform/http_client.h"
 
 // Reads what was posted, by means of its own: what the code under test writes is not to be judged by the

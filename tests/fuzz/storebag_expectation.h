@@ -4,7 +4,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "util/process_values.h"
 
 namespace tarnel::fuzz {

@@ -4,7 +4,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tests/fuzz/fuzz_target.h"
 
 // Values out of an input's bytes.

@@ -2,7 +2,7 @@
 
 #include <cstddef>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tests/fuzz/fuzz_target.h"
 
 // What targets do with values.

@@ -12,7 +12,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/linux/unique_fd.h"
+#include "base/unique_fd.h"
 #include "tests/helpers/test_folder.h"
 #include "tests/helpers/waiting.h"
 

@@ -6,7 +6,7 @@
 #include <array>
 #include <cstdlib>
 
-#include "platform/linux/unique_fd.h"
+#include "base/unique_fd.h"
 #include "tests/helpers/waiting.h"
 
 namespace tarnel::test {

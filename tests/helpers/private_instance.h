@@ -6,7 +6,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tests/helpers/child_process.h"
 #include "tests/helpers/test_folder.h"
 

@@ -7,7 +7,7 @@
 #include <string>
 #include <utility>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tests/helpers/private_instance.h"
 #include "tests/helpers/raw_http_server.h"
 #include "tests/helpers/test_folder.h"

@@ -3,7 +3,7 @@
 #include <string>
 #include <utility>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 // Inner documents of storebags.
 

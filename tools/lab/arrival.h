@@ -6,7 +6,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tools/lab/datagram_decoder.h"
 #include "tools/lab/http_message.h"
 #include "tools/lab/upload_query.h"

@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 
 namespace tarnel::lab {
 

@@ -2,7 +2,7 @@
 
 #include <algorithm>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tools/lab/text.h"
 
 namespace tarnel::lab {

@@ -4,8 +4,8 @@
 #include <mutex>
 #include <string_view>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 #include "tools/lab/http_message.h"
 
 namespace tarnel::lab {

@@ -4,7 +4,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tools/lab/http_message.h"
 
 // Whether a post is as the service sends it. Findings are plain sentences; an event is named by its place

@@ -4,7 +4,7 @@
 #include <memory>
 #include <string>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 #include "tools/lab/http_message.h"
 #include "tools/lab/listener.h"
 

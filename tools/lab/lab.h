@@ -3,8 +3,8 @@
 #include <memory>
 #include <string>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 #include "platform/clock.h"
 #include "tools/lab/console.h"
 #include "tools/lab/options.h"

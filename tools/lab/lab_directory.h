@@ -4,7 +4,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 #include "tools/lab/certificate_authority.h"
 #include "tools/storebag/file_io.h"
 #include "tools/storebag/storebag_key.h"

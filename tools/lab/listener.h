@@ -3,7 +3,7 @@
 #include <cstdint>
 #include <string>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 #include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {

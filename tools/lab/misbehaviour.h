@@ -7,8 +7,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 #include "tools/lab/http_message.h"
 
 namespace tarnel::lab {

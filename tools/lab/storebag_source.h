@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 #include "tools/storebag/storebag_key.h"
 #include "tools/storebag/storebag_validation.h"
 

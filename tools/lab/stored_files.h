@@ -5,7 +5,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 #include "tools/lab/notices.h"
 #include "tools/storebag/file_io.h"
 

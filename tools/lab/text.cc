@@ -7,7 +7,7 @@
 #include <cstdio>
 #include <ctime>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel::lab {
 namespace {

@@ -3,7 +3,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tools/lab/event_check.h"
 
 namespace tarnel::lab {

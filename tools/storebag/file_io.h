@@ -7,7 +7,7 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/base/error.h"
+#include "base/error.h"
 
 // Whole files for the tools. Errors carry kToolErrorDomain and the errno (or -1), and name the path and
 // the reason. Threads: any.

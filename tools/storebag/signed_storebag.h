@@ -3,8 +3,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 #include "platform/cryptography.h"
 #include "tools/storebag/storebag_key.h"
 

@@ -7,7 +7,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tools/storebag/storebag_validation.h"
 
 // What the checks of the storebag's parts share; used within this folder only.

@@ -5,8 +5,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 
 struct evp_pkey_st;
 

@@ -3,7 +3,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel {
 

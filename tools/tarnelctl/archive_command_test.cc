@@ -11,8 +11,8 @@
 #include <limits>
 #include <sstream>
 
+#include "base/unique_fd.h"
 #include "platform/document.h"
-#include "platform/linux/unique_fd.h"
 #include "tools/tarnelctl/readable_value.h"
 
 namespace tarnel::ctl {

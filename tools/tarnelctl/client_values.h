@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tarnel/tarnel.h"
 #include "tools/tarnelctl/terminal.h"
 

@@ -4,8 +4,8 @@
 #include <ostream>
 #include <string_view>
 
+#include "base/log.h"
 #include "client/shared/consent_identifiers.h"
-#include "platform/base/log.h"
 #include "platform/linux/file_consent.h"
 #include "platform/linux/system_random.h"
 #include "tools/tarnelctl/acting_as_owner.h"

@@ -15,8 +15,8 @@
 #include <ostream>
 #include <string_view>
 
+#include "base/unique_fd.h"
 #include "platform/document.h"
-#include "platform/linux/unique_fd.h"
 #include "tools/tarnelctl/power_log_journal.h"
 
 namespace tarnel::ctl {

@@ -7,7 +7,7 @@
 #include <span>
 #include <string_view>
 
-#include "platform/linux/rfc3339.h"
+#include "base/rfc3339.h"
 
 namespace tarnel::ctl {
 namespace {

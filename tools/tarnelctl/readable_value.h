@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel::ctl {
 

@@ -6,8 +6,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 
 // Recorded sessions: NDJSON, one record a line; examples/README.md describes the format.
 

@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "tarnel/tarnel.h"
 #include "tools/tarnelctl/terminal.h"
 

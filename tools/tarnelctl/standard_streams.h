@@ -6,7 +6,7 @@
 #include <ostream>
 #include <string_view>
 
-#include "platform/base/log.h"
+#include "base/log.h"
 #include "tools/tarnelctl/terminal.h"
 #include "tools/tarnelctl/visible_output.h"
 

@@ -4,8 +4,8 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 
 // Values as people type them on a command line.
 

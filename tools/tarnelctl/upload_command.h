@@ -4,8 +4,8 @@
 #include <istream>
 #include <string>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 #include "tools/tarnelctl/send_command.h"
 
 // `tarnelctl upload` and `tarnelctl upload-log`: a file, or log records, to the server that the client type's

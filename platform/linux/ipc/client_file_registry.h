@@ -5,10 +5,10 @@
 #include <mutex>
 #include <string>
 
-#include "platform/base/log.h"
+#include "base/log.h"
+#include "base/unique_fd.h"
 #include "platform/client_files.h"
 #include "platform/linux/ipc/connection_link.h"
-#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 

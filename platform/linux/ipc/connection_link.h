@@ -9,8 +9,8 @@
 #include <string>
 #include <thread>
 
-#include "platform/base/one_shot.h"
-#include "platform/linux/unique_fd.h"
+#include "base/one_shot.h"
+#include "base/unique_fd.h"
 
 namespace tarnel {
 

@@ -13,8 +13,9 @@
 #include <unordered_map>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/base/log.h"
+#include "base/error.h"
+#include "base/log.h"
+#include "base/unique_fd.h"
 #include "platform/ipc/client_session_interface.h"
 #include "platform/ipc/wire.h"
 #include "platform/linux/ipc/client_file_registry.h"
@@ -24,7 +25,6 @@
 #include "platform/linux/ipc/ipc_limits.h"
 #include "platform/linux/ipc/large_calls.h"
 #include "platform/linux/ipc/send_call.h"
-#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 

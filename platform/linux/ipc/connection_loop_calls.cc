@@ -4,7 +4,7 @@
 #include <exception>
 #include <utility>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "platform/ipc/wire.h"
 #include "platform/linux/ipc/connection_loop.h"
 #include "platform/linux/ipc/generic_tools.h"

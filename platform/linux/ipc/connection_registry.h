@@ -13,10 +13,10 @@
 #include <variant>
 #include <vector>
 
+#include "base/unique_fd.h"
 #include "platform/linux/ipc/connection_link.h"
 #include "platform/linux/ipc/ipc_limits.h"
 #include "platform/linux/ipc/large_calls.h"
-#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 

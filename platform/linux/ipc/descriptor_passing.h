@@ -10,7 +10,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/linux/unique_fd.h"
+#include "base/unique_fd.h"
 
 // File descriptors that travel beside a connection's bytes. A D-Bus message announces in its header how many
 // belong to it, and they come with its first byte.

@@ -15,9 +15,9 @@
 #include <utility>
 #include <vector>
 
+#include "base/unique_fd.h"
 #include "platform/ipc/wire.h"
 #include "platform/linux/ipc/connection_loop.h"
-#include "platform/linux/unique_fd.h"
 
 // Clients for tests: one that writes bytes by hand, one on a bus library.
 

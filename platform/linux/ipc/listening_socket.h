@@ -2,8 +2,8 @@
 
 #include <string>
 
-#include "platform/base/error.h"
-#include "platform/linux/unique_fd.h"
+#include "base/error.h"
+#include "base/unique_fd.h"
 
 // The socket that clients connect to.
 

@@ -4,8 +4,8 @@
 #include <cstdint>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/base/value.h"
+#include "base/error.h"
+#include "base/value.h"
 #include "platform/linux/ipc/session_methods.h"
 
 // Several messages in one call.

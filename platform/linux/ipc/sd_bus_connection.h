@@ -5,14 +5,14 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/log.h"
+#include "base/log.h"
+#include "base/unique_fd.h"
 #include "platform/entitlements.h"
 #include "platform/ipc/ipc.h"
 #include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/connection_link.h"
 #include "platform/linux/ipc/connection_registry.h"
 #include "platform/linux/ipc/ipc_limits.h"
-#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 

@@ -7,14 +7,14 @@
 #include <memory>
 #include <string>
 
-#include "platform/base/log.h"
+#include "base/log.h"
+#include "base/unique_fd.h"
 #include "platform/entitlements.h"
 #include "platform/ipc/ipc.h"
 #include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/connection_registry.h"
 #include "platform/linux/ipc/ipc_limits.h"
 #include "platform/linux/ipc/listening_socket.h"
-#include "platform/linux/unique_fd.h"
 
 namespace tarnel {
 

@@ -6,7 +6,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 #include "platform/linux/ipc/message_batch.h"
 
 namespace tarnel {

@@ -5,12 +5,12 @@
 #include <span>
 #include <string>
 
-#include "platform/base/error.h"
-#include "platform/base/log.h"
+#include "base/error.h"
+#include "base/log.h"
+#include "base/unique_fd.h"
 #include "platform/ipc/client_session_interface.h"
 #include "platform/linux/ipc/client_file_registry.h"
 #include "platform/linux/ipc/connection_link.h"
-#include "platform/linux/unique_fd.h"
 
 struct sd_bus_message;
 

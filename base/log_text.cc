@@ -1,9 +1,9 @@
-#include "platform/base/log_text.h"
+#include "base/log_text.h"
 
 #include <array>
 #include <cstdio>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel {
 

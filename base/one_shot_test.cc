@@ -1,4 +1,4 @@
-#include "platform/base/one_shot.h"
+#include "base/one_shot.h"
 
 #include <memory>
 #include <stdexcept>

@@ -16,7 +16,7 @@
 #include <variant>
 #include <vector>
 
-#include "platform/base/cow_ptr.h"
+#include "base/cow_ptr.h"
 
 // The values that travel through the system: what a client puts into a payload, what a configuration
 // document holds, what an event is made of.

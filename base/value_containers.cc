@@ -4,7 +4,7 @@
 #include <iterator>
 #include <utility>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel {
 namespace {

@@ -4,7 +4,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel {
 

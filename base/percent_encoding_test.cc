@@ -1,4 +1,4 @@
-#include "util/percent_encoding.h"
+#include "base/percent_encoding.h"
 
 #include <gtest/gtest.h>
 

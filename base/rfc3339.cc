@@ -1,4 +1,4 @@
-#include "platform/linux/rfc3339.h"
+#include "base/rfc3339.h"
 
 #include <algorithm>
 #include <array>

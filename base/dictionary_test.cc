@@ -4,7 +4,7 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/base/log.h"
+#include "base/log.h"
 
 #include <string>
 #include <utility>

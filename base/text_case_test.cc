@@ -1,4 +1,4 @@
-#include "platform/base/text_case.h"
+#include "base/text_case.h"
 
 #include <gtest/gtest.h>
 

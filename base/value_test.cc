@@ -1,4 +1,4 @@
-#include "platform/base/value.h"
+#include "base/value.h"
 
 #include <array>
 #include <cmath>

@@ -8,8 +8,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/base/error.h"
-#include "platform/linux/unique_fd.h"
+#include "base/error.h"
+#include "base/unique_fd.h"
 
 // Reading and replacing small files whole, and the rule by which a file is trusted. Errors carry
 // kFileErrorDomain, the errno as code, and a text with the file's name.

@@ -1,4 +1,4 @@
-#include "platform/base/uuid.h"
+#include "base/uuid.h"
 
 namespace tarnel {
 

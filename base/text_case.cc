@@ -1,4 +1,4 @@
-#include "platform/base/text_case.h"
+#include "base/text_case.h"
 
 #include <locale.h>
 #include <wctype.h>
@@ -6,7 +6,7 @@
 #include <algorithm>
 #include <array>
 
-#include "platform/base/value.h"
+#include "base/value.h"
 
 namespace tarnel {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/linux/file_access.h"
+#include "base/file_access.h"
 
 #include <dirent.h>
 #include <fcntl.h>
