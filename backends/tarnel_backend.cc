@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <utility>
 
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 
 namespace tarnel {
 namespace {

@@ -8,7 +8,7 @@
 #include "bench/bench_world.h"
 #include "bench/raw_codec.h"
 #include "bench/sample_payload.h"
-#include "platform/json_writer.h"
+#include "formats/json_writer.h"
 
 namespace tarnel::bench {
 namespace {

@@ -2,7 +2,7 @@
 
 #include <cstdio>
 
-#include "platform/json_writer.h"
+#include "formats/json_writer.h"
 
 namespace tarnel::bench {
 namespace {

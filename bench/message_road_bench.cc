@@ -5,9 +5,9 @@
 
 #include "bench/bench_world.h"
 #include "bench/sample_payload.h"
+#include "formats/compression.h"
 #include "platform/linux/ipc/message_batch.h"
 #include "platform/linux/ipc/send_call.h"
-#include "util/compression.h"
 
 namespace tarnel::bench {
 namespace {

@@ -2,7 +2,7 @@
 
 #include <utility>
 
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 #include "session/separately.h"
 #include "tarnel/keys.h"
 #include "util/device_facts.h"

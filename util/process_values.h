@@ -7,7 +7,7 @@
 
 #include "base/log.h"
 #include "base/value.h"
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 #include "platform/device_information.h"
 #include "platform/random.h"
 #include "platform/settings_store.h"

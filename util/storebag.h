@@ -6,7 +6,7 @@
 #include <string>
 
 #include "base/value.h"
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 #include "util/dependencies.h"
 
 // Fetching the storebag, the signed configuration document of a client type.

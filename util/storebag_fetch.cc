@@ -5,7 +5,7 @@
 #include <memory>
 #include <utility>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "util/storebag_internal.h"
 
 namespace tarnel {

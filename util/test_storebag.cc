@@ -8,8 +8,8 @@
 #include <span>
 #include <stdexcept>
 
-#include "platform/cryptography.h"
-#include "platform/document.h"
+#include "formats/cryptography.h"
+#include "formats/document.h"
 
 namespace tarnel::fake {
 namespace {

@@ -2,7 +2,7 @@
 
 #include "backends/dashboard/dashboard_backend.h"
 #include "backends/dashboard/log_data_announcement.h"
-#include "platform/archive.h"
+#include "formats/archive.h"
 #include "util/uploads.h"
 
 // The upload of a client's log records.

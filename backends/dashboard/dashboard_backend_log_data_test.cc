@@ -3,7 +3,7 @@
 
 #include "backends/dashboard/dashboard_backend_fixture.h"
 #include "backends/dashboard/log_data_announcement.h"
-#include "platform/archive.h"
+#include "formats/archive.h"
 
 // The upload of log records.
 

@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "backends/https/https_post_backend.h"
-#include "platform/document.h"
+#include "formats/document.h"
 #include "platform/fake/fake_world.h"
 #include "tarnel/keys.h"
 

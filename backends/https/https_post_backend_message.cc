@@ -1,7 +1,7 @@
 #include <algorithm>
 
 #include "backends/https/https_post_backend.h"
-#include "platform/json_writer.h"
+#include "formats/json_writer.h"
 
 // The JSON message that carries events.
 

@@ -1,7 +1,7 @@
 #include <limits>
 
 #include "backends/https/https_post_backend_fixture.h"
-#include "util/compression.h"
+#include "formats/compression.h"
 #include "util/identifiers.h"
 
 namespace tarnel {

@@ -1,8 +1,8 @@
 #include "backends/https/https_post_backend.h"
 #include "backends/https/sender_names.h"
 #include "base/text_format.h"
+#include "formats/compression.h"
 #include "tarnel/keys.h"
-#include "util/compression.h"
 
 // Posting a message, and what its answer does.
 

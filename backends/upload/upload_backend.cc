@@ -5,7 +5,7 @@
 
 #include "base/percent_encoding.h"
 #include "base/text_format.h"
-#include "util/compression.h"
+#include "formats/compression.h"
 #include "util/uploads.h"
 
 namespace tarnel {

@@ -6,8 +6,8 @@
 #include <sstream>
 
 #include "base/file_access.h"
+#include "formats/toml.h"
 #include "platform/linux/linux_test_support.h"
-#include "platform/linux/toml.h"
 
 namespace tarnel {
 namespace {

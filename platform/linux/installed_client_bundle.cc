@@ -3,7 +3,7 @@
 #include <utility>
 
 #include "base/file_access.h"
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 
 namespace tarnel {
 

@@ -4,7 +4,7 @@
 
 #include <cmath>
 
-#include "platform/document.h"
+#include "formats/document.h"
 
 namespace tarnel {
 

@@ -5,8 +5,8 @@
 #include <string_view>
 #include <vector>
 
+#include "formats/toml.h"
 #include "platform/linux/configuration.h"
-#include "platform/linux/toml.h"
 
 // Reading the administrator's TOML files, and how their mistakes are worded. Threads: any.
 

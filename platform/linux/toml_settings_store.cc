@@ -8,8 +8,8 @@
 #include <cstdio>
 #include <utility>
 
+#include "formats/toml.h"
 #include "platform/linux/directories.h"
-#include "platform/linux/toml.h"
 
 namespace tarnel {
 

@@ -9,9 +9,9 @@
 #include <random>
 #include <thread>
 
+#include "formats/toml.h"
 #include "platform/fake/fake_log.h"
 #include "platform/linux/linux_test_support.h"
-#include "platform/linux/toml.h"
 
 namespace tarnel {
 namespace {

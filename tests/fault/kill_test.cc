@@ -7,7 +7,7 @@
 #include <random>
 #include <thread>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tests/helpers/private_instance.h"
 #include "tests/helpers/programs.h"
 #include "tests/helpers/storebag_server.h"

@@ -1,7 +1,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tests/helpers/private_instance.h"
 #include "tests/helpers/storebag_server.h"
 #include "tests/helpers/storebags.h"

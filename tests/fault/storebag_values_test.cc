@@ -3,7 +3,7 @@
 
 #include <set>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tests/helpers/private_instance.h"
 #include "tests/helpers/storebag_server.h"
 #include "tests/helpers/storebags.h"

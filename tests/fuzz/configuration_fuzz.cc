@@ -11,9 +11,9 @@
 #include <string>
 #include <vector>
 
+#include "formats/toml.h"
 #include "platform/linux/configuration.h"
 #include "platform/linux/entitlement_rules.h"
-#include "platform/linux/toml.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/scratch_folder.h"
 

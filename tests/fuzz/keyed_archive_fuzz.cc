@@ -1,12 +1,12 @@
 // Keyed archives: any bytes read as one, and any value written as one. The input's first byte says which:
 // 'v' takes a value from the rest, 'd' the value of the document in the rest; anything else is an archive.
 
-#include "platform/archive.h"
+#include "formats/archive.h"
 
 #include <algorithm>
 #include <string>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/values.h"
 

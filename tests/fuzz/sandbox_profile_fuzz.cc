@@ -13,7 +13,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/linux/toml.h"
+#include "formats/toml.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/scratch_folder.h"
 

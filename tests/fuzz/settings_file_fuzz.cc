@@ -11,9 +11,9 @@
 #include <optional>
 #include <string>
 
-#include "platform/document.h"
+#include "formats/document.h"
+#include "formats/toml.h"
 #include "platform/fake/fake_log.h"
-#include "platform/linux/toml.h"
 #include "platform/linux/toml_settings_store.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/scratch_folder.h"

@@ -12,7 +12,7 @@
 #include <string>
 
 #include "daemon/tarneld_agent.h"
-#include "platform/document.h"
+#include "formats/document.h"
 #include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
 #include "tarnel/keys.h"

@@ -11,10 +11,10 @@
 #include <optional>
 #include <string>
 
-#include "platform/cryptography.h"
-#include "platform/document.h"
+#include "formats/cryptography.h"
+#include "formats/document.h"
+#include "formats/json_writer.h"
 #include "platform/fake/fake_world.h"
-#include "platform/json_writer.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/storebag_expectation.h"
 #include "tests/fuzz/values.h"

@@ -13,7 +13,7 @@
 #include <cstdlib>
 #include <stdexcept>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tests/helpers/http_request.h"
 #include "tests/helpers/programs.h"
 

@@ -2,7 +2,7 @@
 
 #include <stdexcept>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/storebag/signed_storebag.h"
 
 namespace tarnel::test {

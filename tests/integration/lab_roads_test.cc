@@ -5,8 +5,8 @@
 #include <fstream>
 #include <random>
 
-#include "platform/archive.h"
-#include "platform/document.h"
+#include "formats/archive.h"
+#include "formats/document.h"
 #include "tests/helpers/http_request.h"
 #include "tests/helpers/lab_process.h"
 #include "tests/helpers/private_instance.h"

@@ -4,7 +4,7 @@
 #include <algorithm>
 #include <future>
 
-#include "platform/archive.h"
+#include "formats/archive.h"
 #include "tests/helpers/lab_process.h"
 #include "tests/helpers/private_instance.h"
 #include "tests/helpers/raw_http_server.h"

@@ -1,8 +1,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "platform/archive.h"
-#include "platform/document.h"
+#include "formats/archive.h"
+#include "formats/document.h"
 #include "tests/helpers/child_process.h"
 #include "tests/helpers/programs.h"
 

@@ -3,7 +3,7 @@
 
 #include <algorithm>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tests/helpers/lab_process.h"
 #include "tests/helpers/private_instance.h"
 #include "tests/helpers/programs.h"

@@ -5,7 +5,7 @@
 
 #include <filesystem>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/lab/arrival_store.h"
 #include "tools/lab/ndjson_writer.h"
 #include "tools/lab/test_post.h"

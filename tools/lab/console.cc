@@ -1,6 +1,6 @@
 #include "tools/lab/console.h"
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/lab/summary.h"
 #include "tools/lab/text.h"
 

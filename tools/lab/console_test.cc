@@ -7,7 +7,7 @@
 #include <array>
 #include <memory>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/summary.h"
 #include "tools/lab/test_post.h"

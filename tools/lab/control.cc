@@ -4,7 +4,7 @@
 #include <array>
 #include <cerrno>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/lab/listener.h"
 #include "tools/lab/service.h"
 #include "tools/lab/stored_files.h"

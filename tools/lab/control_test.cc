@@ -3,7 +3,7 @@
 #include <gmock/gmock.h>
 #include <unistd.h>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/lab/test_post.h"
 #include "tools/storebag/file_io.h"
 

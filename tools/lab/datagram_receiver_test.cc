@@ -2,7 +2,7 @@
 
 #include <gmock/gmock.h>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/test_datagram.h"
 

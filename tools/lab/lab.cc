@@ -5,7 +5,7 @@
 
 #include <algorithm>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/lab/arrival_store.h"
 #include "tools/lab/control.h"
 #include "tools/lab/datagram_server.h"

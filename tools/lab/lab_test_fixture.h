@@ -13,8 +13,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/cryptography.h"
-#include "platform/document.h"
+#include "formats/cryptography.h"
+#include "formats/document.h"
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/http_message.h"
 #include "tools/lab/lab.h"

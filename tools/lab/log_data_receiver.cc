@@ -1,7 +1,7 @@
 #include "tools/lab/log_data_receiver.h"
 
-#include "platform/archive.h"
-#include "platform/document.h"
+#include "formats/archive.h"
+#include "formats/document.h"
 #include "tools/lab/http_arrival.h"
 #include "tools/lab/text.h"
 

@@ -4,8 +4,8 @@
 
 #include <filesystem>
 
-#include "platform/archive.h"
-#include "platform/document.h"
+#include "formats/archive.h"
+#include "formats/document.h"
 #include "tools/lab/storing_receiver_test_fixture.h"
 #include "tools/lab/test_post.h"
 

@@ -7,7 +7,7 @@
 #include <cerrno>
 #include <cstdio>
 
-#include "platform/document.h"
+#include "formats/document.h"
 
 namespace tarnel::lab {
 

@@ -1,6 +1,6 @@
 #include "tools/lab/post_receiver.h"
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/lab/event_check.h"
 #include "tools/lab/gunzip.h"
 #include "tools/lab/http_arrival.h"

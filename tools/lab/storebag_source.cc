@@ -4,7 +4,7 @@
 #include <cerrno>
 #include <filesystem>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/lab/text.h"
 #include "tools/storebag/file_io.h"
 #include "tools/storebag/signed_storebag.h"

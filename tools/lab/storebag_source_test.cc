@@ -6,7 +6,7 @@
 #include <filesystem>
 #include <fstream>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/service.h"
 #include "tools/lab/test_post.h"

@@ -5,7 +5,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/lab/http_message.h"
 
 // Posts as the service sends them, for the tests.

@@ -4,7 +4,7 @@
 
 #include <filesystem>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/lab/storing_receiver_test_fixture.h"
 #include "tools/lab/test_post.h"
 

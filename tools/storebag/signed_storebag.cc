@@ -1,6 +1,6 @@
 #include "tools/storebag/signed_storebag.h"
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/storebag/file_io.h"
 
 namespace tarnel {

@@ -5,7 +5,7 @@
 
 #include "base/error.h"
 #include "base/value.h"
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 #include "tools/storebag/storebag_key.h"
 
 // Outer documents: {"signature": base-64, "bag": base-64 of the inner document's bytes}. The signature

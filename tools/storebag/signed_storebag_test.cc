@@ -2,7 +2,7 @@
 
 #include <gmock/gmock.h>
 
-#include "platform/document.h"
+#include "formats/document.h"
 
 namespace tarnel {
 namespace {

@@ -9,7 +9,7 @@
 #include <array>
 #include <climits>
 
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 #include "tools/storebag/file_io.h"
 
 namespace tarnel {

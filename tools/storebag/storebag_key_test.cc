@@ -8,7 +8,7 @@
 #include <filesystem>
 #include <fstream>
 
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 #include "tools/storebag/file_io.h"
 
 namespace tarnel {

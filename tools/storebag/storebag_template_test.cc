@@ -2,7 +2,7 @@
 
 #include <gmock/gmock.h>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/storebag/file_io.h"
 #include "tools/storebag/storebag_validation.h"
 

@@ -4,7 +4,7 @@
 
 #include <cmath>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/storebag/file_io.h"
 #include "tools/storebag/storebag_template.h"
 

@@ -7,8 +7,8 @@
 #include <ostream>
 #include <string_view>
 
-#include "platform/document.h"
-#include "platform/linux/archive_format.h"
+#include "formats/archive_format.h"
+#include "formats/document.h"
 #include "tools/storebag/file_io.h"
 #include "tools/tarnelctl/readable_value.h"
 

@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "platform/archive.h"
+#include "formats/archive.h"
 #include "tools/tarnelctl/terminal.h"
 
 // `tarnelctl archive`: what stands in a keyed object archive, the form in which log records are uploaded.

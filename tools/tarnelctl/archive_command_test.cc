@@ -12,7 +12,7 @@
 #include <sstream>
 
 #include "base/unique_fd.h"
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/tarnelctl/readable_value.h"
 
 namespace tarnel::ctl {

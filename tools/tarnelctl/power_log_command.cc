@@ -16,7 +16,7 @@
 #include <string_view>
 
 #include "base/unique_fd.h"
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/tarnelctl/power_log_journal.h"
 
 namespace tarnel::ctl {

@@ -6,7 +6,7 @@
 #include <memory>
 #include <ostream>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/tarnelctl/system_journal.h"
 
 namespace tarnel::ctl {

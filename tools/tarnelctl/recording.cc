@@ -6,7 +6,7 @@
 #include <optional>
 #include <utility>
 
-#include "platform/document.h"
+#include "formats/document.h"
 
 namespace tarnel::ctl {
 namespace {

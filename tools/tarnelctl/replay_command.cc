@@ -11,7 +11,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/tarnelctl/client_values.h"
 #include "tools/tarnelctl/progress_bar.h"
 

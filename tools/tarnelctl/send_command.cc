@@ -6,7 +6,7 @@
 #include <ostream>
 #include <utility>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tarnel/keys.h"
 #include "tools/tarnelctl/client_values.h"
 #include "tools/tarnelctl/typed_value.h"

@@ -4,7 +4,7 @@
 #include <ostream>
 #include <utility>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "platform/file_system.h"
 #include "tools/tarnelctl/typed_value.h"
 

@@ -6,8 +6,8 @@
 #include <utility>
 #include <vector>
 
-#include "platform/cryptography.h"
-#include "platform/document.h"
+#include "formats/cryptography.h"
+#include "formats/document.h"
 #include "tools/storebag/file_io.h"
 #include "tools/storebag/signed_storebag.h"
 #include "tools/storebag/storebag_key.h"

@@ -5,8 +5,8 @@
 #include <charconv>
 #include <optional>
 
-#include "platform/cryptography.h"
-#include "platform/document.h"
+#include "formats/cryptography.h"
+#include "formats/document.h"
 
 namespace tarnel::ctl {
 namespace {

@@ -14,7 +14,7 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/document.h"
+#include "formats/document.h"
 #include "tools/tarnelctl/client_values.h"
 
 namespace tarnel::ctl {

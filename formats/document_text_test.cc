@@ -5,7 +5,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "platform/document.h"
+#include "formats/document.h"
 
 namespace tarnel {
 namespace {

@@ -7,8 +7,8 @@
 #include <vector>
 
 #include "base/rfc3339.h"
-#include "platform/document.h"
-#include "platform/linux/document_builder.h"
+#include "formats/document.h"
+#include "formats/document_builder.h"
 
 namespace tarnel {
 namespace {

@@ -8,7 +8,7 @@
 
 #include "base/error.h"
 #include "base/value.h"
-#include "platform/document.h"
+#include "formats/document.h"
 
 namespace tarnel::detail {
 

@@ -2,7 +2,7 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 
 namespace tarnel {
 namespace {

@@ -4,7 +4,7 @@
 #include <cmath>
 #include <cstdio>
 
-#include "platform/linux/toml.h"
+#include "formats/toml.h"
 
 namespace tarnel {
 

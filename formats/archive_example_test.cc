@@ -5,8 +5,8 @@
 #include <limits>
 #include <string>
 
-#include "platform/archive.h"
-#include "platform/document.h"
+#include "formats/archive.h"
+#include "formats/document.h"
 #include "platform/linux/linux_test_support.h"
 
 // The example of a reader in another language, which knows the archive's description and nothing else.

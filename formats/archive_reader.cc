@@ -4,9 +4,9 @@
 #include <utility>
 #include <vector>
 
-#include "platform/archive.h"
-#include "platform/document.h"
-#include "platform/linux/archive_format.h"
+#include "formats/archive.h"
+#include "formats/archive_format.h"
+#include "formats/document.h"
 
 namespace tarnel {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/json_writer.h"
+#include "formats/json_writer.h"
 
 #include <algorithm>
 #include <cmath>
@@ -7,7 +7,7 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/document.h"
+#include "formats/document.h"
 
 namespace tarnel {
 namespace {

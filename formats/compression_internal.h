@@ -14,7 +14,7 @@
 #include <string_view>
 
 #include "base/log.h"
-#include "util/compression.h"
+#include "formats/compression.h"
 
 // Parts of the compression that its tests reach.
 

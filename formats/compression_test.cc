@@ -1,4 +1,4 @@
-#include "util/compression.h"
+#include "formats/compression.h"
 
 #include <gtest/gtest.h>
 
@@ -7,8 +7,8 @@
 #include <utility>
 #include <vector>
 
+#include "formats/compression_internal.h"
 #include "platform/fake/fake_log.h"
-#include "util/compression_internal.h"
 
 namespace tarnel {
 namespace {

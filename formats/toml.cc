@@ -1,4 +1,4 @@
-#include "platform/linux/toml.h"
+#include "formats/toml.h"
 
 #include <toml++/toml.h>
 

@@ -1,8 +1,8 @@
-#include "platform/document.h"
+#include "formats/document.h"
 
 #include <string>
 
-#include "platform/linux/document_builder.h"
+#include "formats/document_builder.h"
 
 namespace tarnel {
 namespace detail {

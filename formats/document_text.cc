@@ -9,10 +9,10 @@
 #include <system_error>
 
 #include "base/rfc3339.h"
-#include "platform/cryptography.h"
-#include "platform/document.h"
-#include "platform/linux/document_builder.h"
-#include "platform/linux/json_emitter.h"
+#include "formats/cryptography.h"
+#include "formats/document.h"
+#include "formats/document_builder.h"
+#include "formats/json_emitter.h"
 
 #include <rapidjson/error/en.h>
 #include <rapidjson/memorystream.h>

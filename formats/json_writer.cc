@@ -1,8 +1,8 @@
-#include "platform/json_writer.h"
+#include "formats/json_writer.h"
 
 #include <cmath>
 
-#include "platform/linux/json_emitter.h"
+#include "formats/json_emitter.h"
 
 namespace tarnel {
 namespace {

@@ -1,7 +1,7 @@
 #include <algorithm>
 #include <array>
 
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 
 namespace tarnel {
 namespace {

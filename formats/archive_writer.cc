@@ -6,8 +6,8 @@
 #include <utility>
 #include <vector>
 
-#include "platform/archive.h"
-#include "platform/linux/archive_format.h"
+#include "formats/archive.h"
+#include "formats/archive_format.h"
 
 namespace tarnel {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/archive.h"
+#include "formats/archive.h"
 
 #include <gtest/gtest.h>
 
@@ -8,8 +8,8 @@
 #include <limits>
 #include <string>
 
-#include "platform/document.h"
-#include "platform/linux/archive_format.h"
+#include "formats/archive_format.h"
+#include "formats/document.h"
 
 namespace tarnel {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/cryptography.h"
+#include "formats/cryptography.h"
 
 #include <openssl/evp.h>
 #include <openssl/rsa.h>

@@ -1,8 +1,8 @@
-#include "util/compression.h"
+#include "formats/compression.h"
 
 #include <utility>
 
-#include "util/compression_internal.h"
+#include "formats/compression_internal.h"
 
 namespace tarnel {
 namespace detail {
