@@ -7,7 +7,7 @@
 #include <stdexcept>
 
 #include "bench/sample_payload.h"
-#include "platform/ipc/wire.h"
+#include "ipc/protocol/wire.h"
 #include "tarnel/keys.h"
 
 namespace tarnel::bench {

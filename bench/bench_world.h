@@ -10,9 +10,9 @@
 
 #include "backends/https/https_post_backend.h"
 #include "base/unique_fd.h"
+#include "ipc/dbus/dbus_codec.h"
 #include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
-#include "platform/ipc/dbus_codec.h"
 #include "session/tarneld_session.h"
 
 namespace tarnel::bench {

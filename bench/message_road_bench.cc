@@ -6,8 +6,8 @@
 #include "bench/bench_world.h"
 #include "bench/sample_payload.h"
 #include "formats/compression.h"
-#include "platform/linux/ipc/message_batch.h"
-#include "platform/linux/ipc/send_call.h"
+#include "ipc/server/message_batch.h"
+#include "ipc/server/send_call.h"
 
 namespace tarnel::bench {
 namespace {

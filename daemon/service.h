@@ -5,7 +5,7 @@
 #include <string>
 
 #include "base/log.h"
-#include "platform/ipc/ipc.h"
+#include "ipc/ipc.h"
 #include "util/dependencies.h"
 
 namespace tarnel {

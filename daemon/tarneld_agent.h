@@ -11,7 +11,7 @@
 #include <unordered_map>
 #include <vector>
 
-#include "platform/ipc/ipc.h"
+#include "ipc/ipc.h"
 #include "session/backend_set.h"
 #include "session/tarneld_session.h"
 #include "session/tarneld_session_delegate.h"

@@ -9,8 +9,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/ipc/client_session_interface.h"
-#include "platform/ipc/ipc.h"
+#include "ipc/ipc.h"
+#include "ipc/protocol/client_session_interface.h"
 #include "session/backend_set.h"
 #include "session/shared_reporting.h"
 #include "session/tarneld_session_delegate.h"

@@ -9,7 +9,7 @@
 #include <optional>
 #include <utility>
 
-#include "platform/client_files.h"
+#include "ipc/client_files.h"
 #include "platform/http_client.h"
 
 namespace tarnel {

@@ -13,8 +13,8 @@
 
 #include "client/src/options.h"
 #include "client/src/request_codec.h"
-#include "platform/ipc/dbus_codec.h"
-#include "platform/ipc/wire.h"
+#include "ipc/dbus/dbus_codec.h"
+#include "ipc/protocol/wire.h"
 
 namespace tarnel::core {
 namespace {

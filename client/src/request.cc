@@ -4,8 +4,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/ipc/wire.h"
-#include "platform/ipc/wire_size.h"
+#include "ipc/dbus/wire_size.h"
+#include "ipc/protocol/wire.h"
 
 namespace tarnel::core {
 namespace {

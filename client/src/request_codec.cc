@@ -10,8 +10,8 @@
 #include <utility>
 #include <variant>
 
-#include "platform/ipc/dbus_codec.h"
-#include "platform/ipc/wire.h"
+#include "ipc/dbus/dbus_codec.h"
+#include "ipc/protocol/wire.h"
 
 namespace tarnel::core {
 namespace {

@@ -11,7 +11,7 @@
 #include <memory>
 #include <string>
 
-#include "platform/linux/ipc/ipc_test_support.h"
+#include "ipc/server/ipc_test_support.h"
 #include "tarnel/tarnel.h"
 
 // The library against the daemon's own IPC service.

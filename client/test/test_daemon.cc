@@ -15,8 +15,8 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/ipc/dbus_codec.h"
-#include "platform/ipc/wire.h"
+#include "ipc/dbus/dbus_codec.h"
+#include "ipc/protocol/wire.h"
 
 namespace tarnel::test {
 namespace {

@@ -8,7 +8,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/client_files.h"
+#include "ipc/client_files.h"
 
 namespace tarnel::fake {
 

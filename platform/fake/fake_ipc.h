@@ -11,7 +11,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/ipc/ipc.h"
+#include "ipc/ipc.h"
 
 namespace tarnel::fake {
 

@@ -9,7 +9,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/entitlements.h"
+#include "ipc/entitlements.h"
 #include "platform/linux/configuration.h"
 
 namespace tarnel {

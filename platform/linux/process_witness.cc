@@ -13,7 +13,7 @@
 #include <utility>
 
 #include "base/file_access.h"
-#include "platform/linux/peer_process.h"
+#include "ipc/server/peer_process.h"
 #include "platform/linux/system_call_filter.h"
 
 namespace tarnel {

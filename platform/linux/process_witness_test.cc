@@ -8,9 +8,9 @@
 
 #include <filesystem>
 
+#include "ipc/server/peer_process.h"
 #include "platform/linux/linux_sandbox.h"
 #include "platform/linux/linux_test_support.h"
-#include "platform/linux/peer_process.h"
 
 namespace tarnel {
 namespace {

@@ -12,7 +12,7 @@
 #include <vector>
 
 #include "client/src/connection.h"
-#include "platform/ipc/wire.h"
+#include "ipc/protocol/wire.h"
 #include "tests/fuzz/dbus_frame.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/socket_peer.h"

@@ -1,8 +1,8 @@
 #include "tests/fuzz/session_bytes.h"
 
-#include "platform/ipc/wire.h"
-#include "platform/linux/ipc/client_file_registry.h"
-#include "platform/linux/ipc/connection_loop.h"
+#include "ipc/protocol/wire.h"
+#include "ipc/server/client_file_registry.h"
+#include "ipc/server/connection_loop.h"
 #include "tests/fuzz/dbus_frame.h"
 #include "tests/fuzz/socket_peer.h"
 

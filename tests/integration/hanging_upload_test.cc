@@ -9,8 +9,8 @@
 #include <vector>
 
 #include "backends/upload/upload_backend.h"
+#include "ipc/server/ipc_test_support.h"
 #include "platform/fake/fake_world.h"
-#include "platform/linux/ipc/ipc_test_support.h"
 #include "tarnel/tarnel.h"
 #include "tests/helpers/waiting.h"
 
