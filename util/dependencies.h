@@ -3,7 +3,6 @@
 #include <string>
 
 #include "base/log.h"
-#include "client/shared/consent_identifiers.h"
 #include "platform/client_bundle.h"
 #include "platform/clock.h"
 #include "platform/code_bundle.h"
@@ -18,6 +17,7 @@
 #include "platform/random.h"
 #include "platform/settings_store.h"
 #include "platform/work_queue.h"
+#include "util/consent_identifiers.h"
 #include "util/process_values.h"
 #include "util/uploads.h"
 

@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "platform/fake/fake_world.h"
-#include "platform/linux/linux_file_system.h"
+#include "platform/linux/system/linux_file_system.h"
 #include "util/message_log.h"
 
 namespace tarnel {

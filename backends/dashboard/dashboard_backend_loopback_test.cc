@@ -10,8 +10,8 @@
 
 #include "backends/dashboard/dashboard_backend_fixture.h"
 #include "base/unique_fd.h"
-#include "platform/linux/asio_work_queues.h"
-#include "platform/linux/udp_sockets.h"
+#include "platform/linux/queues/asio_work_queues.h"
+#include "platform/linux/queues/udp_sockets.h"
 #include "tests/helpers/waiting.h"
 
 // Delivery over real UDP, through a network that loses, repeats, delays and reorders.

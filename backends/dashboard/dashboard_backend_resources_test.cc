@@ -5,8 +5,8 @@
 #include <iterator>
 
 #include "backends/dashboard/dashboard_backend_fixture.h"
-#include "platform/linux/asio_work_queues.h"
-#include "platform/linux/udp_sockets.h"
+#include "platform/linux/queues/asio_work_queues.h"
+#include "platform/linux/queues/udp_sockets.h"
 #include "tests/helpers/waiting.h"
 
 // What backends take from the system, and that they give it back. With the real queues and sockets.

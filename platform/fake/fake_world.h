@@ -1,6 +1,5 @@
 #pragma once
 
-#include "client/shared/consent_identifiers.h"
 #include "platform/fake/fake_client_files.h"
 #include "platform/fake/fake_clock.h"
 #include "platform/fake/fake_code_bundles.h"
@@ -13,6 +12,7 @@
 #include "platform/fake/fake_random.h"
 #include "platform/fake/fake_settings_store.h"
 #include "platform/fake/fake_work_queues.h"
+#include "util/consent_identifiers.h"
 #include "util/dependencies.h"
 
 namespace tarnel::fake {

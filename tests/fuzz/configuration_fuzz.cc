@@ -12,8 +12,8 @@
 #include <vector>
 
 #include "formats/toml.h"
-#include "platform/linux/configuration.h"
-#include "platform/linux/entitlement_rules.h"
+#include "platform/linux/configuration/configuration.h"
+#include "platform/linux/identity/entitlement_rules.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/scratch_folder.h"
 

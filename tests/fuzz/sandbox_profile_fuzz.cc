@@ -1,7 +1,7 @@
 // Sandbox profiles of any text. The whole input is the file. What is granted must be in the text, word for
 // word, and a profile with any mistake grants nothing.
 
-#include "platform/linux/sandbox_profile.h"
+#include "platform/linux/sandbox/sandbox_profile.h"
 
 #include <sys/socket.h>
 

@@ -14,7 +14,7 @@
 #include "formats/document.h"
 #include "formats/toml.h"
 #include "platform/fake/fake_log.h"
-#include "platform/linux/toml_settings_store.h"
+#include "platform/linux/configuration/toml_settings_store.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/scratch_folder.h"
 #include "tests/fuzz/values.h"

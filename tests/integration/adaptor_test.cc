@@ -11,7 +11,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/linux/trusted_folder_test_support.h"
+#include "platform/linux/bundles/trusted_folder_test_support.h"
 #include "tests/helpers/lab_process.h"
 #include "tests/helpers/private_instance.h"
 #include "tests/helpers/storebags.h"

@@ -7,7 +7,7 @@
 #include <sstream>
 
 #include "platform/fake/fake_log.h"
-#include "platform/linux/curl_http_client.h"
+#include "platform/linux/http/curl_http_client.h"
 #include "tests/helpers/child_process.h"
 #include "tests/helpers/lab_process.h"
 #include "tests/helpers/private_instance.h"

@@ -8,7 +8,7 @@
 #include <sstream>
 
 #include "platform/fake/fake_log.h"
-#include "platform/linux/toml_settings_store.h"
+#include "platform/linux/configuration/toml_settings_store.h"
 #include "tools/tarnelctl/acting_as_owner.h"
 #include "tools/tarnelctl/consent_command.h"
 #include "tools/tarnelctl/log_command.h"

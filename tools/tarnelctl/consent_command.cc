@@ -5,10 +5,10 @@
 #include <string_view>
 
 #include "base/log.h"
-#include "client/shared/consent_identifiers.h"
-#include "platform/linux/file_consent.h"
-#include "platform/linux/system_random.h"
+#include "platform/linux/device/file_consent.h"
+#include "platform/linux/system/system_random.h"
 #include "tools/tarnelctl/acting_as_owner.h"
+#include "util/consent_identifiers.h"
 
 namespace tarnel::ctl {
 namespace {

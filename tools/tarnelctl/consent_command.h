@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "platform/linux/toml_settings_store.h"
+#include "platform/linux/configuration/toml_settings_store.h"
 #include "tools/tarnelctl/terminal.h"
 
 // `tarnelctl consent`: whether the user has agreed to the submission of diagnostics.

@@ -11,7 +11,7 @@
 #include <limits>
 #include <string_view>
 
-#include "platform/linux/directories.h"
+#include "platform/linux/configuration/directories.h"
 #include "tools/tarnelctl/acting_as_owner.h"
 #include "tools/tarnelctl/archive_command.h"
 #include "tools/tarnelctl/consent_command.h"

@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "platform/linux/power_log_record.h"
+#include "platform/linux/power_log/power_log_record.h"
 #include "tools/tarnelctl/terminal.h"
 
 // `tarnelctl power-log`: what the daemon recorded in the power log.

@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "platform/linux/toml_settings_store.h"
+#include "platform/linux/configuration/toml_settings_store.h"
 #include "tools/tarnelctl/terminal.h"
 
 // `tarnelctl settings`: what is set, and which layer it comes from.
