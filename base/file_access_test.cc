@@ -5,7 +5,7 @@
 
 #include <cerrno>
 
-#include "platform/linux/linux_test_support.h"
+#include "testing/linux_test_support.h"
 
 namespace tarnel {
 namespace {

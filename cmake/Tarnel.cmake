@@ -85,3 +85,13 @@ function(tarnel_test name)
   endif()
   set_tests_properties(${name} PROPERTIES TIMEOUT ${ARG_TIMEOUT} LABELS "${ARG_LABELS}")
 endfunction()
+
+# tarnel_process_test(NAME SOURCES a_test.cc LABELS x [DEPENDS y] [TIMEOUT seconds]): a test that runs real programs.
+function(tarnel_process_test name)
+  cmake_parse_arguments(ARG "" "TIMEOUT" "SOURCES;DEPENDS;LABELS" ${ARGN})
+  if(NOT ARG_TIMEOUT)
+    set(ARG_TIMEOUT 300)
+  endif()
+  tarnel_test(${name} SOURCES ${ARG_SOURCES} DEPENDS tarnel_test_processes ${ARG_DEPENDS}
+    LABELS ${ARG_LABELS} TIMEOUT ${ARG_TIMEOUT})
+endfunction()

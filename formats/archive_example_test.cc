@@ -7,7 +7,7 @@
 
 #include "formats/archive.h"
 #include "formats/document.h"
-#include "platform/linux/linux_test_support.h"
+#include "testing/linux_test_support.h"
 
 // The example of a reader in another language, which knows the archive's description and nothing else.
 

@@ -3,8 +3,8 @@
 #include <vector>
 
 #include "platform/fake/fake_world.h"
+#include "testing/test_storebag.h"
 #include "util/storebag_internal.h"
-#include "util/test_storebag.h"
 
 namespace tarnel {
 namespace {

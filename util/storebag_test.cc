@@ -6,7 +6,7 @@
 #include <vector>
 
 #include "platform/fake/fake_world.h"
-#include "util/test_storebag.h"
+#include "testing/test_storebag.h"
 
 namespace tarnel {
 namespace {

@@ -9,7 +9,7 @@
 
 #include "platform/fake/fake_client_files.h"
 #include "platform/fake/fake_http_client.h"
-#include "tests/helpers/waiting.h"
+#include "testing/waiting.h"
 
 namespace tarnel {
 namespace {

@@ -12,7 +12,7 @@
 #include "base/unique_fd.h"
 #include "platform/linux/queues/asio_work_queues.h"
 #include "platform/linux/queues/udp_sockets.h"
-#include "tests/helpers/waiting.h"
+#include "testing/waiting.h"
 
 // Delivery over real UDP, through a network that loses, repeats, delays and reorders.
 

@@ -7,7 +7,7 @@
 #include "backends/dashboard/dashboard_backend_fixture.h"
 #include "platform/linux/queues/asio_work_queues.h"
 #include "platform/linux/queues/udp_sockets.h"
-#include "tests/helpers/waiting.h"
+#include "testing/waiting.h"
 
 // What backends take from the system, and that they give it back. With the real queues and sockets.
 

@@ -3,10 +3,10 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/storebag_server.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/private_instance.h"
+#include "testing/storebag_server.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // A daemon that starts on damaged, unreadable or foreign files names each with its line and the remedy, and
 // goes on wherever that is safe.

@@ -8,11 +8,11 @@
 #include <thread>
 
 #include "formats/document.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/programs.h"
-#include "tests/helpers/storebag_server.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/private_instance.h"
+#include "testing/programs.h"
+#include "testing/storebag_server.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // A daemon that is killed at any instant.
 

@@ -5,12 +5,12 @@
 #include <map>
 #include <mutex>
 
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/raw_http_server.h"
-#include "tests/helpers/storebag_server.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_certificates.h"
-#include "tests/helpers/test_session.h"
+#include "testing/private_instance.h"
+#include "testing/raw_http_server.h"
+#include "testing/storebag_server.h"
+#include "testing/storebags.h"
+#include "testing/test_certificates.h"
+#include "testing/test_session.h"
 
 // Reporting servers that answer anything but well. Only 500 to 599 switch a session's backend off; nothing
 // harms the daemon or another session.

@@ -2,11 +2,11 @@
 #include <gtest/gtest.h>
 
 #include "formats/document.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/storebag_server.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_certificates.h"
-#include "tests/helpers/test_session.h"
+#include "testing/private_instance.h"
+#include "testing/storebag_server.h"
+#include "testing/storebags.h"
+#include "testing/test_certificates.h"
+#include "testing/test_session.h"
 
 // Storebag servers that answer anything but well. A client is told that there is no storebag, or served with
 // the rest of a document that verifies; the daemon goes on.

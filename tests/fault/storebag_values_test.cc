@@ -4,10 +4,10 @@
 #include <set>
 
 #include "formats/document.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/storebag_server.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/private_instance.h"
+#include "testing/storebag_server.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // Verified storebags whose values are of every wrong kind. Such a value counts as absent, one warning names
 // it, and the daemon goes on.

@@ -16,11 +16,11 @@
 #include "platform/fake/fake_ipc.h"
 #include "platform/fake/fake_world.h"
 #include "tarnel/keys.h"
+#include "testing/test_storebag.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/storebag_expectation.h"
 #include "tests/fuzz/values.h"
 #include "util/storebag_internal.h"
-#include "util/test_storebag.h"
 
 namespace tarnel::fuzz {
 

@@ -15,11 +15,11 @@
 #include "formats/document.h"
 #include "formats/json_writer.h"
 #include "platform/fake/fake_world.h"
+#include "testing/test_storebag.h"
 #include "tests/fuzz/fuzz_target.h"
 #include "tests/fuzz/storebag_expectation.h"
 #include "tests/fuzz/values.h"
 #include "util/storebag.h"
-#include "util/test_storebag.h"
 
 namespace tarnel::fuzz {
 

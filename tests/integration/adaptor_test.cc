@@ -12,10 +12,10 @@
 #include <vector>
 
 #include "platform/linux/bundles/trusted_folder_test_support.h"
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/lab_process.h"
+#include "testing/private_instance.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // The sample adaptor in the confined daemon.
 

@@ -4,9 +4,9 @@
 #include <sstream>
 #include <string>
 
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/programs.h"
+#include "testing/lab_process.h"
+#include "testing/private_instance.h"
+#include "testing/programs.h"
 
 // The first programs of docs/client-library.md do what it says, against the lab and the storebag of the demo.
 

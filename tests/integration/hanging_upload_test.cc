@@ -12,7 +12,7 @@
 #include "ipc/server/ipc_test_support.h"
 #include "platform/fake/fake_world.h"
 #include "tarnel/tarnel.h"
-#include "tests/helpers/waiting.h"
+#include "testing/waiting.h"
 
 // Uploads from the client library through the IPC service to the upload backend, while the server that should
 // answer hangs.

@@ -6,10 +6,10 @@
 #include <map>
 #include <mutex>
 
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/lab_process.h"
+#include "testing/private_instance.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // Sessions of several clients that report for one activity.
 

@@ -8,13 +8,13 @@
 
 #include "platform/fake/fake_log.h"
 #include "platform/linux/http/curl_http_client.h"
-#include "tests/helpers/child_process.h"
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/programs.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_certificates.h"
-#include "tests/helpers/test_session.h"
+#include "testing/child_process.h"
+#include "testing/lab_process.h"
+#include "testing/private_instance.h"
+#include "testing/programs.h"
+#include "testing/storebags.h"
+#include "testing/test_certificates.h"
+#include "testing/test_session.h"
 
 // The HTTP client by itself, and in the daemon, against a server that speaks HTTP/2.
 

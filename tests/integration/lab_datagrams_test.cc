@@ -15,8 +15,8 @@
 #include "platform/fake/fake_world.h"
 #include "platform/linux/queues/asio_work_queues.h"
 #include "platform/linux/queues/udp_sockets.h"
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/waiting.h"
+#include "testing/lab_process.h"
+#include "testing/waiting.h"
 #include "tools/lab/datagram_decoder.h"
 
 // Dashboard datagrams: what the backend makes is what the lab reads, and what it delivers arrives there. The

@@ -7,12 +7,12 @@
 
 #include "formats/archive.h"
 #include "formats/document.h"
-#include "tests/helpers/http_request.h"
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/programs.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/http_request.h"
+#include "testing/lab_process.h"
+#include "testing/private_instance.h"
+#include "testing/programs.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // Files and log data, from the client library through the confined daemon to the lab.
 

@@ -5,10 +5,10 @@
 #include <atomic>
 #include <set>
 
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/lab_process.h"
+#include "testing/private_instance.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // From a client's message to the event that arrives at a reporting server, through real processes, sockets
 // and TLS.

@@ -9,11 +9,11 @@
 #include <filesystem>
 #include <future>
 
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/programs.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/lab_process.h"
+#include "testing/private_instance.h"
+#include "testing/programs.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // How the daemon starts, what it may still do then, and how it ends.
 

@@ -1,10 +1,10 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/lab_process.h"
+#include "testing/private_instance.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // When the daemon asks for a storebag, and what it makes of the answers.
 

@@ -3,8 +3,8 @@
 
 #include "formats/archive.h"
 #include "formats/document.h"
-#include "tests/helpers/child_process.h"
-#include "tests/helpers/programs.h"
+#include "testing/child_process.h"
+#include "testing/programs.h"
 
 // `tarnelctl archive`, which needs no daemon.
 

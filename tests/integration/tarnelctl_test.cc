@@ -4,11 +4,11 @@
 #include <algorithm>
 
 #include "formats/document.h"
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/programs.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/lab_process.h"
+#include "testing/private_instance.h"
+#include "testing/programs.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // The command-line tool against the daemon.
 

@@ -13,12 +13,12 @@
 #include <random>
 #include <thread>
 
-#include "tests/helpers/lab_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/programs.h"
-#include "tests/helpers/raw_http_server.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/lab_process.h"
+#include "testing/private_instance.h"
+#include "testing/programs.h"
+#include "testing/raw_http_server.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // Files of clients, from the client library through the confined daemon to a server.
 

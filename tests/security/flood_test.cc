@@ -8,11 +8,11 @@
 #include <thread>
 #include <utility>
 
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/raw_bus_client.h"
-#include "tests/helpers/storebag_server.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/private_instance.h"
+#include "testing/raw_bus_client.h"
+#include "testing/storebag_server.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // Clients that send without end, read nothing or come in crowds: what they make the daemon hold is bounded,
 // and the others are served meanwhile.

@@ -20,7 +20,7 @@
 #include <cstring>
 #include <string>
 
-#include "tests/helpers/raw_bus_client.h"
+#include "testing/raw_bus_client.h"
 
 namespace {
 

@@ -5,7 +5,7 @@
 #include <sys/statvfs.h>
 #include <unistd.h>
 
-#include "tests/helpers/private_instance.h"
+#include "testing/private_instance.h"
 
 // Who is let in: the program that is set-group-id to the entitled group, and nobody who pretends to be it.
 

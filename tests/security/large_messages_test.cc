@@ -5,11 +5,11 @@
 #include <memory>
 #include <vector>
 
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/raw_http_server.h"
-#include "tests/helpers/storebag_server.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/private_instance.h"
+#include "testing/raw_http_server.h"
+#include "testing/storebag_server.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // Messages of the largest size whose values take many times their bytes once they are decoded.
 

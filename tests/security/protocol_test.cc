@@ -8,11 +8,11 @@
 #include <filesystem>
 #include <iterator>
 
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/raw_bus_client.h"
-#include "tests/helpers/storebag_server.h"
-#include "tests/helpers/storebags.h"
-#include "tests/helpers/test_session.h"
+#include "testing/private_instance.h"
+#include "testing/raw_bus_client.h"
+#include "testing/storebag_server.h"
+#include "testing/storebags.h"
+#include "testing/test_session.h"
 
 // Clients that say anything, in any order, and die at any instant: each harms nobody but itself.
 

@@ -12,8 +12,8 @@
 
 #include "platform/fake/fake_log.h"
 #include "platform/linux/bundles/trusted_folder_test_support.h"
-#include "platform/linux/linux_test_support.h"
 #include "platform/linux/sandbox/linux_sandbox.h"
+#include "testing/linux_test_support.h"
 
 // The sample adaptor, and others that do something wrong, loaded from real bundles.
 

@@ -9,7 +9,7 @@
 
 #include "platform/file_system.h"
 #include "platform/linux/bundles/trusted_folder_test_support.h"
-#include "platform/linux/linux_test_support.h"
+#include "testing/linux_test_support.h"
 
 namespace tarnel {
 namespace {

@@ -7,7 +7,7 @@
 
 #include "base/file_access.h"
 #include "formats/toml.h"
-#include "platform/linux/linux_test_support.h"
+#include "testing/linux_test_support.h"
 
 namespace tarnel {
 namespace {

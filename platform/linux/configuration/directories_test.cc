@@ -6,7 +6,7 @@
 
 #include <map>
 
-#include "platform/linux/linux_test_support.h"
+#include "testing/linux_test_support.h"
 
 namespace tarnel {
 namespace {

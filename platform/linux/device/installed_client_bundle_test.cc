@@ -6,7 +6,7 @@
 
 #include <memory>
 
-#include "platform/linux/linux_test_support.h"
+#include "testing/linux_test_support.h"
 
 namespace tarnel {
 namespace {

@@ -5,7 +5,7 @@
 #include <unistd.h>
 
 #include "platform/fake/fake_log.h"
-#include "platform/linux/linux_test_support.h"
+#include "testing/linux_test_support.h"
 
 namespace tarnel {
 namespace {

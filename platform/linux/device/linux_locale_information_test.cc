@@ -11,8 +11,8 @@
 #include <vector>
 
 #include "platform/fake/fake_log.h"
-#include "platform/linux/linux_test_support.h"
-#include "platform/linux/zone_file_test_support.h"
+#include "testing/linux_test_support.h"
+#include "testing/zone_file_test_support.h"
 
 namespace tarnel {
 namespace {

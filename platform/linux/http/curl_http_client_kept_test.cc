@@ -6,7 +6,7 @@
 
 #include "platform/linux/http/curl_http_client.h"
 #include "platform/linux/http/curl_test_support.h"
-#include "tests/helpers/waiting.h"
+#include "testing/waiting.h"
 
 // Connections that are kept for the next request: what is sent on them arrives at most once.
 

@@ -4,7 +4,7 @@
 
 #include "platform/linux/http/curl_http_client.h"
 #include "platform/linux/http/curl_test_support.h"
-#include "tests/helpers/waiting.h"
+#include "testing/waiting.h"
 
 // Requests that want no body: the status decides as soon as it is there.
 

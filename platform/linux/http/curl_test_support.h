@@ -14,7 +14,7 @@
 
 #include "base/log.h"
 #include "platform/linux/http/curl_http_client.h"
-#include "tests/helpers/raw_http_server.h"
+#include "testing/raw_http_server.h"
 
 namespace tarnel {
 

@@ -12,7 +12,7 @@
 
 #include "platform/fake/fake_clock.h"
 #include "platform/fake/fake_log.h"
-#include "platform/linux/linux_test_support.h"
+#include "testing/linux_test_support.h"
 
 namespace tarnel {
 namespace {

@@ -11,7 +11,7 @@
 #include "base/unique_fd.h"
 #include "platform/fake/fake_log.h"
 #include "platform/linux/queues/asio_work_queues.h"
-#include "tests/helpers/waiting.h"
+#include "testing/waiting.h"
 
 namespace tarnel {
 

@@ -14,7 +14,7 @@
 #include <string>
 
 #include "base/unique_fd.h"
-#include "tests/helpers/waiting.h"
+#include "testing/waiting.h"
 
 namespace tarnel {
 namespace {

@@ -6,8 +6,8 @@
 #include <string>
 
 #include "base/file_access.h"
-#include "platform/linux/linux_test_support.h"
 #include "platform/linux/sandbox/linux_sandbox.h"
+#include "testing/linux_test_support.h"
 
 namespace tarnel {
 

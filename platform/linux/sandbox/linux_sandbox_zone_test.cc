@@ -15,7 +15,7 @@
 #include "platform/fake/fake_log.h"
 #include "platform/linux/device/linux_locale_information.h"
 #include "platform/linux/sandbox/linux_sandbox_test_fixture.h"
-#include "platform/linux/zone_file_test_support.h"
+#include "testing/zone_file_test_support.h"
 
 namespace tarnel {
 namespace {

@@ -9,8 +9,8 @@
 #include <filesystem>
 
 #include "ipc/server/peer_process.h"
-#include "platform/linux/linux_test_support.h"
 #include "platform/linux/sandbox/linux_sandbox.h"
+#include "testing/linux_test_support.h"
 
 namespace tarnel {
 namespace {

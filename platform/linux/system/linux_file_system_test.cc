@@ -9,7 +9,7 @@
 #include <cerrno>
 #include <chrono>
 
-#include "platform/linux/linux_test_support.h"
+#include "testing/linux_test_support.h"
 
 namespace tarnel {
 namespace {

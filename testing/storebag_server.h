@@ -8,9 +8,9 @@
 #include <utility>
 
 #include "base/value.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/raw_http_server.h"
-#include "tests/helpers/test_folder.h"
+#include "testing/private_instance.h"
+#include "testing/raw_http_server.h"
+#include "testing/test_folder.h"
 #include "tools/storebag/storebag_key.h"
 
 namespace tarnel::test {

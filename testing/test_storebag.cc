@@ -1,4 +1,4 @@
-#include "util/test_storebag.h"
+#include "testing/test_storebag.h"
 
 #include <openssl/evp.h>
 #include <openssl/rsa.h>

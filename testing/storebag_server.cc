@@ -1,4 +1,4 @@
-#include "tests/helpers/storebag_server.h"
+#include "testing/storebag_server.h"
 
 #include <stdexcept>
 

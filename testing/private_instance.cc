@@ -1,4 +1,4 @@
-#include "tests/helpers/private_instance.h"
+#include "testing/private_instance.h"
 
 #include <gtest/gtest.h>
 #include <poll.h>
@@ -13,7 +13,7 @@
 #include <filesystem>
 #include <fstream>
 
-#include "tests/helpers/programs.h"
+#include "testing/programs.h"
 
 namespace tarnel::test {
 

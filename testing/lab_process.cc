@@ -1,4 +1,4 @@
-#include "tests/helpers/lab_process.h"
+#include "testing/lab_process.h"
 
 #include <gtest/gtest.h>
 #include <poll.h>
@@ -14,8 +14,8 @@
 #include <stdexcept>
 
 #include "formats/document.h"
-#include "tests/helpers/http_request.h"
-#include "tests/helpers/programs.h"
+#include "testing/http_request.h"
+#include "testing/programs.h"
 
 namespace tarnel::test {
 namespace {

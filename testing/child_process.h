@@ -13,8 +13,8 @@
 #include <vector>
 
 #include "base/unique_fd.h"
-#include "tests/helpers/test_folder.h"
-#include "tests/helpers/waiting.h"
+#include "testing/test_folder.h"
+#include "testing/waiting.h"
 
 namespace tarnel::test {
 

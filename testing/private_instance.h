@@ -7,8 +7,8 @@
 #include <vector>
 
 #include "base/value.h"
-#include "tests/helpers/child_process.h"
-#include "tests/helpers/test_folder.h"
+#include "testing/child_process.h"
+#include "testing/test_folder.h"
 
 namespace tarnel::test {
 

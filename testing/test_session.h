@@ -8,8 +8,8 @@
 
 #include "tarnel/keys.h"
 #include "tarnel/tarnel.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/waiting.h"
+#include "testing/private_instance.h"
+#include "testing/waiting.h"
 
 // Clients of the daemon, through the client library.
 

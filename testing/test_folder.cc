@@ -1,4 +1,4 @@
-#include "tests/helpers/test_folder.h"
+#include "testing/test_folder.h"
 
 #include <pwd.h>
 #include <sys/stat.h>

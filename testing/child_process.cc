@@ -1,4 +1,4 @@
-#include "tests/helpers/child_process.h"
+#include "testing/child_process.h"
 
 #include <fcntl.h>
 #include <grp.h>

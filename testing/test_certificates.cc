@@ -1,4 +1,4 @@
-#include "tests/helpers/test_certificates.h"
+#include "testing/test_certificates.h"
 
 #include <openssl/bio.h>
 #include <openssl/evp.h>

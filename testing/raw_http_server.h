@@ -13,7 +13,7 @@
 #include <thread>
 #include <vector>
 
-#include "tests/helpers/test_certificates.h"
+#include "testing/test_certificates.h"
 
 namespace tarnel::test {
 

@@ -1,4 +1,4 @@
-#include "tests/helpers/raw_http_server.h"
+#include "testing/raw_http_server.h"
 
 #include <arpa/inet.h>
 #include <netinet/in.h>

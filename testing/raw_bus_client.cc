@@ -1,4 +1,4 @@
-#include "tests/helpers/raw_bus_client.h"
+#include "testing/raw_bus_client.h"
 
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -6,7 +6,7 @@
 #include <array>
 #include <cerrno>
 
-#include "tests/helpers/waiting.h"
+#include "testing/waiting.h"
 
 namespace tarnel::test {
 namespace {

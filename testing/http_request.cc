@@ -1,4 +1,4 @@
-#include "tests/helpers/http_request.h"
+#include "testing/http_request.h"
 
 #include <netinet/in.h>
 #include <sys/socket.h>
@@ -7,7 +7,7 @@
 #include <cstdlib>
 
 #include "base/unique_fd.h"
-#include "tests/helpers/waiting.h"
+#include "testing/waiting.h"
 
 namespace tarnel::test {
 

@@ -7,9 +7,9 @@
 #include <vector>
 
 #include "base/value.h"
-#include "tests/helpers/child_process.h"
-#include "tests/helpers/private_instance.h"
-#include "tests/helpers/test_folder.h"
+#include "testing/child_process.h"
+#include "testing/private_instance.h"
+#include "testing/test_folder.h"
 
 namespace tarnel::test {
 
