@@ -17,7 +17,7 @@
 #include "platform/linux/queues/udp_sockets.h"
 #include "testing/lab_process.h"
 #include "testing/waiting.h"
-#include "tools/lab/datagram_decoder.h"
+#include "tools/receiving/datagram_decoder.h"
 
 // Dashboard datagrams: what the backend makes is what the lab reads, and what it delivers arrives there. The
 // backend is driven directly, through its own send, because sessions make no datagrams.

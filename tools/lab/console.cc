@@ -2,7 +2,7 @@
 
 #include "formats/document.h"
 #include "tools/lab/summary.h"
-#include "tools/lab/text.h"
+#include "tools/receiving/text.h"
 
 namespace tarnel::lab {
 namespace {

@@ -4,9 +4,9 @@
 #include <string>
 
 #include "platform/clock.h"
-#include "tools/lab/arrival.h"
-#include "tools/lab/notices.h"
 #include "tools/lab/print_queue.h"
+#include "tools/receiving/arrival.h"
+#include "tools/receiving/notices.h"
 
 namespace tarnel::lab {
 

@@ -10,7 +10,7 @@
 #include "formats/document.h"
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/summary.h"
-#include "tools/lab/test_post.h"
+#include "tools/receiving/test_post.h"
 #include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {

@@ -5,10 +5,10 @@
 #include <cerrno>
 
 #include "formats/document.h"
-#include "tools/lab/listener.h"
+#include "tools/lab/http/listener.h"
 #include "tools/lab/service.h"
-#include "tools/lab/stored_files.h"
-#include "tools/lab/text.h"
+#include "tools/receiving/stored_files.h"
+#include "tools/receiving/text.h"
 
 namespace tarnel::lab {
 namespace {

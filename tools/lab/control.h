@@ -2,10 +2,10 @@
 
 #include <functional>
 
-#include "tools/lab/arrival_store.h"
-#include "tools/lab/datagram_faults.h"
-#include "tools/lab/http_message.h"
-#include "tools/lab/misbehaviour.h"
+#include "tools/lab/receivers/datagram_faults.h"
+#include "tools/lab/receivers/misbehaviour.h"
+#include "tools/receiving/arrival_store.h"
+#include "tools/receiving/http_message.h"
 
 namespace tarnel::lab {
 

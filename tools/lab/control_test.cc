@@ -4,7 +4,7 @@
 #include <unistd.h>
 
 #include "formats/document.h"
-#include "tools/lab/test_post.h"
+#include "tools/receiving/test_post.h"
 #include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {

@@ -6,18 +6,18 @@
 #include <algorithm>
 
 #include "formats/document.h"
-#include "tools/lab/arrival_store.h"
 #include "tools/lab/control.h"
-#include "tools/lab/datagram_server.h"
-#include "tools/lab/http_server.h"
+#include "tools/lab/http/http_server.h"
+#include "tools/lab/http/listener.h"
 #include "tools/lab/lab_directory.h"
-#include "tools/lab/listener.h"
-#include "tools/lab/log_data_receiver.h"
-#include "tools/lab/ndjson_writer.h"
+#include "tools/lab/receivers/datagram_server.h"
+#include "tools/lab/receivers/log_data_receiver.h"
+#include "tools/lab/receivers/upload_receiver.h"
 #include "tools/lab/service.h"
-#include "tools/lab/stored_files.h"
-#include "tools/lab/text.h"
-#include "tools/lab/upload_receiver.h"
+#include "tools/receiving/arrival_store.h"
+#include "tools/receiving/ndjson_writer.h"
+#include "tools/receiving/stored_files.h"
+#include "tools/receiving/text.h"
 
 namespace tarnel::lab {
 namespace {

@@ -5,7 +5,7 @@
 #include <vector>
 
 #include "base/error.h"
-#include "tools/lab/certificate_authority.h"
+#include "tools/lab/http/certificate_authority.h"
 #include "tools/storebag/file_io.h"
 #include "tools/storebag/storebag_key.h"
 

@@ -5,9 +5,9 @@
 #include <future>
 #include <thread>
 
-#include "tools/lab/certificate_authority.h"
+#include "tools/lab/http/certificate_authority.h"
 #include "tools/lab/lab_test_fixture.h"
-#include "tools/lab/test_post.h"
+#include "tools/receiving/test_post.h"
 
 namespace tarnel::lab {
 namespace {

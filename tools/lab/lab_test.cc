@@ -8,7 +8,7 @@
 #include <thread>
 
 #include "tools/lab/lab_test_fixture.h"
-#include "tools/lab/test_post.h"
+#include "tools/receiving/test_post.h"
 #include "tools/storebag/signed_storebag.h"
 
 namespace tarnel::lab {

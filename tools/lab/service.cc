@@ -1,6 +1,6 @@
 #include "tools/lab/service.h"
 
-#include "tools/lab/text.h"
+#include "tools/receiving/text.h"
 
 namespace tarnel::lab {
 namespace {

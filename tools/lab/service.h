@@ -3,13 +3,13 @@
 #include <atomic>
 
 #include "platform/clock.h"
-#include "tools/lab/http_message.h"
-#include "tools/lab/log_data_receiver.h"
-#include "tools/lab/misbehaviour.h"
-#include "tools/lab/notices.h"
-#include "tools/lab/post_receiver.h"
+#include "tools/lab/receivers/log_data_receiver.h"
+#include "tools/lab/receivers/misbehaviour.h"
+#include "tools/lab/receivers/post_receiver.h"
+#include "tools/lab/receivers/upload_receiver.h"
 #include "tools/lab/storebag_source.h"
-#include "tools/lab/upload_receiver.h"
+#include "tools/receiving/http_message.h"
+#include "tools/receiving/notices.h"
 
 namespace tarnel::lab {
 

@@ -5,7 +5,7 @@
 #include <filesystem>
 
 #include "formats/document.h"
-#include "tools/lab/text.h"
+#include "tools/receiving/text.h"
 #include "tools/storebag/file_io.h"
 #include "tools/storebag/signed_storebag.h"
 

@@ -9,8 +9,8 @@
 #include "formats/document.h"
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/service.h"
-#include "tools/lab/test_post.h"
-#include "tools/lab/text.h"
+#include "tools/receiving/test_post.h"
+#include "tools/receiving/text.h"
 #include "tools/storebag/signed_storebag.h"
 
 namespace tarnel::lab {

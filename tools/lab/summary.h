@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "tools/lab/arrival.h"
+#include "tools/receiving/arrival.h"
 
 // Arrivals in one line each, without time and colour, fit for a terminal. Threads: any.
 
