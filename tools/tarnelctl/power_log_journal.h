@@ -1,7 +1,7 @@
 #pragma once
 
+#include "tools/tarnelctl/commands/power_log_command.h"
 #include "tools/tarnelctl/journal.h"
-#include "tools/tarnelctl/power_log_command.h"
 
 namespace tarnel::ctl {
 

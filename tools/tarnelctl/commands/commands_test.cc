@@ -10,10 +10,10 @@
 #include "platform/fake/fake_log.h"
 #include "platform/linux/configuration/toml_settings_store.h"
 #include "tools/tarnelctl/acting_as_owner.h"
-#include "tools/tarnelctl/consent_command.h"
-#include "tools/tarnelctl/log_command.h"
-#include "tools/tarnelctl/settings_command.h"
-#include "tools/tarnelctl/storebag_command.h"
+#include "tools/tarnelctl/commands/consent_command.h"
+#include "tools/tarnelctl/commands/log_command.h"
+#include "tools/tarnelctl/commands/settings_command.h"
+#include "tools/tarnelctl/commands/storebag_command.h"
 
 // The commands that need no daemon, over real files in a folder of the test's own.
 

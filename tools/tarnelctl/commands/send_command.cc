@@ -1,4 +1,4 @@
-#include "tools/tarnelctl/send_command.h"
+#include "tools/tarnelctl/commands/send_command.h"
 
 #include <algorithm>
 #include <chrono>

@@ -6,7 +6,7 @@
 
 #include "base/error.h"
 #include "base/value.h"
-#include "tools/tarnelctl/send_command.h"
+#include "tools/tarnelctl/commands/send_command.h"
 
 // `tarnelctl upload` and `tarnelctl upload-log`: a file, or log records, to the server that the client type's
 // storebag names.

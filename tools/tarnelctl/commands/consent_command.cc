@@ -1,4 +1,4 @@
-#include "tools/tarnelctl/consent_command.h"
+#include "tools/tarnelctl/commands/consent_command.h"
 
 #include <cerrno>
 #include <ostream>

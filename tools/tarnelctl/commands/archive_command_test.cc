@@ -1,4 +1,4 @@
-#include "tools/tarnelctl/archive_command.h"
+#include "tools/tarnelctl/commands/archive_command.h"
 
 #include <fcntl.h>
 #include <gmock/gmock.h>

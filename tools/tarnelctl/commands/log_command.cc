@@ -1,4 +1,4 @@
-#include "tools/tarnelctl/log_command.h"
+#include "tools/tarnelctl/commands/log_command.h"
 
 #include <sys/inotify.h>
 #include <unistd.h>

@@ -1,4 +1,4 @@
-#include "tools/tarnelctl/power_log_command.h"
+#include "tools/tarnelctl/commands/power_log_command.h"
 
 #include <fcntl.h>
 #include <sys/inotify.h>

@@ -1,4 +1,4 @@
-#include "tools/tarnelctl/settings_command.h"
+#include "tools/tarnelctl/commands/settings_command.h"
 
 #include <cerrno>
 #include <ostream>

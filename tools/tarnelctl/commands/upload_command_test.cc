@@ -1,4 +1,4 @@
-#include "tools/tarnelctl/upload_command.h"
+#include "tools/tarnelctl/commands/upload_command.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>

@@ -1,4 +1,4 @@
-#include "tools/tarnelctl/power_log_command.h"
+#include "tools/tarnelctl/commands/power_log_command.h"
 
 #include <gmock/gmock.h>
 #include <sys/stat.h>

@@ -1,4 +1,4 @@
-#include "tools/tarnelctl/storebag_command.h"
+#include "tools/tarnelctl/commands/storebag_command.h"
 
 #include <optional>
 #include <ostream>

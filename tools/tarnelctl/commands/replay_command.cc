@@ -1,4 +1,4 @@
-#include "tools/tarnelctl/replay_command.h"
+#include "tools/tarnelctl/commands/replay_command.h"
 
 #include <atomic>
 #include <fstream>
