@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <utility>
 
+#include "base/hex.h"
 #include "formats/cryptography.h"
 
 namespace tarnel {
@@ -45,16 +46,9 @@ std::shared_ptr<TarnelBackend> TarnelBackend::initWithName(const Dependencies& d
 }
 
 std::string TarnelBackend::convertIntoSHA256(std::string_view text) {
-  static constexpr std::string_view kDigits = "0123456789abcdef";
   const auto covered = text.substr(0, std::min(text.size(), utf16Length(text)));
   const auto* bytes = reinterpret_cast<const uint8_t*>(covered.data());
-  std::string digits(64, '0');
-  size_t at = 0;
-  for (const uint8_t byte : sha256({bytes, covered.size()})) {
-    digits[at++] = kDigits[byte >> 4U];
-    digits[at++] = kDigits[byte & 15U];
-  }
-  return digits;
+  return hexText(sha256({bytes, covered.size()}));
 }
 
 MaybeSentObject TarnelBackend::sendMessage(const MaybeDictionary& payload, const TimeValue& timestamp,

@@ -1,23 +1,15 @@
 #include "base/log_text.h"
 
-#include <array>
-#include <cstdio>
+#include <cstdint>
 
-#include "base/value.h"
+#include "base/hex.h"
+#include "base/utf8.h"
 
 namespace tarnel {
 
 namespace {
 
 constexpr size_t kMaxText = 16384;
-
-// Length of the well-formed UTF-8 sequence at the front; 0 when there is none.
-size_t sequenceLength(std::string_view text) {
-  for (size_t length = 1; length <= 4 && length <= text.size(); ++length) {
-    if (isValidUtf8(text.substr(0, length))) return length;
-  }
-  return 0;
-}
 
 void appendEscape(std::string& out, char character) {
   switch (character) {
@@ -31,9 +23,8 @@ void appendEscape(std::string& out, char character) {
       out += "\\t";
       return;
     default:
-      std::array<char, 8> escape{};
-      std::snprintf(escape.data(), escape.size(), "\\x%02x", static_cast<unsigned char>(character));
-      out += escape.data();
+      out += "\\x";
+      appendHex(out, static_cast<uint8_t>(character));
   }
 }
 
@@ -53,7 +44,7 @@ std::string escapedForLog(std::string_view text) {
   std::string out;
   out.reserve(text.size());
   while (!text.empty()) {
-    const size_t length = sequenceLength(text);
+    const size_t length = utf8CharacterLength(text);
     const std::string_view sequence = text.substr(0, length == 0 ? 1 : length);
     if (length == 0 || isControl(sequence)) {
       for (const char character : sequence) appendEscape(out, character);

@@ -11,18 +11,7 @@ bool isAllowedInQuery(char c) {
 }  // namespace
 
 std::string percentEncodedForQuery(std::string_view text) {
-  constexpr char kDigits[] = "0123456789ABCDEF";
-  std::string out;
-  out.reserve(text.size());
-  for (const char c : text) {
-    if (isAllowedInQuery(c)) {
-      out += c;
-      continue;
-    }
-    const auto byte = static_cast<unsigned char>(c);
-    out += {'%', kDigits[byte >> 4U], kDigits[byte & 0xFU]};
-  }
-  return out;
+  return percentEncoded(text, isAllowedInQuery);
 }
 
 }  // namespace tarnel

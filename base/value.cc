@@ -10,6 +10,8 @@
 #include <ctime>
 #include <limits>
 
+#include "base/hex.h"
+
 namespace tarnel {
 namespace {
 
@@ -105,16 +107,6 @@ void appendInside(std::string& out, const Value& value) {
   } else {
     out += value.description();
   }
-}
-
-std::string hexText(const Data& data) {
-  static constexpr std::string_view kDigits = "0123456789abcdef";
-  std::string out = "<";
-  for (const uint8_t byte : data) {
-    out += kDigits[byte >> 4U];
-    out += kDigits[byte & 15U];
-  }
-  return out + '>';
 }
 
 }  // namespace
@@ -238,36 +230,6 @@ std::string description(Date date) {
   std::array<char, 40> buffer{};
   const auto length = std::strftime(buffer.data(), buffer.size(), "%Y-%m-%d %H:%M:%S +0000", &parts);
   return {buffer.data(), length};
-}
-
-bool isValidUtf8(std::string_view text) noexcept {
-  const auto byteAt = [&text](size_t i) { return static_cast<uint8_t>(text[i]); };
-  for (size_t i = 0; i < text.size();) {
-    // Nearly all text is ASCII: eight bytes at a time.
-    if (uint64_t eight = 0; text.size() - i >= sizeof eight) {
-      std::memcpy(&eight, text.data() + i, sizeof eight);
-      if ((eight & 0x8080808080808080U) == 0) {
-        i += sizeof eight;
-        continue;
-      }
-    }
-    const uint8_t lead = byteAt(i);
-    if (lead < 0x80) {
-      ++i;
-      continue;
-    }
-    const size_t length = lead >= 0xF0 ? 4 : lead >= 0xE0 ? 3 : 2;
-    if (lead < 0xC2 || lead > 0xF4 || text.size() - i < length) return false;
-    const uint8_t second = byteAt(i + 1);
-    const uint8_t low = lead == 0xE0 ? 0xA0 : lead == 0xF0 ? 0x90 : 0x80;
-    const uint8_t high = lead == 0xED ? 0x9F : lead == 0xF4 ? 0x8F : 0xBF;
-    if (second < low || second > high) return false;
-    for (size_t k = 2; k < length; ++k) {
-      if ((byteAt(i + k) & 0xC0U) != 0x80) return false;
-    }
-    i += length;
-  }
-  return true;
 }
 
 std::string_view writeReal(double number, std::span<char, kRealTextSize> buffer) noexcept {

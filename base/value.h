@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "base/cow_ptr.h"
+#include "base/utf8.h"
 
 // The values that travel through the system: what a client puts into a payload, what a configuration
 // document holds, what an event is made of.
@@ -212,10 +213,6 @@ std::string description(const Dictionary& dictionary);
 std::string description(const Array& array);
 // "2026-01-31 12:00:00 +0000"; a date that no calendar holds is given in seconds.
 std::string description(Date date);
-
-// True when the bytes are well-formed UTF-8 (RFC 3629: no surrogates, nothing beyond U+10FFFF, shortest
-// form).
-bool isValidUtf8(std::string_view text) noexcept;
 
 // The shortest decimal text that reads back as the same double, written into the buffer: plain digits from
 // 1e-5 up to 1e17, with an exponent outside, "inf" and "nan" when it is not finite.

@@ -230,53 +230,6 @@ TEST(ValueTest, keepsWhatACopySharesWhenTheOriginalGoes) {
   EXPECT_EQ(copy, Value(Dictionary{{"k", Array{"v"}}}));
 }
 
-TEST(ValueTest, checksUtf8) {
-  using namespace std::string_literals;
-  const std::string valid[] = {"",
-                               "plain",
-                               "nul\0inside"s,
-                               "\x7F",
-                               "\xC2\x80",
-                               "\xDF\xBF",
-                               "\xE0\xA0\x80",
-                               "\xED\x9F\xBF",
-                               "\xEE\x80\x80",
-                               "\xEF\xBF\xBF",
-                               "\xF0\x90\x80\x80",
-                               "\xF4\x8F\xBF\xBF",
-                               "seven b\xC3\xA9 and eight more",
-                               "12345678\xE2\x82\xAC"};
-  for (const auto& text : valid) EXPECT_TRUE(isValidUtf8(text)) << text;
-  const std::string invalid[] = {"\x80",
-                                 "\xBF",
-                                 "\xC0\x80",
-                                 "\xC1\xBF",
-                                 "\xC2",
-                                 "\xC2\x41",
-                                 "\xE0\x9F\xBF",
-                                 "\xE1\x80",
-                                 "\xE1\x80\x41",
-                                 "\xED\xA0\x80",
-                                 "\xED\xBF\xBF",
-                                 "\xF0\x8F\xBF\xBF",
-                                 "\xF0\x90\x80",
-                                 "\xF4\x90\x80\x80",
-                                 "\xF5\x80\x80\x80",
-                                 "\xFE",
-                                 "\xFF",
-                                 "1234567\xC3",
-                                 "12345678\xFFxxxxxxx",
-                                 "\xE2\x28\xA1",
-                                 "\xF0\x90\x28\xBC"};
-  for (const auto& text : invalid)
-    EXPECT_FALSE(isValidUtf8(text)) << description(Array{Data(text.begin(), text.end())});
-  for (size_t place = 0; place < 24; ++place) {
-    std::string text(24, 'a');
-    text[place] = '\x90';
-    EXPECT_FALSE(isValidUtf8(text)) << place;
-  }
-}
-
 TEST(ValueTest, sendsWhatIsNotFiniteAsMinusOne) {
   EXPECT_EQ(finiteOrMinusOne(kInfinity), -1.0);
   EXPECT_EQ(finiteOrMinusOne(-kInfinity), -1.0);

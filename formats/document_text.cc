@@ -113,15 +113,9 @@ class TextHandler {
 std::string repairedUtf8(std::string_view text) {
   std::string out;
   while (!text.empty()) {
-    size_t length = 1;
-    while (length < 4 && length < text.size() && !isValidUtf8(text.substr(0, length))) ++length;
-    if (isValidUtf8(text.substr(0, length))) {
-      out += text.substr(0, length);
-    } else {
-      length = 1;
-      out += "\xEF\xBF\xBD";
-    }
-    text.remove_prefix(length);
+    const size_t length = utf8CharacterLength(text);
+    out += length == 0 ? "\xEF\xBF\xBD" : text.substr(0, length);
+    text.remove_prefix(length == 0 ? 1 : length);
   }
   return out;
 }

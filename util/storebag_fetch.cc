@@ -5,6 +5,7 @@
 #include <memory>
 #include <utility>
 
+#include "base/percent_encoding.h"
 #include "formats/document.h"
 #include "util/storebag_internal.h"
 
@@ -154,19 +155,11 @@ int32_t maxAgeOfResponse(const HttpResponse* response) {
 }
 
 std::string urlForRequest(std::string_view text) {
-  static constexpr std::string_view kDigits = "0123456789ABCDEF";
   static constexpr std::string_view kNeverInURL = "\"<>\\^`{|}";
-  std::string url;
-  url.reserve(text.size());
-  for (const char c : text) {
+  return percentEncoded(text, [](char c) {
     const auto byte = static_cast<unsigned char>(c);
-    if (byte <= 0x20 || byte >= 0x7F || kNeverInURL.find(c) != std::string_view::npos) {
-      url += {'%', kDigits[byte >> 4U], kDigits[byte & 15U]};
-    } else {
-      url += c;
-    }
-  }
-  return url;
+    return byte > 0x20 && byte < 0x7F && kNeverInURL.find(c) == std::string_view::npos;
+  });
 }
 
 bool isUsableLastModified(std::string_view value) {

@@ -14,10 +14,8 @@ namespace {
 constexpr size_t kMaxLoggedLocation = 4096;
 
 MaybeString logText(const MaybeString& location) {
-  if (!location || location->size() <= kMaxLoggedLocation) return location;
-  size_t end = kMaxLoggedLocation;
-  while (end > 0 && (static_cast<uint8_t>((*location)[end]) & 0xC0U) == 0x80U) --end;
-  return location->substr(0, end);
+  if (!location) return location;
+  return std::string(wholeCharacters(*location, kMaxLoggedLocation));
 }
 
 }  // namespace

@@ -62,15 +62,6 @@ size_t descriptionLength(const Value& value) {
   return units;
 }
 
-// Cuts to the bytes that may be, less those of a character that would be cut through.
-void cutToWholeCharacters(std::string& text, size_t size) {
-  constexpr size_t kLongestCharacter = 4;
-  const size_t least = size - std::min(size, kLongestCharacter - 1);
-  size_t end = size;
-  while (end > least && (static_cast<uint8_t>(text[end]) & 0xC0U) == 0x80U) --end;
-  text.resize(end);
-}
-
 // Text of a field, for %s, which takes it up to its first zero byte.
 std::string fieldText(std::span<const uint8_t> field) {
   return {field.begin(), field.end()};
@@ -120,7 +111,7 @@ std::string dashboardText(const Dictionary& payload) {
     text += '=';
     text += sanitize(descriptionForObject(value));
     if (text.size() <= kDashboardMaxText) continue;
-    cutToWholeCharacters(text, kDashboardMaxText);
+    text.resize(wholeCharacters(text, kDashboardMaxText).size());
     break;
   }
   return text;

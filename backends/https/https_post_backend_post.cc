@@ -15,10 +15,7 @@ constexpr size_t kMaxHeaderValue = 1024;
 // Text of a client or the device as a header may carry it, cut to whole characters that fit.
 std::string headerText(std::string_view text) {
   std::string safe = headerSafe(text);
-  if (safe.size() <= kMaxHeaderValue) return safe;
-  size_t end = kMaxHeaderValue;
-  while (end > 0 && (static_cast<uint8_t>(safe[end]) & 0xC0U) == 0x80U) --end;
-  safe.resize(end);
+  safe.resize(wholeCharacters(safe, kMaxHeaderValue).size());
   return safe;
 }
 

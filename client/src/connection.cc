@@ -44,7 +44,7 @@ bool isDisconnect(int error) {
 
 Dialled dial(const std::string& path) {
   Dialled dialled;
-  dialled.socket = Descriptor(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  dialled.socket = UniqueFd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
   if (!dialled.socket) {
     dialled.outcome =
         failure(TARNEL_ERROR_SYSTEM, std::string("no socket could be opened: ") + strerrordesc_np(errno));
@@ -84,7 +84,7 @@ Connection::Connection(Host& host, std::chrono::milliseconds replyTimeout)
 
 Connection::~Connection() = default;
 
-Outcome Connection::start(Descriptor socket) {
+Outcome Connection::start(UniqueFd socket) {
   static const sd_bus_vtable kVtable[] = {
       SD_BUS_VTABLE_START(0),
       SD_BUS_METHOD(

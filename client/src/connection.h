@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "client/src/descriptor.h"
+#include "base/unique_fd.h"
 #include "client/src/request.h"
 #include "client/src/request_codec.h"
 
@@ -19,7 +19,7 @@ namespace tarnel::core {
 
 // A socket on its way to the daemon.
 struct Dialled {
-  Descriptor socket;
+  UniqueFd socket;
   bool isBusy = false;     // the daemon's backlog is full: try again
   bool isRefused = false;  // and not just absent
   Outcome outcome;
@@ -49,7 +49,7 @@ class Connection {
   Connection(const Connection&) = delete;
   Connection& operator=(const Connection&) = delete;
 
-  Outcome start(Descriptor socket);
+  Outcome start(UniqueFd socket);
 
   // Handles what has come and what is due. Not ok when the connection is lost.
   Outcome process();

@@ -15,7 +15,7 @@ Outcome closedOutcome() {
 
 }  // namespace
 
-Mailbox::Mailbox(Descriptor wake, const Options& options)
+Mailbox::Mailbox(UniqueFd wake, const Options& options)
     : wake_(std::move(wake)), maxCalls_(options.maxQueuedCalls), maxBytes_(options.maxQueuedBytes) {}
 
 Outcome Mailbox::put(Request request) {

@@ -7,7 +7,7 @@
 #include <mutex>
 #include <vector>
 
-#include "client/src/descriptor.h"
+#include "base/unique_fd.h"
 #include "client/src/options.h"
 #include "client/src/request.h"
 #include "tarnel/tarnel_c_session.h"
@@ -38,7 +38,7 @@ class Mailbox {
   };
 
   // wake: an eventfd, which the I/O thread polls.
-  Mailbox(Descriptor wake, const Options& options);
+  Mailbox(UniqueFd wake, const Options& options);
 
   // Appends a measured request; when it fails the request and its completion are dropped.
   Outcome put(Request request);
@@ -67,7 +67,7 @@ class Mailbox {
  private:
   void wake() const;
 
-  const Descriptor wake_;
+  const UniqueFd wake_;
   const size_t maxCalls_;
   const size_t maxBytes_;
   std::atomic<bool> isMuted_{false};

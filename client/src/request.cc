@@ -4,6 +4,7 @@
 #include <string>
 #include <string_view>
 
+#include "base/utf8.h"
 #include "ipc/dbus/wire_size.h"
 #include "ipc/protocol/wire.h"
 
@@ -144,9 +145,8 @@ class Meter {
   }
   static std::string printable(const std::string& key) {
     if (!isValidUtf8(key)) return "?";
-    std::string start = key.substr(0, 64);
+    std::string start(wholeCharacters(key, 64));
     std::replace(start.begin(), start.end(), '\0', '?');
-    while (!isValidUtf8(start)) start.pop_back();
     return start;
   }
 

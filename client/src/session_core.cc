@@ -36,7 +36,7 @@ class SignalsBlocked {
 Outcome SessionCore::create(const Options& options, Handlers handlers,
                             std::shared_ptr<SessionCore>& session) {
   if (auto outcome = check(options); !outcome.ok()) return outcome;
-  Descriptor wake(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+  UniqueFd wake(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
   if (!wake) {
     return failure(TARNEL_ERROR_SYSTEM,
                    std::string("no descriptor for a session: ") + strerrordesc_np(errno));
@@ -53,7 +53,7 @@ Outcome SessionCore::create(const Options& options, Handlers handlers,
   return {};
 }
 
-SessionCore::SessionCore(Token, const Options& options, Handlers handlers, Descriptor wake)
+SessionCore::SessionCore(Token, const Options& options, Handlers handlers, UniqueFd wake)
     : options_(options),
       handlers_(std::move(handlers)),
       generation_(forkGeneration()),

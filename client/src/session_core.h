@@ -26,7 +26,7 @@ class SessionCore : public std::enable_shared_from_this<SessionCore> {
     friend class SessionCore;
     Token() = default;
   };
-  SessionCore(Token, const Options& options, Handlers handlers, Descriptor wake);
+  SessionCore(Token, const Options& options, Handlers handlers, UniqueFd wake);
   SessionCore(const SessionCore&) = delete;
   SessionCore& operator=(const SessionCore&) = delete;
   ~SessionCore();

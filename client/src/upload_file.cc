@@ -11,25 +11,17 @@
 #include <system_error>
 #include <utility>
 
+#include "base/percent_encoding.h"
 #include "client/src/lifetime.h"
 
 namespace tarnel::core {
 namespace {
 
 std::string fileURLOf(std::string_view path) {
-  constexpr char kDigits[] = "0123456789ABCDEF";
-  std::string url = "file://";
-  for (const char c : path) {
-    const auto byte = static_cast<unsigned char>(c);
-    const bool isPlain = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
-                         std::string_view("-._~/").find(c) != std::string_view::npos;
-    if (isPlain) {
-      url += c;
-    } else {
-      url += {'%', kDigits[byte >> 4U], kDigits[byte & 0xFU]};
-    }
-  }
-  return url;
+  return "file://" + percentEncoded(path, [](char c) {
+           return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
+                  std::string_view("-._~/").find(c) != std::string_view::npos;
+         });
 }
 
 // The path as a sentence can carry it.

@@ -85,7 +85,7 @@ TEST(Measure, CountsWhatTheWireTakes) {
 
 class MailboxTest : public ::testing::Test {
  protected:
-  Mailbox mailbox_{Descriptor(eventfd(0, EFD_NONBLOCK)), Options()};
+  Mailbox mailbox_{UniqueFd(eventfd(0, EFD_NONBLOCK)), Options()};
 
   void put(Request::Kind kind, size_t bytes = 100) {
     Request request;

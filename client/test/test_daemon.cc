@@ -115,8 +115,8 @@ void writeAnswer(sd_bus_message* reply, std::string_view member, const std::vect
   }
 }
 
-core::Descriptor listenAt(const std::string& path) {
-  core::Descriptor listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+UniqueFd listenAt(const std::string& path) {
+  UniqueFd listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   path.copy(address.sun_path, sizeof address.sun_path - 1);
@@ -183,7 +183,7 @@ void TestDaemon::dropConnections() {
 void TestDaemon::die() {
   post([this] {
     peers_.clear();
-    listener_ = core::Descriptor();
+    listener_ = UniqueFd();
     ::unlink(path_.c_str());
   });
 }
@@ -275,7 +275,7 @@ int TestDaemon::handle(sd_bus_message* call) {
 }
 
 void TestDaemon::accept() {
-  core::Descriptor socket(::accept4(listener_.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
+  UniqueFd socket(::accept4(listener_.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
   if (!socket || closesAtOnce) return;
   sd_id128_t id{};
   sd_id128_randomize(&id);

@@ -11,8 +11,8 @@
 #include <thread>
 #include <vector>
 
+#include "base/unique_fd.h"
 #include "base/value.h"
-#include "client/src/descriptor.h"
 
 struct sd_bus;
 struct sd_bus_message;
@@ -104,8 +104,8 @@ class TestDaemon {
   void post(std::function<void()> task);
 
   const std::string path_;
-  core::Descriptor listener_;
-  core::Descriptor wake_;
+  UniqueFd listener_;
+  UniqueFd wake_;
   std::list<Peer> peers_;  // of the daemon's thread
 
   std::mutex mutex_;

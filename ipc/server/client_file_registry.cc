@@ -12,6 +12,7 @@
 #include <system_error>
 #include <utility>
 
+#include "base/hex.h"
 #include "ipc/protocol/wire.h"
 #include "ipc/server/connection_loop.h"
 
@@ -22,17 +23,11 @@ namespace {
 constexpr size_t kReadBytes = size_t{1} << 20U;
 
 std::string newToken() {
-  constexpr char kDigits[] = "0123456789abcdef";
   std::array<unsigned char, 16> bytes{};
   if (getrandom(bytes.data(), bytes.size(), 0) != static_cast<ssize_t>(bytes.size())) {
     throw std::system_error(errno, std::generic_category(), "getrandom");
   }
-  std::string token;
-  for (const unsigned char byte : bytes) {
-    token += kDigits[byte >> 4U];
-    token += kDigits[byte & 0xFU];
-  }
-  return token;
+  return hexText(bytes);
 }
 
 // Read where it stands, whatever the client does with the descriptor's own position meanwhile.

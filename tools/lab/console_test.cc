@@ -7,6 +7,7 @@
 #include <array>
 #include <memory>
 
+#include "base/unique_fd.h"
 #include "formats/document.h"
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/summary.h"
@@ -167,7 +168,7 @@ TEST_F(ConsoleTest, JsonIsOneObjectALine) {
 TEST_F(ConsoleTest, LinesThatTheOutputDoesNotTakeAreCounted) {
   std::array<int, 2> ends{};
   ASSERT_EQ(::pipe2(ends.data(), O_CLOEXEC), 0);
-  const FileDescriptor reader(ends[0]);
+  const UniqueFd reader(ends[0]);
   const Stream pipe(::fdopen(ends[1], "w"), std::fclose);
   size_t left = 0;
   const auto readSome = [&reader, &left](size_t most) {

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 
+#include "base/unique_fd.h"
 #include "formats/document.h"
 #include "tools/lab/control.h"
 #include "tools/lab/http/http_server.h"
@@ -75,7 +76,7 @@ class RunningLab final : public Lab {
   const LabDirectory directory_;
   Console& console_;
   Clock& clock_;
-  const FileDescriptor stopRequested_;
+  const UniqueFd stopRequested_;
   ArrivalStore store_;
   NdjsonWriter writer_;
   Misbehaviours misbehaviours_;

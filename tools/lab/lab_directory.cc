@@ -7,6 +7,8 @@
 #include <cerrno>
 #include <filesystem>
 
+#include "base/unique_fd.h"
+
 namespace tarnel::lab {
 namespace {
 
@@ -26,9 +28,9 @@ Error withRemedy(const Error& error) {
                error.localizedDescription() + "; choose a folder that you may write with --directory");
 }
 
-Result<FileDescriptor> lockDirectory(const std::string& directory) {
+Result<UniqueFd> lockDirectory(const std::string& directory) {
   const std::string path = directory + "/lock";
-  FileDescriptor fd(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+  UniqueFd fd(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
   if (!fd) return withRemedy(fileError("write", path, errno));
   if (::flock(fd.get(), LOCK_EX | LOCK_NB) != 0) {
     return Error(
@@ -76,7 +78,7 @@ Result<LabDirectory> openLabDirectory(const std::string& directory, const std::v
   const LabPaths paths(directory);
   std::vector<std::string> made;
   if (const MaybeError error = makeFolders(paths)) return withRemedy(*error);
-  Result<FileDescriptor> lock = lockDirectory(paths.directory);
+  Result<UniqueFd> lock = lockDirectory(paths.directory);
   if (!lock) return lock.error();
   const Result<CertificateWork> work = ensureCertificates(paths.certificates, names, now);
   if (!work) return work.error();

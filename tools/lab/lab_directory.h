@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "base/error.h"
+#include "base/unique_fd.h"
 #include "tools/lab/http/certificate_authority.h"
 #include "tools/storebag/file_io.h"
 #include "tools/storebag/storebag_key.h"
@@ -29,7 +30,7 @@ struct LabPaths {
 struct LabDirectory {
   LabPaths paths;
   StorebagKey key;
-  FileDescriptor lock;
+  UniqueFd lock;
   std::vector<std::string> made;  // sentences about what was made
 };
 

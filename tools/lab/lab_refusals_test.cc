@@ -5,6 +5,7 @@
 #include <future>
 #include <thread>
 
+#include "base/unique_fd.h"
 #include "tools/lab/http/certificate_authority.h"
 #include "tools/lab/lab_test_fixture.h"
 #include "tools/receiving/test_post.h"
@@ -57,7 +58,7 @@ TEST_F(LabRefusalsTest, AsksForTheStopThroughTheControlAddress) {
   pollfd entry{.fd = lab_->stopRequestedFd(), .events = POLLIN, .revents = 0};
   EXPECT_EQ(::poll(&entry, 1, 0), 0);
   // As "curl -X POST" sends it: without a body and without its length.
-  const FileDescriptor socket = connectTo(at("controlURL"));
+  const UniqueFd socket = connectTo(at("controlURL"));
   const std::string request = "POST /stop HTTP/1.1\r\nHost: 127.0.0.1\r\nConnection: close\r\n\r\n";
   ASSERT_EQ(::send(socket.get(), request.data(), request.size(), 0), static_cast<ssize_t>(request.size()));
   EXPECT_THAT(readAll(socket), HasSubstr("\"stopping\": true"));
@@ -76,7 +77,7 @@ TEST_F(LabRefusalsTest, OtherMethodsAreRefusedAndTheConnectionEnds) {
 
 TEST_F(LabRefusalsTest, AHeadWithoutEndIsCutOff) {
   start();
-  const FileDescriptor socket = connectTo(at("controlURL"));
+  const UniqueFd socket = connectTo(at("controlURL"));
   const std::string begin = "GET /status HTTP/1.1\r\nHost: 127.0.0.1\r\n";
   ::send(socket.get(), begin.data(), begin.size(), MSG_NOSIGNAL);
   const std::string line = "X-More: " + std::string(1000, 'x') + "\r\n";
@@ -88,7 +89,7 @@ TEST_F(LabRefusalsTest, AHeadWithoutEndIsCutOff) {
 
 TEST_F(LabRefusalsTest, ClientsThatCannotTalkToItAreNamedWithTheRemedy) {
   start();
-  const FileDescriptor socket = connectTo(at("url"));
+  const UniqueFd socket = connectTo(at("url"));
   const std::string request = "GET / HTTP/1.1\r\n\r\n";
   ::send(socket.get(), request.data(), request.size(), MSG_NOSIGNAL);
   readAll(socket);

@@ -13,6 +13,7 @@
 #include <string>
 #include <vector>
 
+#include "base/unique_fd.h"
 #include "formats/cryptography.h"
 #include "formats/document.h"
 #include "platform/fake/fake_clock.h"
@@ -144,18 +145,18 @@ class LabTest : public ::testing::Test {
     const size_t begin = at + name.size() + 2;
     return reply.head.substr(begin, reply.head.find("\r\n", begin) - begin);
   }
-  FileDescriptor connectTo(const std::string& url) const {
+  UniqueFd connectTo(const std::string& url) const {
     const auto port = static_cast<uint16_t>(std::stoi(url.substr(url.rfind(':') + 1)));
     sockaddr_in address{};
     address.sin_family = AF_INET;
     address.sin_port = htons(port);
     address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    FileDescriptor socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    UniqueFd socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
     EXPECT_EQ(::connect(socket.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
     return socket;
   }
   // All that comes until the end; a reset ends it, too.
-  static std::string readAll(const FileDescriptor& socket) {
+  static std::string readAll(const UniqueFd& socket) {
     std::string text;
     char buffer[4096];
     for (;;) {

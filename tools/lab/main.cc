@@ -7,6 +7,7 @@
 #include <cstdio>
 #include <cstdlib>
 
+#include "base/unique_fd.h"
 #include "tools/lab/lab.h"
 #include "tools/storebag/file_io.h"
 
@@ -25,14 +26,14 @@ class WallClock final : public Clock {
 };
 
 // Blocked before any thread begins, so that all of them leave these signals to the descriptor.
-FileDescriptor endSignals() {
+UniqueFd endSignals() {
   sigset_t set;
   sigemptyset(&set);
   sigaddset(&set, SIGINT);
   sigaddset(&set, SIGTERM);
   pthread_sigmask(SIG_BLOCK, &set, nullptr);
   std::signal(SIGPIPE, SIG_IGN);
-  return FileDescriptor(::signalfd(-1, &set, SFD_CLOEXEC));
+  return UniqueFd(::signalfd(-1, &set, SFD_CLOEXEC));
 }
 
 void waitForEnd(int signalFd, int stopFd) {
@@ -54,7 +55,7 @@ bool wantsColour() {
 int main(int argc, char** argv) {
   const ParsedOptions parsed = parseOptions(argc, argv);
   if (parsed.exitCode) return *parsed.exitCode;
-  const FileDescriptor signals = endSignals();
+  const UniqueFd signals = endSignals();
   WallClock clock;
   const ConsoleStyle style = parsed.options.json
                                  ? ConsoleStyle::json

@@ -7,6 +7,7 @@
 #include <array>
 #include <memory>
 
+#include "base/unique_fd.h"
 #include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {
@@ -21,7 +22,7 @@ class StoppedReader {
     std::array<int, 2> ends{};
     EXPECT_EQ(::pipe2(ends.data(), O_CLOEXEC), 0);
     stream_.reset(::fdopen(ends[1], "w"));
-    end_ = FileDescriptor(ends[0]);
+    end_ = UniqueFd(ends[0]);
     room_ = static_cast<size_t>(::fcntl(ends[0], F_GETPIPE_SZ));
   }
   std::FILE* stream() const { return stream_.get(); }
@@ -39,7 +40,7 @@ class StoppedReader {
 
  private:
   Stream stream_{nullptr, std::fclose};
-  FileDescriptor end_;
+  UniqueFd end_;
   size_t room_ = 0;
 };
 

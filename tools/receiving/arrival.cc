@@ -2,6 +2,8 @@
 
 #include <map>
 
+#include "base/hex.h"
+
 namespace tarnel::lab {
 namespace {
 
@@ -23,17 +25,6 @@ void addSender(const HttpArrival& arrival, Dictionary& record) {
 
 void setIfPresent(Dictionary& record, const char* key, const MaybeString& value) {
   if (value) record.set(key, *value);
-}
-
-std::string hexadecimal(const std::vector<uint8_t>& bytes) {
-  constexpr std::string_view kDigits = "0123456789abcdef";
-  std::string text;
-  text.reserve(bytes.size() * 2);
-  for (const uint8_t byte : bytes) {
-    text += kDigits[byte >> 4U];
-    text += kDigits[byte & 15U];
-  }
-  return text;
 }
 
 void addContent(const DashboardDatagram& content, Dictionary& record) {
@@ -153,7 +144,7 @@ Dictionary recordOfDatagram(const DatagramArrival& arrival) {
   if (arrival.content) {
     addContent(*arrival.content, record);
   } else {
-    record.set("bytes", hexadecimal(arrival.bytes));
+    record.set("bytes", hexText(arrival.bytes));
   }
   record.set("problems", listOf(arrival.problems));
   return record;

@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <cstdio>
 
+#include "base/unique_fd.h"
 #include "formats/document.h"
 
 namespace tarnel::lab {
@@ -28,7 +29,7 @@ MaybeError NdjsonWriter::open() {
 }
 
 MaybeError NdjsonWriter::openFile(File& file) {
-  file.fd = FileDescriptor(::open(file.path.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600));
+  file.fd = UniqueFd(::open(file.path.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600));
   struct stat status {};
   if (!file.fd || ::fstat(file.fd.get(), &status) != 0) return fileError("write", file.path, errno);
   file.size = static_cast<uint64_t>(status.st_size);

@@ -2,6 +2,7 @@
 
 #include <string>
 
+#include "base/unique_fd.h"
 #include "tools/receiving/arrival.h"
 #include "tools/receiving/notices.h"
 #include "tools/storebag/file_io.h"
@@ -29,7 +30,7 @@ class NdjsonWriter final : public ArrivalObserver {
  private:
   struct File {
     std::string path;
-    FileDescriptor fd;
+    UniqueFd fd;
     uint64_t size = 0;
   };
 

@@ -13,6 +13,7 @@
 #include <filesystem>
 #include <vector>
 
+#include "base/unique_fd.h"
 #include "tools/receiving/text.h"
 
 namespace tarnel::lab {
@@ -75,7 +76,7 @@ bool isStoredName(std::string_view name) {
   return digits >= 4 && digits + 1 < rest.size() && rest[digits] == '-';
 }
 
-IncomingFile::IncomingFile(std::string folder, std::string name, FileDescriptor fd)
+IncomingFile::IncomingFile(std::string folder, std::string name, UniqueFd fd)
     : folder_(std::move(folder)), name_(std::move(name)), fd_(std::move(fd)) {}
 
 IncomingFile::IncomingFile(IncomingFile&& other) noexcept = default;
@@ -133,7 +134,7 @@ MaybeError StoredFiles::open() {
 
 Result<IncomingFile> StoredFiles::createNamed(const std::string& name) const {
   IncomingFile file(folder_, name, {});
-  file.fd_ = FileDescriptor(
+  file.fd_ = UniqueFd(
       ::open(file.incomingPath().c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   if (!file.fd_) return fileError("write", file.path(), errno);
   return file;

@@ -6,6 +6,7 @@
 #include <string_view>
 
 #include "base/error.h"
+#include "base/unique_fd.h"
 #include "tools/receiving/notices.h"
 #include "tools/storebag/file_io.h"
 
@@ -14,7 +15,7 @@ namespace tarnel::lab {
 // A file on its way into the folder; gone with the object unless it was kept.
 class IncomingFile {
  public:
-  IncomingFile(std::string folder, std::string name, FileDescriptor fd);
+  IncomingFile(std::string folder, std::string name, UniqueFd fd);
   IncomingFile(IncomingFile&& other) noexcept;
   IncomingFile& operator=(IncomingFile&&) = delete;
   IncomingFile(const IncomingFile&) = delete;
@@ -34,7 +35,7 @@ class IncomingFile {
 
   std::string folder_;
   std::string name_;
-  FileDescriptor fd_;
+  UniqueFd fd_;
   uint64_t size_ = 0;
 };
 

@@ -7,6 +7,7 @@
 #include <cstdio>
 #include <ctime>
 
+#include "base/utf8.h"
 #include "base/value.h"
 
 namespace tarnel::lab {
@@ -21,14 +22,6 @@ std::string formatted(const char* format, Args... args) {
   std::array<char, 96> buffer{};
   const int size = std::snprintf(buffer.data(), buffer.size(), format, args...);
   return std::string(buffer.data(), std::min(static_cast<size_t>(std::max(size, 0)), buffer.size() - 1));
-}
-
-// Bytes of the well-formed character at the front, 0 when there is none.
-size_t characterSize(std::string_view text) {
-  for (size_t size = 1; size <= std::min<size_t>(4, text.size()); ++size) {
-    if (isValidUtf8(text.substr(0, size))) return size;
-  }
-  return 0;
 }
 
 bool isControl(std::string_view character) {
@@ -48,7 +41,7 @@ bool isControl(std::string_view character) {
 std::string printable(std::string_view text, size_t maxBytes) {
   std::string shown;
   while (!text.empty()) {
-    const size_t size = characterSize(text);
+    const size_t size = utf8CharacterLength(text);
     const std::string_view character = text.substr(0, std::max<size_t>(size, 1));
     if (shown.size() + character.size() > maxBytes) return shown + "...";
     shown += size == 0 || isControl(character) ? "?" : character;

@@ -7,6 +7,8 @@
 #include <cerrno>
 #include <system_error>
 
+#include "base/unique_fd.h"
+
 namespace tarnel {
 namespace {
 
@@ -25,16 +27,11 @@ MaybeError writeAll(int fd, std::string_view bytes, const std::string& path) {
 void syncDirectoryOf(const std::string& path) {
   const size_t slash = path.rfind('/');
   const std::string directory = slash == std::string::npos ? "." : path.substr(0, slash + 1);
-  const FileDescriptor fd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const UniqueFd fd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (fd) ::fsync(fd.get());
 }
 
 }  // namespace
-
-void FileDescriptor::reset() noexcept {
-  if (fd_ >= 0) ::close(fd_);
-  fd_ = -1;
-}
 
 Error fileError(std::string_view action, const std::string& path, int errorNumber) {
   return Error(
@@ -44,7 +41,7 @@ Error fileError(std::string_view action, const std::string& path, int errorNumbe
 
 Result<std::string> readFile(const std::string& path, size_t maxBytes) {
   // A named pipe must not hold us up: opened without waiting, and refused below.
-  const FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+  const UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
   if (!fd) return fileError("read", path, errno);
   struct stat status {};
   if (::fstat(fd.get(), &status) != 0) return fileError("read", path, errno);
@@ -73,7 +70,7 @@ Result<std::string> readFile(const std::string& path, size_t maxBytes) {
 
 MaybeError writeFile(const std::string& path, std::string_view bytes, mode_t mode) {
   std::string temporary = path + ".XXXXXX";
-  const FileDescriptor fd(::mkostemp(temporary.data(), O_CLOEXEC));
+  const UniqueFd fd(::mkostemp(temporary.data(), O_CLOEXEC));
   if (!fd) return fileError("write", path, errno);
   MaybeError error = writeAll(fd.get(), bytes, path);
   if (!error && (::fchmod(fd.get(), mode) != 0 || ::fsync(fd.get()) != 0)) {

@@ -16,31 +16,6 @@ namespace tarnel {
 
 inline constexpr char kToolErrorDomain[] = "TarnelToolErrorDomain";
 
-// An open file, closed with the object. Movable.
-class FileDescriptor {
- public:
-  FileDescriptor() noexcept = default;
-  explicit FileDescriptor(int fd) noexcept : fd_(fd) {}
-  FileDescriptor(FileDescriptor&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
-  FileDescriptor& operator=(FileDescriptor&& other) noexcept {
-    if (this != &other) {
-      reset();
-      fd_ = std::exchange(other.fd_, -1);
-    }
-    return *this;
-  }
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  ~FileDescriptor() { reset(); }
-
-  int get() const noexcept { return fd_; }
-  explicit operator bool() const noexcept { return fd_ >= 0; }
-  void reset() noexcept;
-
- private:
-  int fd_ = -1;
-};
-
 // The contents of a regular file of at most maxBytes bytes; anything else is an error.
 Result<std::string> readFile(const std::string& path, size_t maxBytes);
 // Replaces the file in one step: a reader sees the old contents or the new, also after a crash.

@@ -7,6 +7,7 @@
 #include <span>
 #include <string_view>
 
+#include "base/hex.h"
 #include "base/rfc3339.h"
 
 namespace tarnel::ctl {
@@ -75,11 +76,7 @@ void appendKey(std::string& out, const std::string& key) {
 void appendData(std::string& out, const Data& data) {
   out += '<' + std::to_string(data.size()) + (data.size() == 1 ? " byte" : " bytes");
   if (!data.empty()) out += ": ";
-  for (const uint8_t byte : std::span(data).first(std::min(data.size(), kShownBytes))) {
-    std::array<char, 4> digits{};
-    std::snprintf(digits.data(), digits.size(), "%02x", byte);
-    out += digits.data();
-  }
+  out += hexText(std::span(data).first(std::min(data.size(), kShownBytes)));
   out += data.size() > kShownBytes ? "...>" : ">";
 }
 

@@ -1,6 +1,9 @@
 #include "tools/tarnelctl/visible_output.h"
 
-#include <string_view>
+#include <iterator>
+#include <string>
+
+#include "base/hex.h"
 
 namespace tarnel::ctl {
 namespace {
@@ -38,9 +41,9 @@ bool VisibleOutput::put(unsigned char byte) {
 }
 
 bool VisibleOutput::putEscape(unsigned char byte) {
-  constexpr std::string_view kDigits = "0123456789abcdef";
-  return put('\\') && put('x') && put(static_cast<unsigned char>(kDigits[byte >> 4U])) &&
-         put(static_cast<unsigned char>(kDigits[byte & 15U]));
+  std::string escape = "\\x";
+  appendHex(escape, byte);
+  return target_.sputn(escape.data(), std::ssize(escape)) == std::ssize(escape);
 }
 
 bool VisibleOutput::putHeld() {

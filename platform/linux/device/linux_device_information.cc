@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "base/file_access.h"
+#include "base/hex.h"
 #include "platform/linux/configuration/toml_file.h"
 
 namespace tarnel {
@@ -105,13 +106,7 @@ std::optional<std::string> uniqueDeviceID(std::string_view machineID) {
       size != 20) {
     return std::nullopt;
   }
-  constexpr std::string_view kDigits = "0123456789abcdef";
-  std::string text;
-  for (unsigned index = 0; index < size; ++index) {
-    text += kDigits[digest[index] >> 4U];
-    text += kDigits[digest[index] & 15U];
-  }
-  return text;
+  return hexText(std::span(digest).first(size));
 }
 
 LinuxDeviceInformation::LinuxDeviceInformation(const std::string& configurationDirectory,

@@ -13,6 +13,8 @@
 #include <cerrno>
 #include <cstring>
 
+#include "base/unique_fd.h"
+
 namespace tarnel::lab {
 namespace {
 
@@ -57,7 +59,7 @@ void Connection::SslFree::operator()(ssl_st* ssl) const {
   SSL_free(ssl);
 }
 
-Connection::Connection(FileDescriptor socket, int stopFd) : socket_(std::move(socket)), stopFd_(stopFd) {
+Connection::Connection(UniqueFd socket, int stopFd) : socket_(std::move(socket)), stopFd_(stopFd) {
   const int flags = ::fcntl(socket_.get(), F_GETFL);
   ::fcntl(socket_.get(), F_SETFL, flags | O_NONBLOCK);
   const int on = 1;

@@ -8,6 +8,7 @@
 #include <optional>
 #include <string>
 
+#include "base/unique_fd.h"
 #include "tools/storebag/file_io.h"
 
 struct ssl_st;
@@ -22,7 +23,7 @@ class Connection {
   using Milliseconds = std::chrono::milliseconds;
 
   // The socket is made non-blocking. stopFd becomes readable when the server stops.
-  Connection(FileDescriptor socket, int stopFd);
+  Connection(UniqueFd socket, int stopFd);
   ~Connection();
   Connection(const Connection&) = delete;
   Connection& operator=(const Connection&) = delete;
@@ -67,7 +68,7 @@ class Connection {
     void operator()(ssl_st* ssl) const;
   };
 
-  FileDescriptor socket_;
+  UniqueFd socket_;
   const int stopFd_;
   std::unique_ptr<ssl_st, SslFree> ssl_;
   bool broken_ = false;

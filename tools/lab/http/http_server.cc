@@ -11,6 +11,7 @@
 #include <atomic>
 #include <csignal>
 
+#include "base/unique_fd.h"
 #include "tools/lab/http/connection.h"
 #include "tools/lab/http/worker_pool.h"
 #include "tools/receiving/text.h"
@@ -261,7 +262,7 @@ class ServerOfConnections final : public HttpServer {
                            {.fd = stopEvent_.get(), .events = POLLIN, .revents = 0}};
       if (::poll(entries, 2, -1) < 0 && errno != EINTR) return;
       if (entries[1].revents != 0) return;
-      auto socket = std::make_shared<FileDescriptor>(
+      auto socket = std::make_shared<UniqueFd>(
           ::accept4(listening_.socket.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
       if (!*socket) {
         if (errno == EMFILE || errno == ENFILE || errno == ENOMEM) waitForStop(milliseconds(100));
@@ -276,7 +277,7 @@ class ServerOfConnections final : public HttpServer {
     ::poll(&entry, 1, static_cast<int>(time.count()));
   }
 
-  void serve(FileDescriptor socket) {
+  void serve(UniqueFd socket) {
     Connection connection(std::move(socket), stopEvent_.get());
     if (options_.tls) {
       if (const auto problem = connection.acceptTls(options_.tls.get(), kHandshakeLimit)) {
@@ -301,7 +302,7 @@ class ServerOfConnections final : public HttpServer {
   const HttpServerOptions options_;
   HttpHandler& handler_;
   const ListeningSocket listening_;
-  const FileDescriptor stopEvent_;
+  const UniqueFd stopEvent_;
   Protocol protocol_;
   WorkerPool workers_;
   std::thread acceptor_;

@@ -10,6 +10,8 @@
 #include <memory>
 #include <system_error>
 
+#include "base/unique_fd.h"
+
 namespace tarnel::lab {
 namespace {
 
@@ -40,7 +42,7 @@ Result<ListeningSocket> bindTo(const std::string& address, uint16_t port, const 
   }
   const std::unique_ptr<addrinfo, decltype(&::freeaddrinfo)> guard(found, ::freeaddrinfo);
   ListeningSocket listening;
-  listening.socket = FileDescriptor(::socket(found->ai_family, type | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  listening.socket = UniqueFd(::socket(found->ai_family, type | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
   const int on = 1;
   const bool stream = type == SOCK_STREAM;
   if (!listening.socket ||

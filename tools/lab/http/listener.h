@@ -4,13 +4,14 @@
 #include <string>
 
 #include "base/error.h"
+#include "base/unique_fd.h"
 #include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {
 
 // Bound, and ready for what comes.
 struct ListeningSocket {
-  FileDescriptor socket;
+  UniqueFd socket;
   uint16_t port = 0;
 };
 

@@ -12,6 +12,8 @@
 #include <system_error>
 #include <thread>
 
+#include "base/unique_fd.h"
+
 namespace tarnel::lab {
 namespace {
 
@@ -92,7 +94,7 @@ class ServerOfDatagrams final : public DatagramServer {
   const ListeningSocket socket_;
   DatagramReceiver& receiver_;
   Notices& notices_;
-  const FileDescriptor stopEvent_;
+  const UniqueFd stopEvent_;
   std::array<uint8_t, kMaxDatagramBytes + 1> buffer_{};
   bool failing_ = false;  // to send
   int failures_ = 0;      // to read, in a row

@@ -8,6 +8,7 @@
 
 #include <future>
 
+#include "base/unique_fd.h"
 #include "platform/fake/fake_clock.h"
 #include "tools/lab/options.h"
 #include "tools/receiving/test_datagram.h"
@@ -43,7 +44,7 @@ class Sender {
   }
 
  private:
-  FileDescriptor socket_;
+  UniqueFd socket_;
 };
 
 // As a disk that does not answer.
@@ -131,7 +132,7 @@ TEST_F(DatagramServerTest, EndsWhenToldAndStaysEnded) {
 
 TEST_F(DatagramServerTest, ASocketThatFailsForGoodIsGivenUpWithAWarning) {
   // Not connected: it always has something to tell, and never anything to read.
-  FileDescriptor unusable(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  UniqueFd unusable(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
   FirstWarning warning;
   const auto server = DatagramServer::start({.socket = std::move(unusable)}, receiver_, warning);
   auto text = warning.text.get_future();
