@@ -10,9 +10,9 @@
 #include "base/unique_fd.h"
 #include "formats/document.h"
 #include "platform/fake/fake_clock.h"
+#include "tools/files/file_io.h"
 #include "tools/lab/summary.h"
 #include "tools/receiving/test_post.h"
-#include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {
 namespace {

@@ -4,8 +4,8 @@
 #include <unistd.h>
 
 #include "formats/document.h"
+#include "tools/files/file_io.h"
 #include "tools/receiving/test_post.h"
-#include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {
 namespace {

@@ -6,8 +6,8 @@
 
 #include "base/error.h"
 #include "base/unique_fd.h"
+#include "tools/files/file_io.h"
 #include "tools/lab/http/certificate_authority.h"
-#include "tools/storebag/file_io.h"
 #include "tools/storebag/storebag_key.h"
 
 namespace tarnel::lab {

@@ -17,9 +17,9 @@
 #include "formats/cryptography.h"
 #include "formats/document.h"
 #include "platform/fake/fake_clock.h"
+#include "tools/files/file_io.h"
 #include "tools/lab/lab.h"
 #include "tools/receiving/http_message.h"
-#include "tools/storebag/file_io.h"
 #include "tools/storebag/storebag_key.h"
 #include "tools/storebag/storebag_template.h"
 

@@ -8,8 +8,8 @@
 #include <cstdlib>
 
 #include "base/unique_fd.h"
+#include "tools/files/file_io.h"
 #include "tools/lab/lab.h"
-#include "tools/storebag/file_io.h"
 
 namespace {
 

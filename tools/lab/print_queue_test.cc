@@ -8,7 +8,7 @@
 #include <memory>
 
 #include "base/unique_fd.h"
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 
 namespace tarnel::lab {
 namespace {

@@ -5,8 +5,8 @@
 #include <filesystem>
 
 #include "formats/document.h"
+#include "tools/files/file_io.h"
 #include "tools/receiving/text.h"
-#include "tools/storebag/file_io.h"
 #include "tools/storebag/signed_storebag.h"
 
 namespace tarnel::lab {

@@ -5,7 +5,7 @@
 #include <algorithm>
 #include <array>
 
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 
 namespace tarnel::lab {
 namespace {

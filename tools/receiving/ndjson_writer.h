@@ -3,9 +3,9 @@
 #include <string>
 
 #include "base/unique_fd.h"
+#include "tools/files/file_io.h"
 #include "tools/receiving/arrival.h"
 #include "tools/receiving/notices.h"
-#include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {
 

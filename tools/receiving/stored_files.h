@@ -7,8 +7,8 @@
 
 #include "base/error.h"
 #include "base/unique_fd.h"
+#include "tools/files/file_io.h"
 #include "tools/receiving/notices.h"
-#include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {
 

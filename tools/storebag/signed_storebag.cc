@@ -1,7 +1,7 @@
 #include "tools/storebag/signed_storebag.h"
 
 #include "formats/document.h"
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 
 namespace tarnel {
 namespace {

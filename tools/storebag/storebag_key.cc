@@ -10,7 +10,7 @@
 #include <climits>
 
 #include "formats/cryptography.h"
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 
 namespace tarnel {
 namespace {

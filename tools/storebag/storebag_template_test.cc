@@ -3,7 +3,7 @@
 #include <gmock/gmock.h>
 
 #include "formats/document.h"
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 #include "tools/storebag/storebag_validation.h"
 
 namespace tarnel {

@@ -5,7 +5,7 @@
 #include <cmath>
 
 #include "formats/document.h"
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 #include "tools/storebag/storebag_template.h"
 
 namespace tarnel {

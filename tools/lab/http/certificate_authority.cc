@@ -10,7 +10,7 @@
 
 #include <memory>
 
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 
 namespace tarnel::lab {
 namespace {

@@ -9,7 +9,7 @@
 #include <fstream>
 #include <memory>
 
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 
 namespace tarnel::lab {
 namespace {

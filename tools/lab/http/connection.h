@@ -9,7 +9,7 @@
 #include <string>
 
 #include "base/unique_fd.h"
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 
 struct ssl_st;
 struct ssl_ctx_st;

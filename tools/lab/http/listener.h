@@ -5,7 +5,7 @@
 
 #include "base/error.h"
 #include "base/unique_fd.h"
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 
 namespace tarnel::lab {
 

@@ -1,7 +1,7 @@
 #include "tools/lab/receivers/datagram_faults.h"
 
+#include "tools/files/file_io.h"
 #include "tools/receiving/text.h"
-#include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {
 namespace {

@@ -3,8 +3,8 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "tools/files/file_io.h"
 #include "tools/receiving/text.h"
-#include "tools/storebag/file_io.h"
 
 namespace tarnel::lab {
 namespace {

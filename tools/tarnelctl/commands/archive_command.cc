@@ -9,7 +9,7 @@
 
 #include "formats/archive_format.h"
 #include "formats/document.h"
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 #include "tools/tarnelctl/readable_value.h"
 
 namespace tarnel::ctl {

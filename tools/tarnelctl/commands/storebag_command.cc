@@ -8,7 +8,7 @@
 
 #include "formats/cryptography.h"
 #include "formats/document.h"
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 #include "tools/storebag/signed_storebag.h"
 #include "tools/storebag/storebag_key.h"
 #include "tools/storebag/storebag_template.h"

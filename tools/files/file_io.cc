@@ -1,4 +1,4 @@
-#include "tools/storebag/file_io.h"
+#include "tools/files/file_io.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
