@@ -73,6 +73,11 @@ class CurlHttpClient final : public HttpClient {
 
   void startDataTask(HttpRequest request, Completion completion) override;
 
+  // Ends the client's thread: what has not ended completes with kHttpClientGoingAway before this returns, and
+  // what is started later does at once. For an owner whose completions use what is destroyed before the
+  // client. Not to be called by a completion; calling it again does nothing.
+  void stop();
+
  private:
   class Worker;
   std::unique_ptr<Worker> worker_;
