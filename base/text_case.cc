@@ -45,27 +45,39 @@ void appendCharacter(std::string& out, char32_t code) {
   for (int i = continuations - 1; i >= 0; --i) out += static_cast<char>(0x80U | ((code >> (6 * i)) & 0x3FU));
 }
 
+char32_t lowerCharacter(char32_t code) {
+  return static_cast<char32_t>(towlower_l(static_cast<wint_t>(code), kCaseLocale));
+}
+
 char32_t foldCharacter(char32_t code) {
-  const wint_t capital = towupper_l(static_cast<wint_t>(code), kCaseLocale);
-  return static_cast<char32_t>(towlower_l(capital, kCaseLocale));
+  return lowerCharacter(static_cast<char32_t>(towupper_l(static_cast<wint_t>(code), kCaseLocale)));
+}
+
+// Each character changed; of ASCII both ways change the same letters.
+std::string changeEach(std::string_view text, char32_t (*change)(char32_t)) {
+  std::string changed;
+  if (isAscii(text) || !foldsBeyondAscii() || !isValidUtf8(text)) {
+    changed.resize(text.size());
+    std::transform(text.begin(), text.end(), changed.begin(), foldAscii);
+    return changed;
+  }
+  changed.reserve(text.size());
+  while (!text.empty()) {
+    const auto character = text.substr(0, characterLength(text.front()));
+    text.remove_prefix(character.size());
+    appendCharacter(changed, change(decodeCharacter(character)));
+  }
+  return changed;
 }
 
 }  // namespace
 
 std::string foldCase(std::string_view text) {
-  std::string folded;
-  if (isAscii(text) || !foldsBeyondAscii() || !isValidUtf8(text)) {
-    folded.resize(text.size());
-    std::transform(text.begin(), text.end(), folded.begin(), foldAscii);
-    return folded;
-  }
-  folded.reserve(text.size());
-  while (!text.empty()) {
-    const auto character = text.substr(0, characterLength(text.front()));
-    text.remove_prefix(character.size());
-    appendCharacter(folded, foldCharacter(decodeCharacter(character)));
-  }
-  return folded;
+  return changeEach(text, foldCharacter);
+}
+
+std::string lowerCase(std::string_view text) {
+  return changeEach(text, lowerCharacter);
 }
 
 bool equalsFolded(std::string_view folded, std::string_view text) {

@@ -5,13 +5,11 @@
 #include <string>
 #include <string_view>
 
-// Text ignoring case, for the whole system. Every letter becomes the small letter of its capital, by the
-// tables of the C library, one character to one: so "σ" and the final "ς" agree, "s" and the long "ſ", "k"
-// and the Kelvin sign, and "i" with or without its dot. The user's locale plays no part. A letter and its
-// folded form may differ in length.
+// Text ignoring case, and text in small letters, for the whole system: by the tables of the C library, one
+// character to one. The user's locale plays no part. A letter and what becomes of it may differ in length.
 //
 // Where the system has no locale "C.UTF-8", and in text that is not UTF-8, only the letters of ASCII are
-// folded.
+// changed.
 //
 // Names that a standard confines to ASCII, such as those of HTTP headers, are not compared by this.
 //
@@ -28,7 +26,13 @@ Word wordAt(const char* bytes) noexcept {
 }
 }  // namespace detail
 
+// For comparing. Every letter becomes the small letter of its capital: so "σ" and the final "ς" agree, "s"
+// and the long "ſ", "k" and the Kelvin sign, and "i" with or without its dot.
 std::string foldCase(std::string_view text);
+
+// Every capital becomes its small letter; what is a small letter already stays as it is, so "ς" and "σ"
+// remain two.
+std::string lowerCase(std::string_view text);
 
 // Whether the text folds to `folded`, which is a text that foldCase returned.
 bool equalsFolded(std::string_view folded, std::string_view text);

@@ -73,6 +73,25 @@ TEST(TextCaseTest, InTextThatIsNotUtf8OnlyAsciiIsFolded) {
   EXPECT_EQ(foldCase("X\xED\xA0\x80"), "x\xED\xA0\x80") << "a surrogate";
 }
 
+TEST(TextCaseTest, LowersCapitals) {
+  EXPECT_EQ(lowerCase("AbZ az09_@[`{"), "abz az09_@[`{");
+  EXPECT_EQ(lowerCase(""), "");
+  EXPECT_EQ(lowerCase(std::string("A\0B", 3)), std::string("a\0b", 3));
+  EXPECT_EQ(lowerCase("ÀÞŸΑΣЀЯԱᲐＡ\U00010400"), "àþÿασѐяաაａ\U00010428");
+  EXPECT_EQ(lowerCase("\u212A\u212B\u2126ẞȺ"), "kåωßⱥ");
+}
+
+TEST(TextCaseTest, LoweringKeepsWhatIsSmall) {
+  for (const char* small : {"ς", "ſ", "ı", "µ", "ϐϑϕ", "ſtraße ος", "日本😀ĸŉ"}) {
+    EXPECT_EQ(lowerCase(small), small);
+  }
+}
+
+TEST(TextCaseTest, InTextThatIsNotUtf8OnlyAsciiIsLowered) {
+  EXPECT_EQ(lowerCase("A\xC3"), "a\xC3");
+  EXPECT_EQ(lowerCase("\xC3\x84\xC3"), "\xC3\x84\xC3") << "not even its sound characters";
+}
+
 TEST(TextCaseTest, ComparesWithWhatIsFolded) {
   EXPECT_TRUE(equalsFolded("username", "UserName"));
   EXPECT_TRUE(equalsFolded("größe", "GRÖßE"));

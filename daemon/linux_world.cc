@@ -113,6 +113,10 @@ struct LinuxWorld::Prepared {
         workQueues(*log) {
     loop.setTimerHandler([this](uint64_t generation) { keepAlive.idleTimeElapsed(generation); });
   }
+  // Answers may start further requests, through what is destroyed before the client.
+  ~Prepared() { curl.stop(); }
+  Prepared(const Prepared&) = delete;
+  Prepared& operator=(const Prepared&) = delete;
 
   void report(const std::vector<ConfigurationProblem>& problems) const {
     for (const ConfigurationProblem& problem : problems) {

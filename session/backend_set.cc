@@ -72,8 +72,9 @@ void introduce(TarnelBackend& backend, const Identity& identity, const MaybeDict
 }  // namespace
 
 void cleanUpEach(Log& log, const BackendSet& backends) noexcept {
-  withEach(log, "cleanup", backends,
-           [](const std::string& /*name*/, TarnelBackend& each) { each.cleanup(); });
+  for (const auto& [name, backend] : backends) {
+    separatelyNoexcept(log, "cleanup", name.c_str(), [&each = *backend] { each.cleanup(); });
+  }
 }
 
 std::optional<BackendSet> createBackends(const Dependencies& dependencies, const BackendFactory& factory,

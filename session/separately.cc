@@ -21,10 +21,17 @@ std::string currentFailure() {
 
 }  // namespace
 
+void logFailure(Log& log, const char* operation, const char* who) noexcept {
+  try {
+    TARNEL_LOG(log, error, "%s: %s failed: %s", operation, who, currentFailure().c_str());
+  } catch (...) {
+    return;  // there is nobody else to tell
+  }
+}
+
 Error reportFailure(Log& log, const char* operation, const char* who) {
-  std::string why = currentFailure();
-  TARNEL_LOG(log, error, "%s: %s failed: %s", operation, who, why.c_str());
-  return {kTarnelErrorDomain, -1, std::move(why)};
+  logFailure(log, operation, who);
+  return {kTarnelErrorDomain, -1, currentFailure()};
 }
 
 }  // namespace tarnel

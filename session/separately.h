@@ -7,8 +7,11 @@
 
 namespace tarnel {
 
-// For the catch block of separately: logs what was caught, "OPERATION: WHO failed: ...", at level 3. Returns
-// it as an error of kTarnelErrorDomain with code -1.
+// For a catch block: logs what was caught, "OPERATION: WHO failed: ...", at level 3. A log that fails itself,
+// as one without memory does, says nothing.
+void logFailure(Log& log, const char* operation, const char* who) noexcept;
+
+// The same, and returns what was caught as an error of kTarnelErrorDomain with code -1.
 Error reportFailure(Log& log, const char* operation, const char* who);
 
 // Takes one of several steps that stand alone, such as the same with each backend: what this one throws ends
@@ -22,6 +25,16 @@ MaybeError separately(Log& log, const char* operation, const char* who, Step ste
     return std::nullopt;
   } catch (...) {
     return reportFailure(log, operation, who);
+  }
+}
+
+// The same where nothing may be thrown, as at the end of an object: nobody is told of a failure but the log.
+template <class Step>
+void separatelyNoexcept(Log& log, const char* operation, const char* who, Step step) noexcept {
+  try {
+    std::move(step)();
+  } catch (...) {
+    logFailure(log, operation, who);
   }
 }
 

@@ -3,6 +3,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <new>
 #include <stdexcept>
 
 #include "platform/fake/fake_log.h"
@@ -31,6 +32,25 @@ TEST(Separately, WhatAStepThrowsIsLoggedAndReturned) {
   EXPECT_THAT(log.lines(),
               ElementsAre(FakeLog::Line{LogLevel::error, "dealloc: the last flush failed: no memory"},
                           FakeLog::Line{LogLevel::error, "cleanup: httppost failed: unknown failure"}));
+}
+
+TEST(Separately, ALogThatFailsKeepsNothingFromWhoeverAsks) {
+  FakeLog log;
+  log.whenWritten = [](std::string_view) { throw std::bad_alloc(); };
+  EXPECT_EQ(separately(log, "cleanup", "httppost", [] { throw std::runtime_error("why"); }),
+            Error(kTarnelErrorDomain, -1, "why"));
+  separatelyNoexcept(log, "dealloc", "the last flush", [] { throw 5; });
+  EXPECT_THAT(log.lines(),
+              ElementsAre(FakeLog::Line{LogLevel::error, "cleanup: httppost failed: why"},
+                          FakeLog::Line{LogLevel::error, "dealloc: the last flush failed: unknown failure"}));
+}
+
+TEST(Separately, WithoutExceptionsAStepIsDone) {
+  FakeLog log;
+  bool done = false;
+  separatelyNoexcept(log, "dealloc", "the last flush", [&done] { done = true; });
+  EXPECT_TRUE(done);
+  EXPECT_THAT(log.lines(), IsEmpty());
 }
 
 }  // namespace

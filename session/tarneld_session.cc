@@ -55,10 +55,12 @@ TarneldSession::~TarneldSession() {
 void TarneldSession::dealloc() noexcept {
   if (std::exchange(ended_, true)) return;
   Log& log = dependencies_.log;
-  TARNEL_LOG(log, debug, "dealloc: TarneldSession dealloc: %u", sessionID());
-  separately(log, "dealloc", "the stop message", [this] { sendStopMessage(); });
-  separately(log, "dealloc", "the last flush", [this] { flushMessagesWithCompletion(nullptr); });
-  separately(log, "dealloc", "the end of aggregation", [this] { shutdownSessionAggregation(); });
+  separatelyNoexcept(log, "dealloc", "the first line", [this, &log] {
+    TARNEL_LOG(log, debug, "dealloc: TarneldSession dealloc: %u", sessionID());
+  });
+  separatelyNoexcept(log, "dealloc", "the stop message", [this] { sendStopMessage(); });
+  separatelyNoexcept(log, "dealloc", "the last flush", [this] { flushMessagesWithCompletion(nullptr); });
+  separatelyNoexcept(log, "dealloc", "the end of aggregation", [this] { shutdownSessionAggregation(); });
   _sessionInfo.reset();
   setUserInfo(std::nullopt);
   _frameworks.reset();

@@ -1,6 +1,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <new>
 #include <stdexcept>
 
 #include "session/test_session_fixture.h"
@@ -103,6 +104,34 @@ TEST_F(SessionEnd, EachStepOfTheEndStandsAlone) {
     EXPECT_EQ(backends.journal.lines(), done) << failsAt;
     EXPECT_TRUE(logged(LogLevel::error, line));
     EXPECT_EQ(delegate.use_count(), 1);
+  }
+}
+
+// A log that has no memory for what it is told first, or for what it is told of a failure.
+TEST_F(SessionEnd, NoLineThatCannotBeWrittenEndsTheProcess) {
+  offer({kTarnelBackendHTTPPost, kTarnelBackendDashboard});
+  for (const std::string failsAt :
+       {"dealloc: TarneldSession dealloc: 7", "cleanup: httppost failed: cleanup went wrong",
+        "dealloc: ", "cleanup: ", ""}) {
+    backends.scripts[kTarnelBackendHTTPPost].cleanupThrows = true;
+    session = newSession(connection);
+    configureAndStart(true);
+    size_t failures = 0;
+    world.log.whenWritten = [&failsAt, &failures](std::string_view text) {
+      if (!text.starts_with(failsAt)) return;
+      ++failures;
+      throw std::bad_alloc();
+    };
+    session.reset();
+    world.log.whenWritten = nullptr;
+    EXPECT_GE(failures, 1U) << failsAt;
+    const Lines done = backends.journal.lines();
+    ASSERT_GE(done.size(), 2U) << failsAt;
+    EXPECT_EQ(Lines(done.end() - 2, done.end()), (Lines{"httppost cleanup", "dashboard cleanup"})) << failsAt;
+    if (!failsAt.empty()) {
+      EXPECT_EQ(done.size(), 6U) << failsAt;
+    }
+    EXPECT_EQ(delegate.use_count(), 1) << failsAt;
   }
 }
 

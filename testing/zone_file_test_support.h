@@ -24,6 +24,15 @@ inline std::string zoneText(int32_t secondsEast) {
   return text + number(secondsEast) + std::string(2, '\0') + std::string(kName, sizeof(kName));
 }
 
+// The same for whole hours, with a second block for times of 64 bits and the rule for the time to come (RFC
+// 8536, version 2).
+inline std::string longZoneText(int32_t secondsEast) {
+  std::string block = zoneText(secondsEast);
+  block[4] = '2';
+  const int32_t west = -secondsEast / 3600;
+  return block + block + "\nXST" + std::to_string(west) + "\n";
+}
+
 // Makes this process take the file for the system's zone.
 inline void loadZoneFrom(const std::string& path) {
   // The C library reads the file of an unchanged TZ once only.

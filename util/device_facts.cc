@@ -14,9 +14,9 @@ constexpr bool isContinuation(char c) {
   return (static_cast<unsigned char>(c) & 0xC0U) == 0x80U;
 }
 
-std::string foldedEntry(const MaybeDictionary& dictionary, std::string_view key) {
+std::string loweredEntry(const MaybeDictionary& dictionary, std::string_view key) {
   const auto* text = dictionary ? findString(*dictionary, key) : nullptr;
-  return text == nullptr ? std::string() : foldCase(*text);
+  return text == nullptr ? std::string() : lowerCase(*text);
 }
 
 }  // namespace
@@ -61,8 +61,8 @@ void getUniqueDeviceID(DeviceInformation& deviceInformation, char* destination, 
 }
 
 std::string userInfoKey(const MaybeDictionary& userInfo) {
-  return foldedEntry(userInfo, kTarnelUserInfoClientName) + ":" +
-         foldedEntry(userInfo, kTarnelUserInfoServiceName);
+  return loweredEntry(userInfo, kTarnelUserInfoClientName) + ":" +
+         loweredEntry(userInfo, kTarnelUserInfoServiceName);
 }
 
 }  // namespace tarnel

@@ -22,7 +22,7 @@ MaybeString releaseType(DeviceInformation& deviceInformation);     // "ReleaseTy
 // to whole characters that do.
 void getUniqueDeviceID(DeviceInformation& deviceInformation, char* destination, size_t size);
 
-// "%@:%@" of the client name and service name in small letters, as foldCase gives them; a missing one is the
+// "%@:%@" of the client name and service name in small letters, as lowerCase gives them; a missing one is the
 // empty text.
 std::string userInfoKey(const MaybeDictionary& userInfo);
 

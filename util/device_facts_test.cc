@@ -111,10 +111,15 @@ TEST(UserInfoKeyTest, LettersBeyondAscii) {
   EXPECT_EQ(userInfoKey(userInfo("\U00010400\U0001F600", "X")), "\U00010428\U0001F600:x");
 }
 
-// As names compare everywhere else.
-TEST(UserInfoKeyTest, NamesThatAreTheSameIgnoringCaseGiveTheSameKey) {
-  EXPECT_EQ(userInfoKey(userInfo("\u039f\u03a3", "\u212aey")), userInfoKey(userInfo("\u03bf\u03c2", "key")));
+TEST(UserInfoKeyTest, NamesThatAreTheSameInSmallLettersGiveTheSameKey) {
+  EXPECT_EQ(userInfoKey(userInfo("\u039f\u03a3", "\u212aey")), userInfoKey(userInfo("\u03bf\u03c3", "key")));
   EXPECT_EQ(userInfoKey(userInfo("\u0531", "\uff21")), "\u0561:\uff41");
+}
+
+// Two small letters of one capital agree where names are compared, but a key keeps them apart.
+TEST(UserInfoKeyTest, SmallLettersStayAsTheyAre) {
+  EXPECT_EQ(userInfoKey(userInfo("\u03bf\u03c2", "\u017f\u0131\u00b5")), "\u03bf\u03c2:\u017f\u0131\u00b5");
+  EXPECT_NE(userInfoKey(userInfo("\u03bf\u03c2", "key")), userInfoKey(userInfo("\u03bf\u03c3", "key")));
 }
 
 TEST(UserInfoKeyTest, TextThatIsNotUtf8KeepsItsBytes) {

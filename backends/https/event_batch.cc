@@ -107,11 +107,13 @@ Array EventBatch::takeEvents(const Finish& finish) {
   events.reserve(events_.size());
   size_t bytes = 0;
   while (!events_.empty()) {
-    Held& held = events_.front();
-    bytes_ -= held.bytes;
-    if (labelled_ > 0) setFields(held, label);
+    const bool hasLabel = labelled_ > 0;
+    bytes_ -= events_.front().bytes;
+    Held held = std::move(events_.front());
+    removeOldest();
+    if (hasLabel) setFields(held, label);
     setFields(held, fields);
-    if (finish.filters != nullptr) {
+    if (finish.filters) {
       held.trace.digested.insert(finish.digested.begin(), finish.digested.end());
       finish.filters->filterAgain(held.event, held.trace);
       held.bytes = estimateSize(held.event, held.trace);
@@ -120,10 +122,11 @@ Array EventBatch::takeEvents(const Finish& finish) {
     // Finished once more with the next, it becomes what it is now.
     if (!events.empty() && bytes > kMaxBytes) {
       bytes_ += held.bytes;
+      events_.push_front(std::move(held));
+      if (hasLabel) ++labelled_;
       return events;
     }
     events.append(Value(std::move(held.event)));
-    removeOldest();
   }
   return events;
 }

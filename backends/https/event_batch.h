@@ -2,6 +2,7 @@
 
 #include <cstddef>
 #include <deque>
+#include <optional>
 
 #include "backends/https/event_filters.h"
 #include "base/value.h"
@@ -21,7 +22,7 @@ class EventBatch {
   struct Finish {
     Dictionary fields;                            // every entry is set in the event
     std::set<std::string, std::less<>> digested;  // those of them that are digests
-    const EventFilters* filters = nullptr;        // the event then passes them again; null: it does not
+    std::optional<EventFilters> filters;          // the event then passes them again; absent: it does not
   };
 
   // Memory that the event holds, roughly, in bytes.
@@ -42,7 +43,8 @@ class EventBatch {
 
   // The oldest events, finished: all of them, or else as many as are no more than kMaxBytes together, but at
   // least one. What is set may be much larger than the events themselves; so that it is never in all of them
-  // at the same time, the caller uses up what it got before it takes the next.
+  // at the same time, the caller uses up what it got before it takes the next. An exception costs the events
+  // that were taken until then; those that are left are as they were.
   Array takeEvents(const Finish& finish);
 
  private:

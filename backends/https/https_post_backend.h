@@ -9,6 +9,8 @@
 
 #include "backends/https/event_batch.h"
 #include "backends/https/event_filters.h"
+#include "backends/https/message_poster.h"
+#include "backends/https/message_writer.h"
 #include "backends/https/profile_reader.h"
 #include "backends/tarnel_backend.h"
 
@@ -39,7 +41,9 @@ class HTTPSPostBackend final : public TarnelBackend {
   MaybeSentObject sendMessage(const MaybeDictionary& payload, const TimeValue& timestamp, Method method,
                               RespCode respCode, EventID eventID, Flag flag) override;
   // Posts the batch: as one message, or as several when, with the user information, it is larger than a batch
-  // may be. The completion gets the text of what was posted and the first error of a post, after the last.
+  // may be. Of several each is made and posted when the one before is answered, also when the backend is gone
+  // by then. Returns the text of the first. The completion gets the text of what was posted and the first
+  // error, after the last answer.
   MaybeString flushMessagesWithCompletion(FlushCompletion completion) override;
   // Also relabels the events of the batch.
   void setCorrelatedSessionID(const MaybeString& correlatedSessionID) override;
@@ -97,14 +101,14 @@ class HTTPSPostBackend final : public TarnelBackend {
   int32_t timeZoneOffset();
 
   // https_post_backend_message.cc
-  void keepWritableValues(Dictionary& event) const;
   MaybeString clientIdentifier() const;
   bool prettyCopyAllowed() const;
+  MessageWriter messageWriter() const;
 
   // https_post_backend_post.cc
-  std::vector<HttpHeader> headersForPost(std::optional<Method> method, std::optional<RespCode> responseCode,
-                                         size_t contentLength, bool compressed) const;
-  HttpClient::Completion answerHandler(FlushCompletion completion);
+  std::vector<HttpHeader> headersForPost(std::optional<Method> method,
+                                         std::optional<RespCode> responseCode) const;
+  MessagePoster messagePoster(Flag flag, std::optional<Method> method, std::optional<RespCode> responseCode);
 
   // https_post_backend_send.cc
   Dictionary stopPayload(const Dictionary& payload) const;

@@ -21,7 +21,7 @@ inline std::string inflated(const std::string& gzip) {
   z_stream stream{};
   inflateInit2(&stream, 31);
   std::string input = gzip;
-  std::string out(4U << 20U, '\0');
+  std::string out(8U << 20U, '\0');
   stream.next_in = reinterpret_cast<Bytef*>(input.data());
   stream.avail_in = static_cast<uInt>(input.size());
   stream.next_out = reinterpret_cast<Bytef*>(out.data());

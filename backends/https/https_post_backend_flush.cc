@@ -1,4 +1,4 @@
-#include "backends/https/flush_join.h"
+#include "backends/https/batch_poster.h"
 #include "backends/https/https_post_backend.h"
 #include "tarnel/keys.h"
 
@@ -10,31 +10,6 @@ namespace {
 Error flushError(const char* text) {
   return {kTarnelErrorDomain, -1, text};
 }
-
-// Texts for the log, one after the other. The log of a flush is bounded like a batch.
-class PostedTexts {
- public:
-  // Where the next text goes; null when no more is taken.
-  MaybeString* next() { return all_ && all_->size() >= EventBatch::kMaxBytes ? nullptr : &next_; }
-  void take() {
-    if (next() == nullptr) {
-      ++leftOut_;
-    } else if (next_) {
-      if (all_) all_->append("\n").append(*next_);
-      if (!all_) all_ = std::move(next_);
-      next_.reset();
-    }
-  }
-  MaybeString result() {
-    if (leftOut_ != 0) all_->append("\n(and " + std::to_string(leftOut_) + " more messages)");
-    return std::move(all_);
-  }
-
- private:
-  MaybeString all_;
-  MaybeString next_;
-  size_t leftOut_ = 0;
-};
 
 }  // namespace
 
@@ -55,10 +30,10 @@ void HTTPSPostBackend::discardBatch() {
 EventBatch::Finish HTTPSPostBackend::finishOfFlush() const {
   EventBatch::Finish finish;
   const bool again = dependencies().filterHeldEvents;
-  if (again) finish.filters = &_filters;
+  if (again) finish.filters = _filters;
   if (!userInfoDict()) return finish;
   finish.fields = *userInfoDict();
-  // It has no method and status of its own: both count as 0, whatever they are in the events.
+  // Its own method and status, where it holds none 0, whatever they are in the events.
   auto trace = EventFilters::traceOf(finish.fields);
   _filters.filterAgain(finish.fields, trace);
   finish.digested = std::move(trace.digested);
@@ -68,29 +43,17 @@ EventBatch::Finish HTTPSPostBackend::finishOfFlush() const {
 // Usually one message. Held events may become much larger by the user information that comes with the flush;
 // then there are several, none of them larger than a batch may be.
 MaybeString HTTPSPostBackend::postBatch(FlushCompletion completion) {
-  auto batch = std::move(*_batchedEvents);
+  // The batch is given away last, so that nothing of it is lost when there is no memory for the rest.
+  auto finish = finishOfFlush();
+  auto poster = messagePoster(Flag::normal, std::nullopt, std::nullopt);
+  const auto posting =
+      std::make_shared<BatchPoster>(std::move(*_batchedEvents), std::move(finish), messageWriter(),
+                                    std::move(poster), std::move(completion));
   discardBatch();
   _eventMethodCounts.clear();
-  const auto finish = finishOfFlush();
-  const auto join = std::make_shared<FlushJoin>(std::move(completion));
-  PostedTexts texts;
-  // A batch without events is a message, too.
-  do {
-    auto events = batch.takeEvents(finish);
-    join->expectOne();
-    auto body = createMessageForPostAndLogging(events, texts.next());
-    events = Array();
-    if (!body) {
-      join->completeOne(flushError("Can not flush: the events can not be written as JSON"));
-      continue;
-    }
-    texts.take();
-    postJSONMessage(
-        std::move(*body), Flag::normal, std::nullopt, std::nullopt,
-        [join](const MaybeString& /*text*/, MaybeError error) { join->completeOne(std::move(error)); });
-  } while (batch.size() > 0);
-  auto text = texts.result();
-  join->allExpected(text);
+  auto text = posting->makeFirst();
+  if (auto rest = posting->takeRefused()) _batchedEvents = std::move(*rest);
+  posting->start();
   return text;
 }
 

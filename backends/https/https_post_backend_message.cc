@@ -1,68 +1,8 @@
-#include <algorithm>
-
 #include "backends/https/https_post_backend.h"
-#include "formats/json_writer.h"
 
-// The JSON message that carries events.
+// What of the backend goes into its messages.
 
 namespace tarnel {
-namespace {
-
-bool mayStandInEvent(const Value& value) {
-  return value.string() != nullptr || value.isNumber();
-}
-
-void logRemoval(Log& log, const std::string& key, const Value& value) {
-  TARNEL_LOG(
-      log, warning,
-      "HTTPSPostBackend(createMessageForPostAndLogging): JSONWriter unable to handle key: %s, value: %s",
-      key.c_str(), value.description().c_str());
-}
-
-// The tree shares the events; nothing of them is copied.
-Dictionary messageFrom(double postTime, const MaybeString& clientId, const Array& events) {
-  Dictionary message;
-  message.set("postTime", postTime);
-  // Events that nobody's identifier stands for could not be told apart from a stranger's: they stay here.
-  if (!clientId) return message;
-  message.set("clientId", *clientId);
-  message.set("events", events);
-  return message;
-}
-
-// Text that is not UTF-8 and numbers that are not finite cannot be written. Such a value goes, like any other
-// that may not stand in an event, so that the rest of the batch arrives.
-void removeUnwritable(Log& log, Array& events) {
-  std::string scratch;
-  for (auto& event : events.mutableValues()) {
-    if (event.mutableDictionary() == nullptr) continue;
-    event.mutableDictionary()->editEntries([&log, &scratch](const std::string& key, Value& value) {
-      scratch.clear();
-      if (isValidUtf8(key) && writeJson(value, JsonStyle::compact, scratch)) return true;
-      logRemoval(log, key, value);
-      return false;
-    });
-  }
-}
-
-}  // namespace
-
-void HTTPSPostBackend::keepWritableValues(Dictionary& event) const {
-  const bool allMayStand = std::all_of(event.begin(), event.end(), [](const Dictionary::Entry& entry) {
-    return mayStandInEvent(entry.second);
-  });
-  if (allMayStand) return;
-  event.editEntries([this](const std::string& key, Value& value) {
-    if (const auto* date = value.date()) {
-      // Here alone an infinite time can come in: clients give dates as they like.
-      value = Value(finiteOrMinusOne(date->seconds));
-      return true;
-    }
-    if (mayStandInEvent(value)) return true;
-    logRemoval(dependencies().log, key, value);
-    return false;
-  });
-}
 
 MaybeString HTTPSPostBackend::clientIdentifier() const {
   if (_extrasOnInternal != 0 && isInternal()) return udid();
@@ -77,27 +17,13 @@ bool HTTPSPostBackend::prettyCopyAllowed() const {
   return environment == EnvironmentType::development || environment == EnvironmentType::orvaneInternal;
 }
 
+MessageWriter HTTPSPostBackend::messageWriter() const {
+  return {dependencies().log, dependencies().clock, clientIdentifier(), prettyCopyAllowed()};
+}
+
 std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Array& events,
                                                                             MaybeString* prettyJsonString) {
-  // Finite, since the clock gives integers; what is not finite would be a message that cannot be written.
-  const double postTime = finiteOrMinusOne(secondsFromTimeValue(dependencies().clock.timeOfDay()));
-  for (auto& event : events.mutableValues()) {
-    if (auto* fields = event.mutableDictionary()) keepWritableValues(*fields);
-  }
-  const auto clientId = clientIdentifier();
-  auto message = messageFrom(postTime, clientId, events);
-  std::string body;
-  if (!writeJson(message, JsonStyle::compact, body)) {
-    message = Dictionary();
-    removeUnwritable(dependencies().log, events);
-    message = messageFrom(postTime, clientId, events);
-    if (!writeJson(message, JsonStyle::compact, body)) return std::nullopt;
-  }
-  if (prettyJsonString != nullptr && prettyCopyAllowed()) {
-    std::string pretty;
-    if (writeJson(message, JsonStyle::pretty, pretty)) *prettyJsonString = std::move(pretty);
-  }
-  return body;
+  return messageWriter().write(events, prettyJsonString);
 }
 
 }  // namespace tarnel

@@ -1,10 +1,9 @@
 #include "backends/https/https_post_backend.h"
 #include "backends/https/sender_names.h"
 #include "base/text_format.h"
-#include "formats/compression.h"
 #include "tarnel/keys.h"
 
-// Posting a message, and what its answer does.
+// What a post tells of its sender, and where it goes.
 
 namespace tarnel {
 namespace {
@@ -19,15 +18,11 @@ std::string headerText(std::string_view text) {
   return safe;
 }
 
-Error localError(std::string text) {
-  return {kTarnelErrorDomain, -1, std::move(text)};
-}
-
 }  // namespace
 
+// Those that follow tell of the content.
 std::vector<HttpHeader> HTTPSPostBackend::headersForPost(std::optional<Method> method,
-                                                         std::optional<RespCode> responseCode,
-                                                         size_t contentLength, bool compressed) const {
+                                                         std::optional<RespCode> responseCode) const {
   std::vector<HttpHeader> headers;
   headers.reserve(11);
   const auto clientName = userInfoText(kTarnelUserInfoClientName);
@@ -44,48 +39,22 @@ std::vector<HttpHeader> HTTPSPostBackend::headersForPost(std::optional<Method> m
     headers.push_back(
         {"X-TRN-Event-Map", formatText("%d %d", static_cast<int>(*method), static_cast<int>(*responseCode))});
   }
-  headers.push_back({"Accept", "application/json"});
-  headers.push_back({"Content-Type", "application/json"});
-  headers.push_back({"Content-Length", std::to_string(contentLength)});
-  if (compressed) headers.push_back({"Content-Encoding", "gzip"});
   return headers;
+}
+
+MessagePoster HTTPSPostBackend::messagePoster(Flag flag, std::optional<Method> method,
+                                              std::optional<RespCode> responseCode) {
+  return {dependencies().http,
+          dependencies().log,
+          weak_from_this(),
+          name(),
+          isRealtime(flag) ? _realtimePostURL : _postURL,
+          headersForPost(method, responseCode)};
 }
 
 void HTTPSPostBackend::postJSONMessage(std::string message, Flag withFlag, std::optional<Method> method,
                                        std::optional<RespCode> responseCode, FlushCompletion completion) {
-  const auto& url = isRealtime(withFlag) ? _realtimePostURL : _postURL;
-  if (!url) {
-    completion(std::nullopt, localError("postURL is nil"));
-    return;
-  }
-  auto compressed = gzipDeflate(dependencies().log, message);
-  const bool useCompressed = compressed && !compressed->empty() && compressed->size() < message.size();
-  HttpRequest request;
-  request.method = "POST";
-  request.url = *url;
-  request.body = std::make_shared<const std::string>(std::move(useCompressed ? *compressed : message));
-  request.headers = headersForPost(method, responseCode, request.body->size(), useCompressed);
-  request.wantsBody = false;
-  dependencies().http.startDataTask(std::move(request), answerHandler(std::move(completion)));
-}
-
-HttpClient::Completion HTTPSPostBackend::answerHandler(FlushCompletion completion) {
-  return [backend = weak_from_this(), &log = dependencies().log, name = name(),
-          completion = std::move(completion)](HttpResult result) mutable {
-    if (result.error) {
-      TARNEL_LOG(log, error, "HTTPSPostBackend(postJsonMessage): post error: %s",
-                 result.error->description().c_str());
-    }
-    const int status = result.response ? result.response->statusCode : 0;
-    if (status < 500 || status > 599) {
-      completion(std::nullopt, std::move(result.error));
-      return;
-    }
-    auto text = formatText("backend %s disabled by server %d return code", name.c_str(), status);
-    TARNEL_LOG(log, information, "postJSONMessage: %s", text.c_str());
-    if (const auto alive = backend.lock()) alive->setState(ReportingState::disabled);
-    completion(std::nullopt, Error(kTarnelErrorDomain, status, std::move(text)));
-  };
+  messagePoster(withFlag, method, responseCode).post(std::move(message), std::move(completion));
 }
 
 }  // namespace tarnel

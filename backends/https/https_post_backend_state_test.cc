@@ -227,8 +227,9 @@ TEST_F(HTTPSPostBackendStateTest, NumbersOfAnEntryAreHeldToTheirBounds) {
   constexpr int64_t kOneTooHigh = (int64_t{1} << 32) + 1;
   entry.set("hierarchy", kOneTooHigh);
   entry.set("event_threshold", -kOneTooHigh);
-  entry.set("extras_on_internal", int64_t{1} << 32);
+  for (const char* key : {"extras_on_internal", "expedite"}) entry.set(key, int64_t{1} << 32);
   EXPECT_EQ(updated(), ReportingState::enabled);
+  EXPECT_FALSE(backend->batchEvents());
   EXPECT_EQ(backend->hierarchy(), INT32_MAX);
   expectLog(LogLevel::debug, "resetBackendStateWithClient: event_threshold set to -2147483648");
   expectLog(LogLevel::debug, "setBackendStateWithClient: extras on internal is set to 2147483647");

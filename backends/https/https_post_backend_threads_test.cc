@@ -46,7 +46,45 @@ TEST_F(HTTPSPostBackendThreadsTest, AnswersMeetASendingAndAReleasedBackend) {
   EXPECT_EQ(world.http.pendingCount(), 0U);
 }
 
-// The first messages of a flush are answered while its last ones are still being made.
+// Later messages of a flush are made where the answers come, while the session changes or lets go what it
+// has.
+TEST_F(HTTPSPostBackendThreadsTest, LaterMessagesAreMadeBesideTheSession) {
+  world.log.setActiveLevel(LogLevel::error);
+  world.http.holdAnswers(true);
+  world.dependencies.filterHeldEvents = true;
+  constexpr int kFlushes = 4;
+  constexpr size_t kMessages = 3;
+  std::atomic<int> completions{0};
+  std::atomic<bool> flushing{true};
+  std::thread answering([this, &completions, &flushing] {
+    while (flushing || completions < kFlushes) {
+      if (world.http.pendingCount() > 0) world.http.answerOldest(fake::FakeHttpClient::status(200));
+      std::this_thread::yield();
+    }
+  });
+  const Dictionary large{{kTarnelUserInfoClientName, "Meetwell"},
+                         {kTarnelUserInfoServiceName, "video-call"},
+                         {"secret", "s"},
+                         {"large", std::string(EventBatch::kMaxBytes, 'x')}};
+  for (int round = 0; round < kFlushes; ++round) {
+    const auto backend = makeUpdated();
+    for (size_t i = 0; i < kMessages; ++i) send(*backend, static_cast<int>(i));
+    backend->setUserInfoDict(large);
+    backend->flushMessagesWithCompletion(
+        [&completions](const MaybeString&, const MaybeError&) { ++completions; });
+    backend->setUserInfoDict(userInfo);
+    backend->setPostURL("https://elsewhere.example");
+    backend->setHardwareType("Slate8,1");
+    backend->updateState();
+    send(*backend, 9);
+  }
+  flushing = false;
+  answering.join();
+  EXPECT_EQ(completions, kFlushes);
+  EXPECT_EQ(world.http.requests().size(), kFlushes * kMessages);
+}
+
+// Messages of a flush are answered while their posts are still being made.
 TEST_F(HTTPSPostBackendThreadsTest, AFlushOfSeveralMessagesCompletesOnce) {
   world.log.setActiveLevel(LogLevel::error);
   world.http.holdAnswers(true);

@@ -48,15 +48,17 @@ int ConnectionRegistry::start(std::shared_ptr<ConnectionLink> link, std::functio
   pthread_attr_setstacksize(&attributes, kConnectionStackBytes);
   int error = ECANCELED;
   {
-    // The new thread reports its end under the same lock, so not before it is listed.
+    // The new thread reports its end under the same lock, so not before all of this is done. It is listed
+    // first: nothing may fail once it runs.
     const std::lock_guard lock(mutex_);
     if (!stopping_) {
       auto start = std::make_unique<Start>(Start{shared_from_this(), ++lastId_, std::move(body)});
-      Thread thread{std::move(link)};
-      error = createThread_(&thread.handle, &attributes, runThread, start.get());
+      const auto thread = running_.emplace(start->id, Thread{std::move(link)}).first;
+      error = createThread_(&thread->second.handle, &attributes, runThread, start.get());
       if (error == 0) {
-        running_.emplace(start->id, std::move(thread));
         static_cast<void>(start.release());  // the thread's own now
+      } else {
+        running_.erase(thread);
       }
     }
   }

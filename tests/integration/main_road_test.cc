@@ -127,6 +127,36 @@ TEST_F(MainRoadTest, ABatchIsPostedWhenOneMethodExceedsItsThreshold) {
   EXPECT_THAT(kindsOf(lab.waitForEvents(4)), ElementsAre("0/0", "5/11", "5/12", "5/13"));
 }
 
+// An event from before the user is named is made without filters.
+TEST_F(MainRoadTest, HeldEventsAreFilteredWhereTheConfigurationSaysSo) {
+  const Array filters{Dictionary{{"key", "callTitle"}, {"action", "remove"}}};
+  for (const bool filtersHeld : {false, true}) {
+    lab.reset();
+    serveEntry(with(entry(), "filters", filters));
+    instance.setConfiguration(std::string("[locale]\ncountry = \"DE\"\n[privacy]\nfilter_held_events = ") +
+                              (filtersHeld ? "true\n" : "false\n"));
+    ASSERT_TRUE(instance.start());
+    {
+      TestSession session(instance, {.client = "", .service = ""});
+      client::Dictionary payload;
+      payload.set("callTitle", "secret").set("other", "stays");
+      ASSERT_TRUE(session.send(14, 10, payload).ok());
+      const auto user = userInfo("Meetwell", "video-call");
+      ASSERT_TRUE(session.session.fetchStatesAndWait(user, kDeadline).ok());
+      ASSERT_TRUE(session.session.flushAndWait(kDeadline).ok());
+    }
+    size_t seen = 0;
+    for (const auto& arrival : lab.waitForEvents(3)) {
+      if (kindOf(arrival) != "14/10") continue;
+      ++seen;
+      EXPECT_EQ(textIn(eventOf(arrival), "callTitle"), filtersHeld ? "" : "secret");
+      EXPECT_EQ(textIn(eventOf(arrival), "other"), "stays");
+    }
+    EXPECT_EQ(seen, 1U);
+    instance.stop();
+  }
+}
+
 TEST_F(MainRoadTest, FiltersRemoveAndHash) {
   const Array filters{Dictionary{{"method", 1}, {"key", "title"}, {"action", "keep"}},
                       Dictionary{{"key", "TITLE"}, {"action", "remove"}},

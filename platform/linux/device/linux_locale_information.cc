@@ -3,7 +3,9 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <cstdint>
 #include <ctime>
+#include <string_view>
 #include <utility>
 
 #include "platform/file_system.h"
@@ -26,12 +28,47 @@ bool isThere(const std::string& path) {
   return ::lstat(path.c_str(), &status) == 0 || errno != ENOENT;
 }
 
+uint64_t numberAt(std::string_view bytes, size_t position) {
+  uint64_t number = 0;
+  for (const char byte : bytes.substr(position, 4)) number = number << 8U | static_cast<unsigned char>(byte);
+  return number;
+}
+
+// Bytes of the block that begins here, its header and the data that the header counts; nothing where there
+// are fewer. RFC 8536, sections 3.1 and 3.2; timeBytes: 4 in a file's first block, 8 in its second.
+std::optional<size_t> blockLength(std::string_view bytes, uint64_t timeBytes) {
+  constexpr size_t kHeader = 44;
+  if (bytes.size() < kHeader || !bytes.starts_with("TZif")) return std::nullopt;
+  const uint64_t utIndicators = numberAt(bytes, 20);
+  const uint64_t standardIndicators = numberAt(bytes, 24);
+  const uint64_t leapSeconds = numberAt(bytes, 28);
+  const uint64_t transitions = numberAt(bytes, 32);
+  const uint64_t types = numberAt(bytes, 36);
+  const uint64_t nameBytes = numberAt(bytes, 40);
+  const uint64_t length = kHeader + transitions * (timeBytes + 1) + types * 6 + nameBytes +
+                          leapSeconds * (timeBytes + 4) + standardIndicators + utIndicators;
+  return length <= bytes.size() ? std::optional<size_t>(length) : std::nullopt;
+}
+
+// False for one that is still being written: the C library takes what it cannot read to its end for UTC.
+bool isWholeZone(std::string_view bytes) {
+  const auto first = blockLength(bytes, 4);
+  if (!first) return false;
+  if (bytes[4] == '\0') return true;  // version 1 has this block alone
+  bytes.remove_prefix(*first);
+  const auto second = blockLength(bytes, 8);
+  if (!second) return false;
+  const auto footer = bytes.substr(*second);
+  return footer.size() >= 2 && footer.starts_with('\n') && footer.ends_with('\n');
+}
+
 // Why the C library could not make a zone of the file.
 MaybeError zoneProblem(const std::string& path) {
   const auto contents = readFile(path);
   if (!contents) return contents.error();
-  if (contents->text.starts_with("TZif")) return std::nullopt;  // RFC 8536, section 3.1
-  return Error(kFileErrorDomain, EINVAL, path + ": is no time zone");
+  if (!contents->text.starts_with("TZif")) return Error(kFileErrorDomain, EINVAL, path + ": is no time zone");
+  if (isWholeZone(contents->text)) return std::nullopt;
+  return Error(kFileErrorDomain, EINVAL, path + ": is a time zone's file cut short");
 }
 
 }  // namespace

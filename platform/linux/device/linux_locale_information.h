@@ -30,8 +30,9 @@ struct LocalZone {
 // The time zone is that of TZ, as it is when the object is made; without TZ the system's, whose changes are
 // followed: each question looks whether another file stands at the place of the zone's (one system call). The
 // object must be made before the process confines itself. A file that cannot be used afterwards, because the
-// sandbox's profile does not cover it or because it is no zone, changes nothing: the C library alone would go
-// on in UTC. One warning tells of it. No file at all means UTC, as localtime(5) has it.
+// sandbox's profile does not cover it or because it is no zone or only the beginning of one, changes nothing:
+// the C library alone would go on in UTC. One warning tells of it. No file at all means UTC, as localtime(5)
+// has it.
 class LinuxLocaleInformation final : public LocaleInformation {
  public:
   using Environment = std::function<const char*(const char* name)>;

@@ -73,6 +73,7 @@ class LocalZoneTest : public testing::Test {
     folder_.write("east", zoneText(5 * 3600));
     folder_.write("west", zoneText(-3600));
     folder_.write("text", "Europe/Berlin\n");
+    folder_.write("half", zoneText(-3600).substr(0, 50));
   }
 
   // As timedatectl does: at no instant without a link.
@@ -138,8 +139,57 @@ TEST_F(LocalZoneTest, NoFileMeansUTC) {
 
 TEST_F(LocalZoneTest, WhatCannotBeUsedLeavesTheZoneOfBefore) {
   EXPECT_EQ(answers({[this] { linkTo("nowhere"); }, [this] { linkTo("text"); }, [this] { linkTo("."); },
-                     [this] { linkTo("west"); }}),
-            "18000 18000 18000 18000 -3600* with 1 warnings");
+                     [this] { linkTo("half"); }, [this] { linkTo("west"); }}),
+            "18000 18000 18000 18000 18000 -3600* with 1 warnings");
+}
+
+// As it is seen while it is copied to its place.
+TEST_F(LocalZoneTest, AZoneCutShortAnywhereLeavesTheZoneOfBefore) {
+  for (const auto& whole : {zoneText(-3600), longZoneText(-3600)}) {
+    std::vector<std::function<void()>> steps;
+    std::string expected = "18000 ";
+    for (size_t size = 0; size < whole.size(); ++size) {
+      steps.emplace_back([this, text = whole.substr(0, size)] {
+        folder_.write("short", text);
+        linkTo("short");
+      });
+      expected += "18000 ";
+    }
+    steps.emplace_back([this, &whole] { folder_.write("short", whole); });
+    EXPECT_EQ(answers(steps), expected + "-3600* with 1 warnings");
+  }
+}
+
+TEST_F(LocalZoneTest, AZoneOfTheSystemIsWhole) {
+  const std::string file = "/usr/share/zoneinfo/Europe/Berlin";
+  if (!std::filesystem::exists(file)) GTEST_SKIP() << file << " is not installed";
+  EXPECT_EQ(answers({[this, &file] { linkTo(file); }}), "18000 3600* with 0 warnings");
+}
+
+// One more of what a header counts, and one byte too few for it.
+TEST_F(LocalZoneTest, EveryCountOfAHeaderIsHeeded) {
+  const size_t block = zoneText(0).size();
+  const auto expectRefused = [this](std::string text, size_t count, size_t end, size_t bytesOfOne) {
+    ++text[count + 3];
+    text.insert(end, bytesOfOne - 1, '\0');
+    EXPECT_EQ(answers({[this, &text] {
+                folder_.write("short", text);
+                linkTo("short");
+              }}),
+              "18000 18000 with 1 warnings")
+        << count;
+  };
+  // Indicators of two kinds, leap seconds, transitions, kinds of local time, bytes of their names.
+  size_t count = 20;
+  for (const size_t bytesOfOne : {1, 1, 8, 5, 6, 1}) {
+    expectRefused(zoneText(-3600), count, block, bytesOfOne);
+    count += 4;
+  }
+  count = block + 20;
+  for (const size_t bytesOfOne : {1, 1, 12, 9, 6, 1}) {
+    expectRefused(longZoneText(-3600), count, 2 * block, bytesOfOne);
+    count += 4;
+  }
 }
 
 TEST_F(LocalZoneTest, AnotherMistakeAfterAUsableZoneIsToldAgain) {

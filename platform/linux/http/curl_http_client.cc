@@ -142,4 +142,8 @@ void CurlHttpClient::startDataTask(HttpRequest request, Completion completion) {
   worker_->enqueue(std::move(request), std::move(completion));
 }
 
+void CurlHttpClient::stop() {
+  worker_->stop();
+}
+
 }  // namespace tarnel

@@ -55,7 +55,7 @@ struct HttpClientOptions {
 //
 // A kept connection is looked at before it is used, and not used again when it has ended. When it ends later,
 // without a byte of an answer, GET and HEAD are sent again on a new one. Of anything else nobody can tell
-// whether the server took it: it fails, unless no byte of its body was sent.
+// whether the server took it: it fails, unless no byte of its body was handed to the HTTP library.
 //
 // Threads: any thread may call; the object must not be destroyed by a completion. A completion that throws is
 // logged and otherwise ignored.
@@ -72,6 +72,11 @@ class CurlHttpClient final : public HttpClient {
   MaybeError prepare();
 
   void startDataTask(HttpRequest request, Completion completion) override;
+
+  // Ends the client's thread: what has not ended completes with kHttpClientGoingAway before this returns, and
+  // what is started later does at once. For an owner whose completions use what is destroyed before the
+  // client. Not to be called by a completion; calling it again does nothing.
+  void stop();
 
  private:
   class Worker;

@@ -291,6 +291,19 @@ TEST(HttpFailureTest, completesEveryRequestWhenTheClientGoesAway) {
   EXPECT_EQ(late.waitFor(1)[0].error->code(), kHttpClientGoingAway);
 }
 
+TEST(HttpFailureTest, completesEveryRequestWhenTheClientIsStopped) {
+  RawHttpServer server(hang);
+  Answers answers;
+  QuietLog log;
+  CurlHttpClient client(log, plainOptions());
+  client.startDataTask(get(server.url()), answers.completion());
+  client.stop();
+  ASSERT_EQ(answers.count(), 1U);
+  client.startDataTask(get(server.url()), answers.completion());
+  for (const auto& result : answers.waitFor(2)) EXPECT_EQ(result.error->code(), kHttpClientGoingAway);
+  client.stop();
+}
+
 // New threads get a stack that no address space has room for.
 class NoNewThreads {
  public:

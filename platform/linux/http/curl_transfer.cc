@@ -11,6 +11,9 @@
 namespace tarnel::detail {
 namespace {
 
+// By taking fewer bytes than they were offered, the callbacks for an answer end the transfer.
+constexpr size_t kRefused = 0;
+
 bool hasHeader(const HttpRequest& request, std::string_view name) {
   return std::any_of(request.headers.begin(), request.headers.end(),
                      [name](const HttpHeader& header) { return equalIgnoringCase(header.name, name); });
@@ -172,20 +175,27 @@ bool CurlTransfer::refuseSecondSending() {
 }
 
 curl_socket_t CurlTransfer::onOpenSocket(void* self, curlsocktype /*purpose*/, curl_sockaddr* address) {
-  if (static_cast<CurlTransfer*>(self)->refuseSecondSending()) return CURL_SOCKET_BAD;
-  return socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
+  auto* const transfer = static_cast<CurlTransfer*>(self);
+  return transfer->guarded<curl_socket_t>(CURL_SOCKET_BAD, [transfer, address] {
+    if (transfer->refuseSecondSending()) return CURL_SOCKET_BAD;
+    return socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
+  });
 }
 
 // Comes before a hop's first byte, on a new connection as on a kept one.
 int CurlTransfer::onConnected(void* self, char* /*remote*/, char* /*local*/, int /*remotePort*/,
                               int /*localPort*/) {
   auto* const transfer = static_cast<CurlTransfer*>(self);
-  transfer->noteMoved();
-  return transfer->refuseSecondSending() ? CURL_PREREQFUNC_ABORT : CURL_PREREQFUNC_OK;
+  return transfer->guarded(CURL_PREREQFUNC_ABORT, [transfer] {
+    transfer->noteMoved();
+    return transfer->refuseSecondSending() ? CURL_PREREQFUNC_ABORT : CURL_PREREQFUNC_OK;
+  });
 }
 
 size_t CurlTransfer::onRead(char* into, size_t size, size_t count, void* self) {
-  return static_cast<CurlTransfer*>(self)->readBody(into, size * count);
+  auto* const transfer = static_cast<CurlTransfer*>(self);
+  return transfer->guarded<size_t>(
+      CURL_READFUNC_ABORT, [transfer, into, size, count] { return transfer->readBody(into, size * count); });
 }
 
 size_t CurlTransfer::readBody(char* into, size_t atMost) {
@@ -198,36 +208,43 @@ size_t CurlTransfer::readBody(char* into, size_t atMost) {
 int CurlTransfer::onProgress(void* self, curl_off_t /*downTotal*/, curl_off_t /*down*/,
                              curl_off_t /*upTotal*/, curl_off_t up) {
   auto* const transfer = static_cast<CurlTransfer*>(self);
-  if (up != std::exchange(transfer->sent_, up)) transfer->noteMoved();
-  return 0;
+  return transfer->guarded(1, [transfer, up] {
+    if (up != std::exchange(transfer->sent_, up)) transfer->noteMoved();
+    return 0;
+  });
 }
 
 size_t CurlTransfer::onBody(char* bytes, size_t size, size_t count, void* self) {
-  return static_cast<CurlTransfer*>(self)->receiveBody({bytes, size * count});
+  auto* const transfer = static_cast<CurlTransfer*>(self);
+  return transfer->guarded<size_t>(kRefused, [transfer, bytes, size, count] {
+    return transfer->receiveBody({bytes, size * count});
+  });
 }
 
 size_t CurlTransfer::onHeader(char* bytes, size_t size, size_t count, void* self) {
-  return static_cast<CurlTransfer*>(self)->receiveHeader({bytes, size * count});
+  auto* const transfer = static_cast<CurlTransfer*>(self);
+  return transfer->guarded<size_t>(kRefused, [transfer, bytes, size, count] {
+    return transfer->receiveHeader({bytes, size * count});
+  });
 }
 
-// The callbacks refuse by taking fewer bytes than they were offered.
 size_t CurlTransfer::receiveBody(std::string_view bytes) {
   noteMoved();
   const HttpClientOptions& options = context_.options;
   const size_t most = isAnswered() ? options.maxUnwantedBytes : options.maxAnswerBytes;
   if (received_ > most || bytes.size() > most - received_) {
     refusal_ = tooLarge("the answer is larger than " + std::to_string(most) + " bytes");
-    return 0;
+    return kRefused;
   }
   received_ += bytes.size();
   if (!request_.wantsBody) return bytes.size();
   if (context_.heldAnswerBytes + bytes.size() > options.maxHeldAnswerBytes) {
     refusal_ = tooLarge("the answers that are arriving are larger than " +
                         std::to_string(options.maxHeldAnswerBytes) + " bytes together");
-    return 0;
+    return kRefused;
   }
-  context_.heldAnswerBytes += bytes.size();
   data_ += bytes;
+  context_.heldAnswerBytes += bytes.size();
   return bytes.size();
 }
 
@@ -237,7 +254,7 @@ size_t CurlTransfer::receiveHeader(std::string_view line) {
   if (headerBytes_ > context_.options.maxHeaderBytes) {
     refusal_ = tooLarge("the answer's headers are larger than " +
                         std::to_string(context_.options.maxHeaderBytes) + " bytes");
-    return 0;
+    return kRefused;
   }
   if (received_ != 0) return line.size();  // trailers
   if (line.starts_with("HTTP/")) {
@@ -327,6 +344,7 @@ MaybeError CurlTransfer::redirectTo(const std::string& url, int status) {
 }
 
 Error CurlTransfer::errorOf(CURLcode code) {
+  if (isOutOfMemory_) return {kHttpErrorDomain, CURLE_OUT_OF_MEMORY, "out of memory"};
   if (refusal_) return *std::move(refusal_);
   if (code == CURLE_SEND_FAIL_REWIND) return notSentAgain();
   const std::string detail(errorText_.data());

@@ -94,6 +94,17 @@ class CurlTransfer {
   size_t receiveHeader(std::string_view line);
   void noteMoved() { moved_ = std::chrono::steady_clock::now(); }
   bool refuseSecondSending();
+  // Runs what the library calls. Its frames are C: nothing may be thrown through them. What is thrown, which
+  // can only be for want of memory, ends the transfer by `abort`, the value by which that callback says so.
+  template <class Value, class Callback>
+  Value guarded(Value abort, Callback callback) noexcept {
+    try {
+      return callback();
+    } catch (...) {
+      isOutOfMemory_ = true;
+      return abort;
+    }
+  }
   static curl_socket_t onOpenSocket(void* self, curlsocktype purpose, curl_sockaddr* address);
   static int onConnected(void* self, char* remote, char* local, int remotePort, int localPort);
   static int onProgress(void* self, curl_off_t downTotal, curl_off_t down, curl_off_t upTotal, curl_off_t up);
@@ -119,9 +130,10 @@ class CurlTransfer {
   std::vector<HttpHeader> headers_;
   size_t headerBytes_ = 0;
   bool headersEnded_ = false;
-  size_t received_ = 0;  // of the body
-  std::string data_;     // empty when it is not wanted
-  MaybeError refusal_;   // why a callback ended the transfer
+  size_t received_ = 0;         // of the body
+  std::string data_;            // empty when it is not wanted
+  MaybeError refusal_;          // why a callback ended the transfer
+  bool isOutOfMemory_ = false;  // that a callback ended it for that
 };
 
 }  // namespace tarnel::detail
