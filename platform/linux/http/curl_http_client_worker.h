@@ -38,6 +38,8 @@ class CurlHttpClient::Worker {
 
   MaybeError prepare();
   void enqueue(HttpRequest request, Completion completion);
+  // Any thread but the client's own, any number of times.
+  void stop();
 
  private:
   // A request on its way to the client's thread; one that was refused goes the same way, for its completion.
@@ -70,7 +72,6 @@ class CurlHttpClient::Worker {
   void end(uint64_t id, HttpResult result);
   void fail(uint64_t id, Error error) { end(id, active_.at(id).transfer->failure(std::move(error))); }
   void complete(Completion completion, HttpResult result);
-  void stop();
   void failAll();
 
   void loadCertificates();
