@@ -35,6 +35,7 @@ class CurlHttpClient::Worker {
   Worker(const Worker&) = delete;
   Worker& operator=(const Worker&) = delete;
   ~Worker() { stop(); }
+  void stop();
 
   MaybeError prepare();
   void enqueue(HttpRequest request, Completion completion);
@@ -70,7 +71,6 @@ class CurlHttpClient::Worker {
   void end(uint64_t id, HttpResult result);
   void fail(uint64_t id, Error error) { end(id, active_.at(id).transfer->failure(std::move(error))); }
   void complete(Completion completion, HttpResult result);
-  void stop();
   void failAll();
 
   void loadCertificates();
