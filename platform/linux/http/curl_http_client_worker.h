@@ -35,6 +35,7 @@ class CurlHttpClient::Worker {
   Worker(const Worker&) = delete;
   Worker& operator=(const Worker&) = delete;
   ~Worker() { stop(); }
+  void stop();
 
   MaybeError prepare();
   void enqueue(HttpRequest request, Completion completion);
