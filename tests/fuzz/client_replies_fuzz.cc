@@ -265,8 +265,7 @@ std::string Exchange::readFrame() {
 void Exchange::run() {
   const uint8_t setting = input_.byte();
   const bool isFramed = (setting & 1U) != 0;
-  require(connection_.start(core::Descriptor(daemon_.takeOther().release())).ok(),
-          "a connection can be made");
+  require(connection_.start(UniqueFd(daemon_.takeOther().release())).ok(), "a connection can be made");
   if ((setting & 0x10U) == 0) write(kWelcome);
   if (!isOver_ && connection_.isReady()) {
     reached("let in");

@@ -35,7 +35,6 @@ class CurlHttpClient::Worker {
   Worker(const Worker&) = delete;
   Worker& operator=(const Worker&) = delete;
   ~Worker() { stop(); }
-  void stop();
 
   MaybeError prepare();
   void enqueue(HttpRequest request, Completion completion);
