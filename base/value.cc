@@ -190,7 +190,7 @@ std::string Value::description() const {
     case Type::string:
       return *string();
     case Type::data:
-      return hexText(*data());
+      return "<" + hexText(*data()) + ">";
     case Type::array:
       return tarnel::description(*array());
     case Type::dictionary:
