@@ -39,8 +39,9 @@ bool isControl(std::string_view sequence) {
 
 std::string escapedForLog(std::string_view text) {
   if (text.ends_with('\n')) text.remove_suffix(1);
-  const size_t cut = text.size() > kMaxText ? text.size() - kMaxText : 0;
-  text = text.substr(0, kMaxText);
+  const size_t size = text.size();
+  text = wholeCharacters(text, kMaxText);
+  const size_t cut = size - text.size();
   std::string out;
   out.reserve(text.size());
   while (!text.empty()) {

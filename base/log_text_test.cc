@@ -12,6 +12,8 @@ TEST(LogText, TextIsKeptAndWhatIsNoneIsEscaped) {
   EXPECT_EQ(escapedForLog("end\n"), "end");
   EXPECT_EQ(escapedForLog("end\n\n"), "end\\n");
   EXPECT_EQ(escapedForLog(std::string(16384 + 7, 'x')), std::string(16384, 'x') + " [7 bytes more]");
+  EXPECT_EQ(escapedForLog(std::string(16383, 'x') + "\xE2\x82\xAC"),
+            std::string(16383, 'x') + " [3 bytes more]");
 }
 
 }  // namespace

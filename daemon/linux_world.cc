@@ -270,6 +270,8 @@ void LinuxWorld::finishPosts() {
     TARNEL_LOG(*log_, warning, "main: %zu requests had not ended after %lld seconds and are given up",
                prepared_->http.underWay(), static_cast<long long>(kLastPosts.count()));
   }
+  // While there is still a log: what is given up is told and counted there.
+  prepared_->curl.stop();
 }
 
 void LinuxWorld::stopLogging() {

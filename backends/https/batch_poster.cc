@@ -27,10 +27,13 @@ Error errorOf(const std::exception& exception) {
   return flushError(std::string("Can not flush: ") + exception.what());
 }
 
-// After a server error the backend is disabled; a client that goes away takes no more.
+// After a server error the backend is disabled. What the HTTP client refuses unsent it would refuse again:
+// making the rest only for that would keep the thread of all transfers busy.
 bool isLast(const Error& error) {
   if (error.domain() == kTarnelErrorDomain) return error.code() >= 500 && error.code() <= 599;
-  return error.domain() == kHttpErrorDomain && error.code() == kHttpClientGoingAway;
+  if (error.domain() != kHttpErrorDomain) return false;
+  return error.code() == kHttpClientGoingAway || error.code() == kHttpTooMuchQueued ||
+         error.code() == kHttpBadRequest;
 }
 
 }  // namespace

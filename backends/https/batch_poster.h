@@ -21,7 +21,7 @@ namespace tarnel {
 //
 // Each message is tried once, and one that fails does not stop the next. What is left is dropped, with a line
 // in the log that counts it, when nothing more can or may be posted: a server error disabled the backend (or
-// anything else did, meanwhile), there is no address, the HTTP client goes away.
+// anything else did, meanwhile), there is no address, the HTTP client takes no more.
 //
 // Threads: the owner calls makeFirst, takeRefused and start in this order, on one thread. Later messages are
 // made on the thread that brings the answer, the HTTP client's, where making one holds up the other transfers

@@ -190,14 +190,32 @@ TEST_F(HTTPSPostBackendPiecesTest, AClientThatGoesAwayIsGivenNoMore) {
   expectPosted(1);
 }
 
-TEST_F(HTTPSPostBackendPiecesTest, ARefusedMessageDoesNotStopTheNext) {
+TEST_F(HTTPSPostBackendPiecesTest, AMessageThatDoesNotArriveDoesNotStopTheNext) {
   world.http.holdAnswers(true);
   const auto backend = makeWithPieces();
   startFlush(*backend);
-  const Error refused(kHttpErrorDomain, kHttpTooMuchQueued, "too much");
-  for (int i = 0; i < 3; ++i) world.http.answerOldest({std::nullopt, std::nullopt, refused});
-  expectTold(refused);
+  const Error noRoute(kHttpErrorDomain, 7, "no route");
+  for (int i = 0; i < 3; ++i) world.http.answerOldest({std::nullopt, std::nullopt, noRoute});
+  expectTold(noRoute);
   EXPECT_EQ(posts(), 3U);
+}
+
+TEST_F(HTTPSPostBackendPiecesTest, WhatTheClientRefusesUnsentStopsTheRestWhichIsCounted) {
+  for (const int64_t code : {int64_t{kHttpTooMuchQueued}, int64_t{kHttpBadRequest}}) {
+    SCOPED_TRACE(code);
+    world.http.holdAnswers(true);
+    world.log.clear();
+    const size_t before = posts();
+    const auto backend = makeWithPieces();
+    const Error refused(kHttpErrorDomain, code, "not taken");
+    MaybeError told;
+    backend->flushMessagesWithCompletion(
+        [&told](const MaybeString& /*text*/, MaybeError error) { told = std::move(error); });
+    world.http.answerOldest({std::nullopt, std::nullopt, refused});
+    EXPECT_EQ(told, refused);
+    EXPECT_EQ(posts(), before + 1);
+    expectLost(2, "not taken");
+  }
 }
 
 TEST_F(HTTPSPostBackendPiecesTest, AnExceptionCostsOneMessage) {

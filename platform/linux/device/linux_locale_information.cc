@@ -99,7 +99,10 @@ LinuxLocaleInformation::LinuxLocaleInformation(std::optional<std::string> config
 void LinuxLocaleInformation::followZone() {
   const std::lock_guard guard(mutex_);
   const auto current = fileIdentity(zone_.file);
-  if (current == loaded_) return;
+  if (current == loaded_) {
+    isTold_ = false;  // another file that cannot be used is told anew
+    return;
+  }
   if (isThere(zone_.file)) {
     if (const auto problem = zoneProblem(zone_.file)) {
       if (!std::exchange(isTold_, true)) {

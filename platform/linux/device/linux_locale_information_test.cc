@@ -143,6 +143,11 @@ TEST_F(LocalZoneTest, WhatCannotBeUsedLeavesTheZoneOfBefore) {
             "18000 18000 18000 18000 18000 -3600* with 1 warnings");
 }
 
+TEST_F(LocalZoneTest, AnotherZoneThatCannotBeUsedIsToldAnew) {
+  EXPECT_EQ(answers({[this] { linkTo("text"); }, [this] { linkTo("east"); }, [this] { linkTo("text"); }}),
+            "18000 18000 18000 18000 with 2 warnings");
+}
+
 // As it is seen while it is copied to its place.
 TEST_F(LocalZoneTest, AZoneCutShortAnywhereLeavesTheZoneOfBefore) {
   for (const auto& whole : {zoneText(-3600), longZoneText(-3600)}) {

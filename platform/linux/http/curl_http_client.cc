@@ -123,7 +123,10 @@ void CurlHttpClient::Worker::stop() {
   {
     const std::lock_guard lock(mutex_);
     stopping_ = true;
-    if (!thread_.joinable()) return;
+    if (!thread_.joinable()) {
+      closed_ = true;  // no thread is started any more
+      return;
+    }
   }
   curl_multi_wakeup(multi_.get());
   thread_.join();

@@ -75,7 +75,8 @@ class CurlHttpClient final : public HttpClient {
 
   // Ends the client's thread: what has not ended completes with kHttpClientGoingAway before this returns, and
   // what is started later does at once. For an owner whose completions use what is destroyed before the
-  // client. Not to be called by a completion; calling it again does nothing.
+  // client. One thread at a time, and no completion, may call it; calling it again does
+  // nothing.
   void stop();
 
  private:

@@ -304,6 +304,16 @@ TEST(HttpFailureTest, completesEveryRequestWhenTheClientIsStopped) {
   client.stop();
 }
 
+TEST(HttpFailureTest, AClientThatWasStoppedBeforeItsFirstRequestStartsNoThread) {
+  Answers answers;
+  QuietLog log;
+  CurlHttpClient client(log, plainOptions());
+  client.stop();
+  client.startDataTask(get("http://127.0.0.1:1/"), answers.completion());
+  ASSERT_EQ(answers.count(), 1U) << "told before the call returns";
+  EXPECT_EQ(answers.waitFor(1)[0].error->code(), kHttpClientGoingAway);
+}
+
 // New threads get a stack that no address space has room for.
 class NoNewThreads {
  public:

@@ -38,7 +38,7 @@ class CurlHttpClient::Worker {
 
   MaybeError prepare();
   void enqueue(HttpRequest request, Completion completion);
-  // Any thread but the client's own, any number of times.
+  // Any number of times, by one thread at a time, which is not the client's own.
   void stop();
 
  private:
