@@ -5,8 +5,9 @@
 
 #include <algorithm>
 #include <array>
+#include <cstdint>
 
-#include "base/value.h"
+#include "base/utf8.h"
 
 namespace tarnel {
 namespace {
@@ -17,14 +18,6 @@ const locale_t kCaseLocale = newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr);
 
 constexpr char foldAscii(char c) {
   return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
-}
-
-// Length in bytes of the character that begins with this byte of well-formed UTF-8.
-constexpr size_t characterLength(char first) {
-  const auto byte = static_cast<unsigned char>(first);
-  if (byte < 0x80) return 1;
-  if (byte < 0xE0) return 2;
-  return byte < 0xF0 ? 3 : 4;
 }
 
 char32_t decodeCharacter(std::string_view bytes) {
@@ -63,7 +56,7 @@ std::string changeEach(std::string_view text, char32_t (*change)(char32_t)) {
   }
   changed.reserve(text.size());
   while (!text.empty()) {
-    const auto character = text.substr(0, characterLength(text.front()));
+    const auto character = text.substr(0, utf8CharacterLength(text));
     text.remove_prefix(character.size());
     appendCharacter(changed, change(decodeCharacter(character)));
   }

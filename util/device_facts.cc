@@ -1,18 +1,14 @@
 #include "util/device_facts.h"
 
-#include <algorithm>
 #include <cstring>
 #include <string_view>
 
 #include "base/text_case.h"
+#include "base/utf8.h"
 #include "tarnel/keys.h"
 
 namespace tarnel {
 namespace {
-
-constexpr bool isContinuation(char c) {
-  return (static_cast<unsigned char>(c) & 0xC0U) == 0x80U;
-}
 
 std::string loweredEntry(const MaybeDictionary& dictionary, std::string_view key) {
   const auto* text = dictionary ? findString(*dictionary, key) : nullptr;
@@ -53,10 +49,9 @@ void getUniqueDeviceID(DeviceInformation& deviceInformation, char* destination, 
   if (destination == nullptr || size == 0) return;
   const auto answer = deviceInformation.copyAnswer("UniqueDeviceID");
   if (!answer) return;
-  size_t length = std::min(answer->size(), size - 1);
-  while (length > 0 && length < answer->size() && isContinuation((*answer)[length])) --length;
-  std::memcpy(destination, answer->data(), length);
-  destination[length] = '\0';
+  const std::string_view fitting = wholeCharacters(*answer, size - 1);
+  std::memcpy(destination, fitting.data(), fitting.size());
+  destination[fitting.size()] = '\0';
   destination[size - 1] = '\0';
 }
 
